@@ -1,0 +1,304 @@
+#include "OPCGroup.h"
+
+#include "ComPtr.h"
+#include "ComUtil.h"
+#include "IdMgr.h"
+#include "OpcErrors.h"
+#include "TaskMem.h"
+#include "Trace.h"
+
+#include <cmath>
+
+namespace {
+constexpr DWORD kMinUpdateRate = 10;
+
+bool ValidDeadband(FLOAT value)
+{
+    // Written so that NaN fails both comparisons.
+    return value >= 0.0f && value <= 100.0f;
+}
+} // namespace
+
+COPCGroup *COPCGroup::Create()
+{
+    COPCGroup *group = NewComObject<COPCGroup>();
+    if (group && group->m_serverHandle == 0) {
+        // No identifier left in the whole number space: refuse the group
+        // rather than hand out the invalid handle 0.
+        DiscardComObject(group);
+        return nullptr;
+    }
+    return group;
+}
+
+COPCGroup::COPCGroup() : m_idle(CreateEventW(nullptr, TRUE, TRUE, nullptr))
+{
+    if (!m_idle)
+        INTERNAL_ASSERT_FAILED("CreateEvent for the group's idle event");
+    m_serverHandle = CIdMgr::Instance().GetId();
+}
+
+void *COPCGroup::FindInterface(REFIID riid)
+{
+    if (IsEqualIID(riid, IID_IOPCGroupStateMgt))
+        return static_cast<IOPCGroupStateMgt *>(this);
+    if (IsEqualIID(riid, IID_IOPCItemMgt))
+        return static_cast<IOPCItemMgt *>(this);
+    return nullptr;
+}
+
+void COPCGroup::FinalRelease()
+{
+    Destroy();
+}
+
+void COPCGroup::SetOwner(IOPCServer *server, CGroupRegistry *registry)
+{
+    CSingleLock lock(&m_lock);
+    m_server = server;
+    m_registry = registry;
+}
+
+std::wstring COPCGroup::Name()
+{
+    CSingleLock lock(&m_lock);
+    return m_name;
+}
+
+bool COPCGroup::IsActive()
+{
+    CSingleLock lock(&m_lock);
+    return m_active != FALSE;
+}
+
+LONG COPCGroup::AddPendingWork()
+{
+    CSingleLock lock(&m_lock);
+    if (++m_pendingWork == 1 && !ResetEvent(m_idle.Get()))
+        INTERNAL_ASSERT_FAILED("ResetEvent for the group's idle event");
+    return m_pendingWork;
+}
+
+LONG COPCGroup::ReleasePendingWork()
+{
+    CSingleLock lock(&m_lock);
+    if (--m_pendingWork == 0 && !SetEvent(m_idle.Get()))
+        INTERNAL_ASSERT_FAILED("SetEvent for the group's idle event");
+    return m_pendingWork;
+}
+
+void COPCGroup::BeginRemoval()
+{
+    {
+        CSingleLock lock(&m_lock);
+        m_removing = true;
+        SetActive(FALSE);
+    }
+    if (m_idle && WaitForSingleObject(m_idle.Get(), INFINITE) != WAIT_OBJECT_0)
+        INTERNAL_ASSERT_FAILED("wait for the group's idle event");
+}
+
+void COPCGroup::Destroy()
+{
+    CSingleLock lock(&m_lock);
+    if (m_destroyed)
+        return;
+    m_destroyed = true;
+    m_removing = true;
+    // Items arrive with item management; the group owns them.
+    m_items.clear();
+    if (m_serverHandle != 0)
+        CIdMgr::Instance().ReleaseId(m_serverHandle);
+    if (!m_idle.Reset())
+        INTERNAL_ASSERT_FAILED("CloseHandle for the group's idle event");
+    m_server = nullptr;
+    m_registry = nullptr;
+}
+
+void COPCGroup::SetActive(BOOL active)
+{
+    CSingleLock lock(&m_lock);
+    active = active ? TRUE : FALSE;
+    if (m_active == active)
+        return;
+    m_active = active;
+    // The update scanner and the items' out-of-service quality join here with
+    // subscriptions.
+}
+
+STDMETHODIMP COPCGroup::GetState(DWORD *pUpdateRate, BOOL *pActive, LPWSTR *ppName, LONG *pTimeBias,
+                                 FLOAT *pPercentDeadband, DWORD *pLCID, OPCHANDLE *phClientGroup,
+                                 OPCHANDLE *phServerGroup)
+{
+    return ComBoundary([&]() -> HRESULT {
+        CSingleLock lock(&m_lock);
+        if (m_removing)
+            return E_FAIL;
+        if (!IsWritableOut(pUpdateRate) || !IsWritableOut(pActive) || !IsWritableOut(ppName) ||
+            !IsWritableOut(pTimeBias) || !IsWritableOut(pPercentDeadband) || !IsWritableOut(pLCID) ||
+            !IsWritableOut(phClientGroup) || !IsWritableOut(phServerGroup))
+            return E_INVALIDARG;
+        *pUpdateRate = m_updateRate;
+        *pActive = m_active;
+        *pTimeBias = m_timeBias;
+        *pPercentDeadband = m_percentDeadband;
+        *pLCID = m_lcid;
+        *phClientGroup = m_clientHandle;
+        *phServerGroup = m_serverHandle;
+        *ppName = TaskStrDup(m_name.c_str());
+        return *ppName ? S_OK : E_OUTOFMEMORY;
+    });
+}
+
+STDMETHODIMP COPCGroup::SetState(DWORD *pRequestedUpdateRate, DWORD *pRevisedUpdateRate, BOOL *pActive, LONG *pTimeBias,
+                                 FLOAT *pPercentDeadband, DWORD *pLCID, OPCHANDLE *phClientGroup)
+{
+    return ComBoundary([&]() -> HRESULT {
+        CSingleLock lock(&m_lock);
+        if (m_removing)
+            return E_FAIL;
+        if (!IsWritableOut(pRevisedUpdateRate))
+            return E_INVALIDARG;
+        if (pPercentDeadband && !ValidDeadband(*pPercentDeadband))
+            return E_INVALIDARG;
+        m_percentDeadband = pPercentDeadband ? *pPercentDeadband : 0.0f;
+        m_deadbandFraction = m_percentDeadband / 100.0;
+
+        HRESULT result = S_OK;
+        if (pRequestedUpdateRate) {
+            m_updateRate = *pRequestedUpdateRate;
+            if (m_updateRate < kMinUpdateRate) {
+                m_updateRate = kMinUpdateRate;
+                result = OPC_S_UNSUPPORTEDRATE;
+            }
+            // An active group's next scan moves with the rate once the
+            // scanner queues groups.
+            *pRevisedUpdateRate = m_updateRate;
+        }
+        if (pTimeBias)
+            m_timeBias = *pTimeBias;
+        if (pLCID)
+            m_lcid = *pLCID;
+        if (phClientGroup)
+            m_clientHandle = *phClientGroup;
+        if (pActive)
+            SetActive(*pActive);
+        return result;
+    });
+}
+
+STDMETHODIMP COPCGroup::SetName(LPCWSTR szName)
+{
+    return ComBoundary([&]() -> HRESULT {
+        CSingleLock lock(&m_lock);
+        if (m_removing || !m_registry)
+            return E_FAIL;
+        std::wstring name;
+        if (!szName) {
+            wchar_t generated[kDefaultGroupNameChars];
+            name = MakeDefaultGroupName(generated);
+        } else {
+            name = szName;
+            if (name.empty())
+                return E_INVALIDARG;
+            if (m_registry->FindName(name))
+                return OPC_E_DUPLICATENAME;
+        }
+        if (!m_name.empty() && m_registry->EraseName(m_name) != 1) {
+            INTERNAL_ASSERT_FAILED("group name missing from the name index");
+            return E_FAIL;
+        }
+        if (!m_registry->InsertName(name, this)) {
+            // Two concurrent renames to one name, or a generated name that a
+            // client had already taken.
+            INTERNAL_ASSERT_FAILED("group name already in the name index");
+            m_name.clear();
+            return E_FAIL;
+        }
+        m_name = std::move(name);
+        return S_OK;
+    });
+}
+
+STDMETHODIMP COPCGroup::CloneGroup(LPCWSTR szName, REFIID riid, LPUNKNOWN *ppUnk)
+{
+    return ComBoundary([&]() -> HRESULT {
+        // The copy of the state is taken under the group lock, which is then
+        // released: AddGroup and RemoveGroup take the server lock, which
+        // comes before any group lock.
+        ComPtr<IOPCServer> server;
+        DWORD rate;
+        OPCHANDLE clientHandle;
+        LONG timeBias;
+        FLOAT deadband;
+        LCID lcid;
+        {
+            CSingleLock lock(&m_lock);
+            if (m_removing)
+                return E_FAIL;
+            if (!IsWritableOut(ppUnk))
+                return E_INVALIDARG;
+            *ppUnk = nullptr;
+            if (!m_server)
+                return E_FAIL;
+            server = ComPtr<IOPCServer>(m_server);
+            rate = m_updateRate;
+            clientHandle = m_clientHandle;
+            timeBias = m_timeBias;
+            deadband = m_percentDeadband;
+            lcid = m_lcid;
+        }
+
+        OPCHANDLE newHandle = 0;
+        DWORD revisedRate = 0;
+        ComPtr<IOPCItemMgt> itemMgt;
+        HRESULT hr = server->AddGroup(szName, FALSE, rate, clientHandle, &timeBias, &deadband, lcid, &newHandle,
+                                      &revisedRate, IID_IOPCItemMgt, reinterpret_cast<IUnknown **>(itemMgt.Out()));
+        if (hr != S_OK)
+            return hr;
+        hr = itemMgt->QueryInterface(riid, reinterpret_cast<void **>(ppUnk));
+        if (FAILED(hr)) {
+            *ppUnk = nullptr;
+            itemMgt.Reset();
+            server->RemoveGroup(newHandle, TRUE);
+            return hr;
+        }
+        // The items are copied once item management serves them.
+        return S_OK;
+    });
+}
+
+STDMETHODIMP COPCGroup::AddItems(DWORD, OPCITEMDEF *, OPCITEMRESULT **, HRESULT **)
+{
+    return E_NOTIMPL;
+}
+
+STDMETHODIMP COPCGroup::ValidateItems(DWORD, OPCITEMDEF *, BOOL, OPCITEMRESULT **, HRESULT **)
+{
+    return E_NOTIMPL;
+}
+
+STDMETHODIMP COPCGroup::RemoveItems(DWORD, OPCHANDLE *, HRESULT **)
+{
+    return E_NOTIMPL;
+}
+
+STDMETHODIMP COPCGroup::SetActiveState(DWORD, OPCHANDLE *, BOOL, HRESULT **)
+{
+    return E_NOTIMPL;
+}
+
+STDMETHODIMP COPCGroup::SetClientHandles(DWORD, OPCHANDLE *, OPCHANDLE *, HRESULT **)
+{
+    return E_NOTIMPL;
+}
+
+STDMETHODIMP COPCGroup::SetDatatypes(DWORD, OPCHANDLE *, VARTYPE *, HRESULT **)
+{
+    return E_NOTIMPL;
+}
+
+STDMETHODIMP COPCGroup::CreateEnumerator(REFIID, LPUNKNOWN *)
+{
+    return E_NOTIMPL;
+}

@@ -1,0 +1,88 @@
+#pragma once
+// The OPC group: its state, its items and the interfaces a client uses on it.
+// Created only by the server object's AddGroup (and for item properties).
+#include "ComObject.h"
+#include "GroupRegistry.h"
+#include "Handle.h"
+#include "SyncObject.h"
+#include "opcda.h"
+
+#include <map>
+#include <string>
+
+class COPCItem;
+
+class COPCGroup : public CComObjectRoot, public IOPCGroupStateMgt, public IOPCItemMgt {
+public:
+    // A group with a fresh server handle and no references; null when out of
+    // memory or when no identifier is left.
+    static COPCGroup *Create();
+
+    DECLARE_COM_UNKNOWN()
+
+    // IOPCGroupStateMgt
+    STDMETHODIMP GetState(DWORD *pUpdateRate, BOOL *pActive, LPWSTR *ppName, LONG *pTimeBias, FLOAT *pPercentDeadband,
+                          DWORD *pLCID, OPCHANDLE *phClientGroup, OPCHANDLE *phServerGroup) override;
+    STDMETHODIMP SetState(DWORD *pRequestedUpdateRate, DWORD *pRevisedUpdateRate, BOOL *pActive, LONG *pTimeBias,
+                          FLOAT *pPercentDeadband, DWORD *pLCID, OPCHANDLE *phClientGroup) override;
+    STDMETHODIMP SetName(LPCWSTR szName) override;
+    STDMETHODIMP CloneGroup(LPCWSTR szName, REFIID riid, LPUNKNOWN *ppUnk) override;
+
+    // IOPCItemMgt: items are not served yet.
+    STDMETHODIMP AddItems(DWORD dwCount, OPCITEMDEF *pItemArray, OPCITEMRESULT **ppAddResults,
+                          HRESULT **ppErrors) override;
+    STDMETHODIMP ValidateItems(DWORD dwCount, OPCITEMDEF *pItemArray, BOOL bBlobUpdate,
+                               OPCITEMRESULT **ppValidationResults, HRESULT **ppErrors) override;
+    STDMETHODIMP RemoveItems(DWORD dwCount, OPCHANDLE *phServer, HRESULT **ppErrors) override;
+    STDMETHODIMP SetActiveState(DWORD dwCount, OPCHANDLE *phServer, BOOL bActive, HRESULT **ppErrors) override;
+    STDMETHODIMP SetClientHandles(DWORD dwCount, OPCHANDLE *phServer, OPCHANDLE *phClient, HRESULT **ppErrors) override;
+    STDMETHODIMP SetDatatypes(DWORD dwCount, OPCHANDLE *phServer, VARTYPE *pRequestedDatatypes,
+                              HRESULT **ppErrors) override;
+    STDMETHODIMP CreateEnumerator(REFIID riid, LPUNKNOWN *ppUnk) override;
+
+    // Set by AddGroup: the owning server (not referenced) and its registry.
+    void SetOwner(IOPCServer *server, CGroupRegistry *registry);
+    OPCHANDLE ServerHandle() const { return m_serverHandle; }
+    std::wstring Name();
+    bool IsActive();
+
+    // Scanner entries and transactions that refer to the group.
+    LONG AddPendingWork();
+    LONG ReleasePendingWork();
+
+    // Removal: sets the removing flag, makes the group inactive and waits until
+    // no scan and no transaction of the group is queued or running.
+    void BeginRemoval();
+    // Destroys the items and gives the handle back; later calls fail with
+    // E_FAIL. Runs once, at forced removal or at the last release.
+    void Destroy();
+    void SetActive(BOOL active);
+
+protected:
+    void *FindInterface(REFIID riid) override;
+    void FinalRelease() override;
+
+private:
+    template <class T, class... Args> friend T *NewComObject(Args &&...args);
+    COPCGroup();
+    ~COPCGroup() override = default;
+
+    CCriticalSection m_lock; // guards every field below
+    UniqueHandle m_idle;     // manual reset; signalled while no work is pending
+    LONG m_pendingWork = 0;
+    IOPCServer *m_server = nullptr;
+    CGroupRegistry *m_registry = nullptr;
+    std::map<OPCHANDLE, COPCItem *> m_items;
+    bool m_removing = false;
+    bool m_destroyed = false;
+    DWORD m_updateRate = 0;
+    BOOL m_active = FALSE;
+    BOOL m_enable = TRUE;
+    std::wstring m_name;
+    LONG m_timeBias = 0;
+    FLOAT m_percentDeadband = 0.0f;
+    double m_deadbandFraction = 0.0;
+    LCID m_lcid = 0;
+    OPCHANDLE m_clientHandle = 0;
+    OPCHANDLE m_serverHandle = 0;
+};

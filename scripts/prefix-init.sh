@@ -1,0 +1,23 @@
+#!/bin/sh
+# Creates the build's private Wine prefix (once) and registers the proxy/stub
+# DLL and the server in it. Usage: prefix-init.sh BUILD_DIR
+set -eu
+BUILD_DIR=$(cd "$1" && pwd)
+RUN="$BUILD_DIR/wine-run.sh"
+export WINEPREFIX="$BUILD_DIR/wineprefix"
+
+if [ ! -f "$WINEPREFIX/system.reg" ]; then
+    echo "Creating Wine prefix $WINEPREFIX"
+    WINEDEBUG=-all WINEDLLOVERRIDES="mscoree,mshtml=" wineboot -i >/dev/null 2>&1
+    wineserver -w
+fi
+
+"$RUN" regsvr32 /s "$BUILD_DIR/bin/SkylarcOPCProxy.dll"
+# The executable carries no type library, so "RegServer" writes every record
+# and then exits with the type-library failure; check the records instead.
+"$RUN" "$BUILD_DIR/bin/Local.exe" /RegServer || true
+"$RUN" reg query 'HKCR\CLSID\{5B1E7A20-4C3D-11d3-9A44-00A0C9E2B7F1}\LocalServer32' >/dev/null 2>&1 || {
+    echo "prefix-init: the server did not register" >&2
+    exit 1
+}
+echo "Server and proxy/stub registered in $WINEPREFIX"

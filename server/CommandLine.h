@@ -1,0 +1,9 @@
+#pragma once
+// The registration switches of the server's command line.
+
+enum class ServerCommand { Run, RegServer, UnregServer };
+
+// Finds "-" or "/" followed by "RegServer" or "UnregServer" (any letter case)
+// that runs to the very end of the command line. Anything else runs the
+// process as a server, including the switch the COM runtime adds.
+ServerCommand FindServerCommand(const char *commandLine);

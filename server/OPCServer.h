@@ -1,0 +1,63 @@
+#pragma once
+// The OPC server object that clients create: it owns their groups, indexes
+// them by name and by server handle, and reports the server status.
+#include "ComObject.h"
+#include "GroupRegistry.h"
+#include "SyncObject.h"
+#include "opcda.h"
+
+#include <string>
+
+class CAsyncIOMgr;
+class COPCGroup;
+class CUpdateScanMgr;
+
+class COPCServer : public CComObjectRoot, public IOPCServer {
+public:
+    // A server object bound to outer (aggregated) or plain; no references yet.
+    static COPCServer *Create(IUnknown *outer);
+
+    // Starts the shared services and takes the two singleton references.
+    HRESULT FinalConstruct();
+
+    DECLARE_COM_UNKNOWN()
+
+    // IOPCServer
+    STDMETHODIMP AddGroup(LPCWSTR szName, BOOL bActive, DWORD dwRequestedUpdateRate, OPCHANDLE hClientGroup,
+                          LONG *pTimeBias, FLOAT *pPercentDeadband, DWORD dwLCID, OPCHANDLE *phServerGroup,
+                          DWORD *pRevisedUpdateRate, REFIID riid, LPUNKNOWN *ppUnk) override;
+    STDMETHODIMP GetErrorString(HRESULT dwError, LCID dwLocale, LPWSTR *ppString) override;
+    STDMETHODIMP GetGroupByName(LPCWSTR szName, REFIID riid, LPUNKNOWN *ppUnk) override;
+    STDMETHODIMP GetStatus(OPCSERVERSTATUS **ppServerStatus) override;
+    STDMETHODIMP RemoveGroup(OPCHANDLE hServerGroup, BOOL bForce) override;
+    STDMETHODIMP CreateGroupEnumerator(OPCENUMSCOPE dwScope, REFIID riid, LPUNKNOWN *ppUnk) override;
+
+    // Called by the update scanner when it has delivered a data change.
+    void SetLastUpdateTime(const FILETIME &time);
+
+protected:
+    void *FindInterface(REFIID riid) override;
+    void FinalRelease() override;
+
+private:
+    template <class T, class... Args> friend T *NewComObject(Args &&...args);
+    explicit COPCServer(IUnknown *outer) : CComObjectRoot(outer) {}
+    ~COPCServer() override = default;
+
+    HRESULT AddGroupLocked(LPCWSTR szName, BOOL bActive, DWORD dwRequestedUpdateRate, OPCHANDLE hClientGroup,
+                           LONG *pTimeBias, FLOAT *pPercentDeadband, DWORD dwLCID, OPCHANDLE *phServerGroup,
+                           DWORD *pRevisedUpdateRate, REFIID riid, LPUNKNOWN *ppUnk);
+    void UndoAddGroup(COPCGroup *group, LPUNKNOWN *ppUnk);
+    HRESULT EnumerateGroups(REFIID riid, LPUNKNOWN *ppUnk);
+
+    CUpdateScanMgr *m_scanMgr = nullptr;
+    CAsyncIOMgr *m_asyncMgr = nullptr;
+    CCriticalSection m_lock;
+    FILETIME m_startTime = {};
+    FILETIME m_lastUpdateTime = {};
+    DWORD m_groupCount = 0;
+    CGroupRegistry m_registry;
+    LCID m_locale = LOCALE_SYSTEM_DEFAULT;
+    std::wstring m_clientName;
+    bool m_counted = false; // counted among the server objects of the process
+};

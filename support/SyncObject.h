@@ -1,0 +1,71 @@
+#pragma once
+// Lockable objects and the scoped lock holder used for every lock in the server.
+#include <windows.h>
+
+class CSyncObject {
+public:
+    virtual ~CSyncObject() = default;
+    virtual BOOL Lock(DWORD timeout = INFINITE) = 0;
+    virtual BOOL Unlock() = 0;
+};
+
+// A recursive Win32 critical section; the timeout is ignored.
+class CCriticalSection : public CSyncObject {
+public:
+    CCriticalSection() { InitializeCriticalSection(&m_cs); }
+    ~CCriticalSection() override { DeleteCriticalSection(&m_cs); }
+    CCriticalSection(const CCriticalSection &) = delete;
+    CCriticalSection &operator=(const CCriticalSection &) = delete;
+
+    BOOL Lock(DWORD = INFINITE) override
+    {
+        EnterCriticalSection(&m_cs);
+        return TRUE;
+    }
+    BOOL Unlock() override
+    {
+        LeaveCriticalSection(&m_cs);
+        return TRUE;
+    }
+
+private:
+    CRITICAL_SECTION m_cs;
+};
+
+// Scoped holder: counts its own acquisitions and undoes them all when it goes
+// out of scope, normally or by an exception.
+class CSingleLock {
+public:
+    explicit CSingleLock(CSyncObject *object, bool lockNow = true) : m_object(object)
+    {
+        if (lockNow)
+            Lock();
+    }
+    ~CSingleLock()
+    {
+        while (m_count > 0)
+            Unlock();
+    }
+    CSingleLock(const CSingleLock &) = delete;
+    CSingleLock &operator=(const CSingleLock &) = delete;
+
+    BOOL Lock(DWORD timeout = INFINITE)
+    {
+        BOOL taken = m_object->Lock(timeout);
+        if (taken)
+            ++m_count;
+        return taken;
+    }
+    BOOL Unlock()
+    {
+        if (m_count == 0)
+            return FALSE;
+        --m_count;
+        return m_object->Unlock();
+    }
+    bool IsLocked() const { return m_count > 0; }
+
+private:
+    CSyncObject *m_object;
+    unsigned m_count = 0;
+};

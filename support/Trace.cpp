@@ -1,0 +1,51 @@
+#include "Trace.h"
+
+#include <windows.h>
+
+#include <atomic>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+
+namespace {
+std::atomic<long> g_failures{0};
+
+bool TraceToStderr()
+{
+    static const bool enabled = [] {
+        const char *v = getenv("SKYLARC_TRACE");
+        return v && strcmp(v, "1") == 0;
+    }();
+    return enabled;
+}
+
+void Emit(const char *text)
+{
+    OutputDebugStringA(text);
+    if (TraceToStderr())
+        fputs(text, stderr);
+}
+} // namespace
+
+void Trace(const char *format, ...)
+{
+    char text[1024];
+    va_list args;
+    va_start(args, format);
+    vsnprintf(text, sizeof text, format, args);
+    va_end(args);
+    Emit(text);
+}
+
+void AssertionFailure(const char *file, int line, const char *what)
+{
+    ++g_failures;
+    char text[512];
+    snprintf(text, sizeof text, "internal assertion failure: %s (%s:%d)\n", what, file, line);
+    Emit(text);
+}
+
+long AssertionFailureCount()
+{
+    return g_failures.load();
+}
