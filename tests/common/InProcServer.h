@@ -1,0 +1,84 @@
+#pragma once
+// Helpers for tests that create server objects in this process through the
+// server's own class object.
+#include "ClassFactory.h"
+#include "ComPtr.h"
+#include "TaskMem.h"
+#include "opcda.h"
+
+#include <gtest/gtest.h>
+
+#include <string>
+
+inline ComPtr<IOPCServer> CreateInProcServer()
+{
+    static CServerClassFactory factory;
+    ComPtr<IOPCServer> server;
+    EXPECT_EQ(factory.CreateInstance(nullptr, IID_IOPCServer, reinterpret_cast<void **>(server.Out())), S_OK);
+    return server;
+}
+
+struct AddedGroup {
+    HRESULT hr = E_FAIL;
+    OPCHANDLE handle = 0;
+    DWORD revisedRate = 0;
+    ComPtr<IOPCGroupStateMgt> group;
+};
+
+inline AddedGroup AddGroup(IOPCServer *server, const wchar_t *name, DWORD rate = 1000, BOOL active = FALSE,
+                           FLOAT *deadband = nullptr, LONG *bias = nullptr)
+{
+    AddedGroup g;
+    g.hr = server->AddGroup(name, active, rate, 42, bias, deadband, 0x409, &g.handle, &g.revisedRate,
+                            IID_IOPCGroupStateMgt, reinterpret_cast<IUnknown **>(g.group.Out()));
+    return g;
+}
+
+struct GroupState {
+    HRESULT hr = E_FAIL;
+    DWORD rate = 0;
+    BOOL active = FALSE;
+    std::wstring name;
+    LONG bias = 0;
+    FLOAT deadband = 0;
+    DWORD lcid = 0;
+    OPCHANDLE client = 0;
+    OPCHANDLE server = 0;
+};
+
+inline GroupState StateOf(IOPCGroupStateMgt *group)
+{
+    GroupState s;
+    LPWSTR name = nullptr;
+    s.hr = group->GetState(&s.rate, &s.active, &name, &s.bias, &s.deadband, &s.lcid, &s.client, &s.server);
+    if (name) {
+        s.name = name;
+        CoTaskMemFree(name);
+    }
+    return s;
+}
+
+inline DWORD GroupCount(IOPCServer *server)
+{
+    OPCSERVERSTATUS *status = nullptr;
+    if (FAILED(server->GetStatus(&status)))
+        return 0xFFFFFFFF;
+    DWORD count = status->dwGroupCount;
+    CoTaskMemFree(status->szVendorInfo);
+    CoTaskMemFree(status);
+    return count;
+}
+
+inline std::vector<std::wstring> GroupNames(IOPCServer *server, OPCENUMSCOPE scope = OPC_ENUM_ALL)
+{
+    std::vector<std::wstring> names;
+    ComPtr<IEnumString> e;
+    if (FAILED(server->CreateGroupEnumerator(scope, IID_IEnumString, reinterpret_cast<IUnknown **>(e.Out()))))
+        return names;
+    LPOLESTR s = nullptr;
+    while (e->Next(1, &s, nullptr) == S_OK) {
+        names.emplace_back(s ? s : L"");
+        CoTaskMemFree(s);
+    }
+    return names;
+}

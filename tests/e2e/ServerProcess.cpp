@@ -1,0 +1,96 @@
+#include "ServerProcess.h"
+
+#include "Handle.h"
+
+#include <tlhelp32.h>
+
+#include <cstdlib>
+
+const CLSID CLSID_SkylarcOPCServerE2E = {0x5b1e7a20, 0x4c3d, 0x11d3, {0x9a, 0x44, 0x00, 0xa0, 0xc9, 0xe2, 0xb7, 0xf1}};
+
+int CountServerProcesses()
+{
+    UniqueHandle snapshot(CreateToolhelp32Snapshot(TH32CS_SNAPPROCESS, 0));
+    if (!snapshot)
+        return -1;
+    PROCESSENTRY32W entry = {};
+    entry.dwSize = sizeof entry;
+    int count = 0;
+    for (BOOL more = Process32FirstW(snapshot.Get(), &entry); more; more = Process32NextW(snapshot.Get(), &entry)) {
+        if (_wcsicmp(entry.szExeFile, L"Local.exe") == 0)
+            ++count;
+    }
+    return count;
+}
+
+bool WaitForNoServerProcess(DWORD timeoutMs)
+{
+    DWORD start = GetTickCount();
+    while (CountServerProcesses() != 0) {
+        if (GetTickCount() - start > timeoutMs)
+            return false;
+        Sleep(100);
+    }
+    return true;
+}
+
+std::wstring ServerExePath()
+{
+    if (const char *dir = getenv("SKYLARC_BIN_DIR")) {
+        // A Unix path from CTest: Wine maps it through drive Z:.
+        std::string unix(dir);
+        std::wstring path = L"Z:";
+        for (char c : unix)
+            path += c == '/' ? L'\\' : static_cast<wchar_t>(c);
+        return path + L"\\Local.exe";
+    }
+    wchar_t self[MAX_PATH];
+    GetModuleFileNameW(nullptr, self, MAX_PATH);
+    std::wstring path(self);
+    return path.substr(0, path.find_last_of(L'\\') + 1) + L"Local.exe";
+}
+
+HANDLE StartProcess(const std::wstring &commandLine)
+{
+    STARTUPINFOW si = {};
+    si.cb = sizeof si;
+    PROCESS_INFORMATION pi = {};
+    std::wstring mutableLine = commandLine;
+    if (!CreateProcessW(nullptr, mutableLine.data(), nullptr, nullptr, FALSE, 0, nullptr, nullptr, &si, &pi))
+        return nullptr;
+    CloseHandle(pi.hThread);
+    return pi.hProcess;
+}
+
+long RunAndWait(const std::wstring &commandLine, DWORD timeoutMs)
+{
+    UniqueHandle process(StartProcess(commandLine));
+    if (!process)
+        return -1;
+    if (WaitForSingleObject(process.Get(), timeoutMs) != WAIT_OBJECT_0) {
+        TerminateProcess(process.Get(), 1);
+        WaitForSingleObject(process.Get(), 5000);
+        return -1;
+    }
+    DWORD code = 0;
+    GetExitCodeProcess(process.Get(), &code);
+    return static_cast<long>(code);
+}
+
+bool KeyExists(HKEY root, const std::wstring &path)
+{
+    HKEY key;
+    if (RegOpenKeyExW(root, path.c_str(), 0, KEY_READ, &key) != ERROR_SUCCESS)
+        return false;
+    RegCloseKey(key);
+    return true;
+}
+
+std::wstring ReadString(HKEY root, const std::wstring &path, const wchar_t *name)
+{
+    wchar_t data[1024] = {};
+    DWORD size = sizeof data;
+    if (RegGetValueW(root, path.c_str(), name, RRF_RT_REG_SZ, nullptr, data, &size) != ERROR_SUCCESS)
+        return L"<missing>";
+    return data;
+}

@@ -1,0 +1,24 @@
+#pragma once
+// Helpers for end-to-end tests: the server's processes in this Wine prefix,
+// running the executable with switches, and reading the registry back.
+#include <windows.h>
+
+#include <string>
+
+extern const CLSID CLSID_SkylarcOPCServerE2E;
+
+// Number of running processes whose image is Local.exe.
+int CountServerProcesses();
+// Waits up to timeoutMs for no server process to be left.
+bool WaitForNoServerProcess(DWORD timeoutMs);
+// Full path of Local.exe (from SKYLARC_BIN_DIR, else beside this program).
+std::wstring ServerExePath();
+// Starts commandLine; null handle on failure.
+HANDLE StartProcess(const std::wstring &commandLine);
+// Runs commandLine and returns its exit code, or -1 if it cannot be started
+// or does not end within timeoutMs.
+long RunAndWait(const std::wstring &commandLine, DWORD timeoutMs);
+
+bool KeyExists(HKEY root, const std::wstring &path);
+// Value of a REG_SZ value (name null: the default), or "<missing>".
+std::wstring ReadString(HKEY root, const std::wstring &path, const wchar_t *name);
