@@ -52,11 +52,10 @@ void COPCGroup::FinalRelease()
     Destroy();
 }
 
-void COPCGroup::SetOwner(IOPCServer *server, CGroupRegistry *registry)
+void COPCGroup::SetOwner(CGroupOwner *owner)
 {
     CSingleLock lock(&m_lock);
-    m_server = server;
-    m_registry = registry;
+    m_owner = owner;
 }
 
 std::wstring COPCGroup::Name()
@@ -111,8 +110,7 @@ void COPCGroup::Destroy()
         CIdMgr::Instance().ReleaseId(m_serverHandle);
     if (!m_idle.Reset())
         INTERNAL_ASSERT_FAILED("CloseHandle for the group's idle event");
-    m_server = nullptr;
-    m_registry = nullptr;
+    m_owner = nullptr;
 }
 
 void COPCGroup::SetActive(BOOL active)
@@ -191,8 +189,9 @@ STDMETHODIMP COPCGroup::SetName(LPCWSTR szName)
 {
     return ComBoundary([&]() -> HRESULT {
         CSingleLock lock(&m_lock);
-        if (m_removing || !m_registry)
+        if (m_removing || !m_owner)
             return E_FAIL;
+        CGroupRegistry &registry = m_owner->Registry();
         std::wstring name;
         if (!szName) {
             wchar_t generated[kDefaultGroupNameChars];
@@ -201,14 +200,14 @@ STDMETHODIMP COPCGroup::SetName(LPCWSTR szName)
             name = szName;
             if (name.empty())
                 return E_INVALIDARG;
-            if (m_registry->FindName(name))
+            if (registry.FindName(name))
                 return OPC_E_DUPLICATENAME;
         }
-        if (!m_name.empty() && m_registry->EraseName(m_name) != 1) {
+        if (!m_name.empty() && registry.EraseName(m_name) != 1) {
             INTERNAL_ASSERT_FAILED("group name missing from the name index");
             return E_FAIL;
         }
-        if (!m_registry->InsertName(name, this)) {
+        if (!registry.InsertName(name, this)) {
             // Two concurrent renames to one name, or a generated name that a
             // client had already taken.
             INTERNAL_ASSERT_FAILED("group name already in the name index");
@@ -225,8 +224,9 @@ STDMETHODIMP COPCGroup::CloneGroup(LPCWSTR szName, REFIID riid, LPUNKNOWN *ppUnk
     return ComBoundary([&]() -> HRESULT {
         // The copy of the state is taken under the group lock, which is then
         // released: AddGroup and RemoveGroup take the server lock, which
-        // comes before any group lock.
-        ComPtr<IOPCServer> server;
+        // comes before any group lock. The owner is entered while the group
+        // lock still holds off its destruction.
+        CGroupOwner *owner;
         DWORD rate;
         OPCHANDLE clientHandle;
         LONG timeBias;
@@ -239,9 +239,9 @@ STDMETHODIMP COPCGroup::CloneGroup(LPCWSTR szName, REFIID riid, LPUNKNOWN *ppUnk
             if (!IsWritableOut(ppUnk))
                 return E_INVALIDARG;
             *ppUnk = nullptr;
-            if (!m_server)
+            if (!m_owner || !m_owner->EnterGroupCall())
                 return E_FAIL;
-            server = ComPtr<IOPCServer>(m_server);
+            owner = m_owner;
             rate = m_updateRate;
             clientHandle = m_clientHandle;
             timeBias = m_timeBias;
@@ -249,6 +249,11 @@ STDMETHODIMP COPCGroup::CloneGroup(LPCWSTR szName, REFIID riid, LPUNKNOWN *ppUnk
             lcid = m_lcid;
         }
 
+        struct Leave {
+            CGroupOwner *owner;
+            ~Leave() { owner->LeaveGroupCall(); }
+        } leave{owner};
+        IOPCServer *server = owner->OwnerServer();
         OPCHANDLE newHandle = 0;
         DWORD revisedRate = 0;
         ComPtr<IOPCItemMgt> itemMgt;

@@ -2,6 +2,7 @@
 // The OPC group: its state, its items and the interfaces a client uses on it.
 // Created only by the server object's AddGroup (and for item properties).
 #include "ComObject.h"
+#include "GroupOwner.h"
 #include "GroupRegistry.h"
 #include "Handle.h"
 #include "SyncObject.h"
@@ -40,8 +41,9 @@ public:
                               HRESULT **ppErrors) override;
     STDMETHODIMP CreateEnumerator(REFIID riid, LPUNKNOWN *ppUnk) override;
 
-    // Set by AddGroup: the owning server (not referenced) and its registry.
-    void SetOwner(IOPCServer *server, CGroupRegistry *registry);
+    // Set by AddGroup: the owning server object (not referenced; the link is
+    // cut when the group is destroyed, which the server's release waits for).
+    void SetOwner(CGroupOwner *owner);
     OPCHANDLE ServerHandle() const { return m_serverHandle; }
     std::wstring Name();
     bool IsActive();
@@ -70,8 +72,7 @@ private:
     CCriticalSection m_lock; // guards every field below
     UniqueHandle m_idle;     // manual reset; signalled while no work is pending
     LONG m_pendingWork = 0;
-    IOPCServer *m_server = nullptr;
-    CGroupRegistry *m_registry = nullptr;
+    CGroupOwner *m_owner = nullptr;
     std::map<OPCHANDLE, COPCItem *> m_items;
     bool m_removing = false;
     bool m_destroyed = false;

@@ -52,8 +52,34 @@ HRESULT COPCServer::FinalConstruct()
     return hr;
 }
 
+bool COPCServer::EnterGroupCall()
+{
+    CSingleLock lock(&m_groupCallLock);
+    if (m_closing)
+        return false;
+    ++m_groupCalls;
+    return true;
+}
+
+void COPCServer::LeaveGroupCall()
+{
+    CSingleLock lock(&m_groupCallLock);
+    --m_groupCalls;
+}
+
 void COPCServer::FinalRelease()
 {
+    // A group still calling in (a client cloning a group while releasing the
+    // server) finishes first; whatever it adds now is refused.
+    for (;;) {
+        {
+            CSingleLock lock(&m_groupCallLock);
+            m_closing = true;
+            if (m_groupCalls == 0)
+                break;
+        }
+        Sleep(1);
+    }
     if (m_counted)
         ServerServices::ServerReleased();
     CSingleLock registryLock(&m_registry.Lock());
@@ -89,6 +115,11 @@ HRESULT COPCServer::AddGroupLocked(LPCWSTR szName, BOOL bActive, DWORD dwRequest
         return E_INVALIDARG;
     *ppUnk = nullptr;
     *phServerGroup = 0;
+    {
+        CSingleLock lock(&m_groupCallLock);
+        if (m_closing)
+            return E_FAIL;
+    }
 
     wchar_t generated[kDefaultGroupNameChars];
     const wchar_t *name = szName;
@@ -112,7 +143,7 @@ HRESULT COPCServer::AddGroupLocked(LPCWSTR szName, BOOL bActive, DWORD dwRequest
     if (!group)
         return E_OUTOFMEMORY;
     ComPtr<IUnknown> keep(group->InnerUnknown()); // until the server's own reference
-    group->SetOwner(this, &m_registry);
+    group->SetOwner(this);
     HRESULT hr = group->SetName(name);
     if (SUCCEEDED(hr))
         hr = group->QueryInterface(riid, reinterpret_cast<void **>(ppUnk));

@@ -2,6 +2,7 @@
 // The OPC server object that clients create: it owns their groups, indexes
 // them by name and by server handle, and reports the server status.
 #include "ComObject.h"
+#include "GroupOwner.h"
 #include "GroupRegistry.h"
 #include "SyncObject.h"
 #include "opcda.h"
@@ -12,7 +13,7 @@ class CAsyncIOMgr;
 class COPCGroup;
 class CUpdateScanMgr;
 
-class COPCServer : public CComObjectRoot, public IOPCServer {
+class COPCServer : public CComObjectRoot, public IOPCServer, private CGroupOwner {
 public:
     // A server object bound to outer (aggregated) or plain; no references yet.
     static COPCServer *Create(IUnknown *outer);
@@ -40,6 +41,12 @@ protected:
     void FinalRelease() override;
 
 private:
+    // CGroupOwner
+    IOPCServer *OwnerServer() override { return this; }
+    CGroupRegistry &Registry() override { return m_registry; }
+    bool EnterGroupCall() override;
+    void LeaveGroupCall() override;
+
     template <class T, class... Args> friend T *NewComObject(Args &&...args);
     explicit COPCServer(IUnknown *outer) : CComObjectRoot(outer) {}
     ~COPCServer() override = default;
@@ -60,4 +67,8 @@ private:
     LCID m_locale = LOCALE_SYSTEM_DEFAULT;
     std::wstring m_clientName;
     bool m_counted = false; // counted among the server objects of the process
+    // Calls from groups into this object; innermost lock.
+    CCriticalSection m_groupCallLock;
+    LONG m_groupCalls = 0;
+    bool m_closing = false; // final release has begun: AddGroup refuses
 };

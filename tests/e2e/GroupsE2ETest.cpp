@@ -136,9 +136,9 @@ TEST_F(GroupsE2E, ServerExitsWhenTheClientReleasesAServerThatHoldsGroups)
     ComPtr<IUnknown> group;
     OPCHANDLE handle;
     DWORD revised;
-    ASSERT_EQ(server->AddGroup(L"left", TRUE, 100, 0, nullptr, nullptr, 0, &handle, &revised, IID_IUnknown,
-                               group.Out()),
-              S_OK);
+    ASSERT_EQ(
+        server->AddGroup(L"left", TRUE, 100, 0, nullptr, nullptr, 0, &handle, &revised, IID_IUnknown, group.Out()),
+        S_OK);
     group.Reset();
     server.Reset(); // the server's final release removes the group by force
 }
@@ -153,16 +153,15 @@ TEST_F(GroupsE2E, BadInputAcrossTheWireGetsTheDocumentedCodes)
     FLOAT nan = std::numeric_limits<FLOAT>::quiet_NaN();
     EXPECT_EQ(server->AddGroup(L"n", TRUE, 100, 0, nullptr, &nan, 0, &handle, &revised, IID_IUnknown, unk.Out()),
               E_INVALIDARG);
-    EXPECT_EQ(server->AddGroup(L"n", TRUE, 100, 0, nullptr, nullptr, 0, &handle, &revised, IID_IDispatch,
-                               unk.Out()),
+    EXPECT_EQ(server->AddGroup(L"n", TRUE, 100, 0, nullptr, nullptr, 0, &handle, &revised, IID_IDispatch, unk.Out()),
               E_NOINTERFACE);
     EXPECT_EQ(server->RemoveGroup(0xDEADBEEF, TRUE), E_INVALIDARG);
     EXPECT_EQ(server->CreateGroupEnumerator(OPC_ENUM_PUBLIC, IID_IEnumString, unk.Out()), E_FAIL);
     EXPECT_EQ(server->CreateGroupEnumerator(OPC_ENUM_PUBLIC, IID_IEnumUnknown, unk.Out()), S_FALSE);
     std::wstring huge(10000, L'n');
-    EXPECT_EQ(server->AddGroup(huge.c_str(), TRUE, 100, 0, nullptr, nullptr, 0, &handle, &revised, IID_IUnknown,
-                               unk.Out()),
-              S_OK);
+    EXPECT_EQ(
+        server->AddGroup(huge.c_str(), TRUE, 100, 0, nullptr, nullptr, 0, &handle, &revised, IID_IUnknown, unk.Out()),
+        S_OK);
     unk.Reset();
     EXPECT_EQ(Names(server.Get()), std::vector<std::wstring>{huge});
 }

@@ -53,8 +53,7 @@ TEST_F(GroupStateTest, SetStateRevisesRatesAndLeavesOutputsAloneWhenNotAsked)
     EXPECT_EQ(StateOf(group.Get()).deadband, 0.0f) << "a null deadband resets it";
 
     for (DWORD rate : {0u, 9u}) {
-        EXPECT_EQ(group->SetState(&rate, &revised, nullptr, nullptr, nullptr, nullptr, nullptr),
-                  OPC_S_UNSUPPORTEDRATE);
+        EXPECT_EQ(group->SetState(&rate, &revised, nullptr, nullptr, nullptr, nullptr, nullptr), OPC_S_UNSUPPORTEDRATE);
         EXPECT_EQ(revised, 10u);
     }
     DWORD rate = 10;
@@ -109,9 +108,9 @@ TEST_F(GroupStateTest, SetNameChecksDuplicatesWithinItsServerOnly)
     std::wstring generated = StateOf(group.Get()).name;
     EXPECT_EQ(generated.rfind(L"$Group_", 0), 0u) << generated;
     ComPtr<IOPCGroupStateMgt> found;
-    EXPECT_EQ(server->GetGroupByName(generated.c_str(), IID_IOPCGroupStateMgt,
-                                     reinterpret_cast<IUnknown **>(found.Out())),
-              S_OK);
+    EXPECT_EQ(
+        server->GetGroupByName(generated.c_str(), IID_IOPCGroupStateMgt, reinterpret_cast<IUnknown **>(found.Out())),
+        S_OK);
 }
 
 TEST_F(GroupStateTest, CloneGroupCopiesStateInactiveAndRefusesDuplicates)
@@ -138,8 +137,7 @@ TEST_F(GroupStateTest, CloneGroupCopiesStateInactiveAndRefusesDuplicates)
     EXPECT_EQ(GroupCount(server.Get()), count) << "a failed clone leaves no group behind";
 
     ComPtr<IOPCGroupStateMgt> generated;
-    ASSERT_EQ(group->CloneGroup(nullptr, IID_IOPCGroupStateMgt, reinterpret_cast<IUnknown **>(generated.Out())),
-              S_OK);
+    ASSERT_EQ(group->CloneGroup(nullptr, IID_IOPCGroupStateMgt, reinterpret_cast<IUnknown **>(generated.Out())), S_OK);
     EXPECT_EQ(StateOf(generated.Get()).name.rfind(L"$Group_", 0), 0u);
 }
 
@@ -148,7 +146,8 @@ TEST_F(GroupStateTest, AnswersOnlyItsInterfaces)
     ComPtr<IUnknown> unk;
     EXPECT_EQ(group->QueryInterface(IID_IOPCItemMgt, reinterpret_cast<void **>(unk.Out())), S_OK);
     // Public groups are not supported.
-    const IID IID_IOPCPublicGroupStateMgt = {0x39c13a51, 0x011e, 0x11d0, {0x96, 0x75, 0x00, 0x20, 0xaf, 0xd8, 0xad, 0xb3}};
+    const IID IID_IOPCPublicGroupStateMgt = {
+        0x39c13a51, 0x011e, 0x11d0, {0x96, 0x75, 0x00, 0x20, 0xaf, 0xd8, 0xad, 0xb3}};
     EXPECT_EQ(group->QueryInterface(IID_IOPCPublicGroupStateMgt, reinterpret_cast<void **>(unk.Out())), E_NOINTERFACE);
     EXPECT_EQ(group->QueryInterface(IID_IDispatch, reinterpret_cast<void **>(unk.Out())), E_NOINTERFACE);
 }

@@ -1,11 +1,13 @@
 #include "AsyncIOMgr.h"
 #include "ComModule.h"
 #include "InProcServer.h"
+#include "OPCGroup.h"
 #include "OpcErrors.h"
 #include "Services.h"
 #include "Trace.h"
 #include "UpdateScanMgr.h"
 
+#include <atomic>
 #include <cmath>
 #include <thread>
 #include <vector>
@@ -27,8 +29,7 @@ TEST(Server, ClassObjectFollowsTheCreationRules)
     EXPECT_EQ(factory.CreateInstance(dummyOuter, IID_IOPCServer, &out), CLASS_E_NOAGGREGATION);
     EXPECT_EQ(out, nullptr);
     ComPtr<IUnknown> dispatch;
-    EXPECT_EQ(factory.CreateInstance(nullptr, IID_IDispatch, reinterpret_cast<void **>(dispatch.Out())),
-              E_NOINTERFACE);
+    EXPECT_EQ(factory.CreateInstance(nullptr, IID_IDispatch, reinterpret_cast<void **>(dispatch.Out())), E_NOINTERFACE);
 
     LONG locks = ComModule::LockCount();
     EXPECT_EQ(factory.LockServer(TRUE), S_OK);
@@ -155,9 +156,9 @@ TEST(Server, AddGroupRejectsBadOutPointersAndChangesNothing)
               E_INVALIDARG);
     EXPECT_EQ(server->AddGroup(L"a", TRUE, 100, 0, nullptr, nullptr, 0, &handle, &revised, IID_IUnknown, nullptr),
               E_INVALIDARG);
-    EXPECT_EQ(server->AddGroup(L"a", TRUE, 100, 0, nullptr, nullptr, 0, Garbage<OPCHANDLE>(), &revised,
-                               IID_IUnknown, &unk),
-              E_INVALIDARG);
+    EXPECT_EQ(
+        server->AddGroup(L"a", TRUE, 100, 0, nullptr, nullptr, 0, Garbage<OPCHANDLE>(), &revised, IID_IUnknown, &unk),
+        E_INVALIDARG);
     EXPECT_EQ(server->AddGroup(L"a", TRUE, 100, 0, nullptr, nullptr, 0, &handle, &revised, IID_IUnknown,
                                Garbage<IUnknown *>()),
               E_INVALIDARG);
@@ -241,8 +242,9 @@ TEST(Server, ForcedRemovalDestroysTheGroupWhateverClientsHold)
     auto server = CreateInProcServer();
     auto g = AddGroup(server.Get(), L"forced");
     ComPtr<IEnumUnknown> groups;
-    ASSERT_EQ(server->CreateGroupEnumerator(OPC_ENUM_ALL, IID_IEnumUnknown, reinterpret_cast<IUnknown **>(groups.Out())),
-              S_OK);
+    ASSERT_EQ(
+        server->CreateGroupEnumerator(OPC_ENUM_ALL, IID_IEnumUnknown, reinterpret_cast<IUnknown **>(groups.Out())),
+        S_OK);
     EXPECT_EQ(server->RemoveGroup(g.handle, TRUE), S_OK);
     EXPECT_EQ(GroupCount(server.Get()), 0u);
     EXPECT_EQ(StateOf(g.group.Get()).hr, E_FAIL);
@@ -321,8 +323,7 @@ TEST(Server, ConcurrentClientsNeverCorruptTheRegistry)
                     server->RemoveGroup(g.handle, i % 2 == 0);
                 AddGroup(server.Get(), L"shared");
                 ComPtr<IOPCGroupStateMgt> shared;
-                server->GetGroupByName(L"shared", IID_IOPCGroupStateMgt,
-                                       reinterpret_cast<IUnknown **>(shared.Out()));
+                server->GetGroupByName(L"shared", IID_IOPCGroupStateMgt, reinterpret_cast<IUnknown **>(shared.Out()));
                 if (shared)
                     server->RemoveGroup(StateOf(shared.Get()).server, i % 3 == 0);
             }
@@ -333,4 +334,55 @@ TEST(Server, ConcurrentClientsNeverCorruptTheRegistry)
         thread.join();
     EXPECT_EQ(AssertionFailureCount(), failuresBefore);
     EXPECT_EQ(GroupCount(server.Get()), GroupNames(server.Get()).size());
+}
+
+TEST(Server, RemovalWaitsUntilTheGroupHasNoPendingWork)
+{
+    auto server = CreateInProcServer();
+    auto g = AddGroup(server.Get(), L"busy", 100, TRUE);
+    // The in-process test knows the group's class behind its interface.
+    auto *group = static_cast<COPCGroup *>(g.group.Get());
+    EXPECT_EQ(group->AddPendingWork(), 1);
+    EXPECT_EQ(group->AddPendingWork(), 2);
+    std::atomic<bool> removed{false};
+    std::thread remover([&] {
+        CoInitializeEx(nullptr, COINIT_MULTITHREADED);
+        EXPECT_EQ(server->RemoveGroup(g.handle, FALSE), OPC_S_INUSE);
+        removed = true;
+        CoUninitialize();
+    });
+    Sleep(200);
+    EXPECT_FALSE(removed) << "removal waits for the idle event";
+    EXPECT_FALSE(group->IsActive()) << "the group was made inactive first";
+    EXPECT_EQ(group->ReleasePendingWork(), 1);
+    Sleep(100);
+    EXPECT_FALSE(removed);
+    EXPECT_EQ(group->ReleasePendingWork(), 0);
+    remover.join();
+    EXPECT_TRUE(removed);
+}
+
+TEST(Server, CloningWhileTheServerIsReleasedNeverUsesAFreedServer)
+{
+    LONG locks = ComModule::LockCount();
+    for (int round = 0; round < 20; ++round) {
+        auto server = CreateInProcServer();
+        auto g = AddGroup(server.Get(), L"source");
+        std::atomic<bool> stop{false};
+        std::thread cloner([&] {
+            CoInitializeEx(nullptr, COINIT_MULTITHREADED);
+            while (!stop) {
+                ComPtr<IUnknown> clone;
+                g.group->CloneGroup(L"", IID_IUnknown, clone.Out());
+            }
+            CoUninitialize();
+        });
+        Sleep(5);
+        server.Reset(); // final release while clones are being made
+        Sleep(5);
+        stop = true;
+        cloner.join();
+        g.group.Reset();
+    }
+    EXPECT_EQ(ComModule::LockCount(), locks) << "every clone made before the release went with its server";
 }
