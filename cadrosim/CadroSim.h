@@ -1,0 +1,31 @@
+#pragma once
+// Entry points of the simulation engine (CadroSim.dll). The five
+// vendor-named libraries forward to these; tests, benchmarks and tools use
+// the control entry points directly.
+#include "CadroNetwork.h"
+
+#include <string>
+
+#ifdef CADROSIM_BUILDING
+#define CADROSIM_API extern "C" __declspec(dllexport)
+#else
+#define CADROSIM_API extern "C" __declspec(dllimport)
+#endif
+
+CADROSIM_API bool CadroSim_NewRealTime(ICadroRealTimeReceiver *receiver, CadroRealTime **out);
+CADROSIM_API bool CadroSim_NewBrowser(ICadroBrowserReceiver *receiver, CadroBrowser **out);
+CADROSIM_API HRESULT CadroSim_HostName(BSTR *out);
+CADROSIM_API IUnknown *CadroSim_NewWideText(const wchar_t *text);
+
+// Runs a control command (see cadroctl --help); S_OK when it succeeded,
+// S_FALSE with the error text otherwise. The caller frees the answer.
+CADROSIM_API HRESULT CadroSim_Execute(const wchar_t *command, BSTR *answer);
+// Replaces the network with a description; E_INVALIDARG with a line-numbered
+// error (freed by the caller) when it does not parse.
+CADROSIM_API HRESULT CadroSim_Load(const wchar_t *description, BSTR *error);
+
+// The control pipe of the engine in process processId.
+inline std::wstring ControlPipeName(unsigned long processId)
+{
+    return L"\\\\.\\pipe\\CadroSim-" + std::to_wstring(processId);
+}

@@ -1,0 +1,72 @@
+#include "CadroSim.h"
+#include "Engine.h"
+
+namespace cadrosim {
+
+namespace {
+constexpr DWORD kBufferBytes = 1 << 20;
+
+// Waits for an overlapped operation or the stop event; false when stopping.
+bool Await(HANDLE pipe, OVERLAPPED &ov, HANDLE stop, DWORD &bytes)
+{
+    HANDLE events[] = {ov.hEvent, stop};
+    if (WaitForMultipleObjects(2, events, FALSE, INFINITE) != WAIT_OBJECT_0) {
+        CancelIo(pipe);
+        GetOverlappedResult(pipe, &ov, &bytes, TRUE);
+        return false;
+    }
+    return GetOverlappedResult(pipe, &ov, &bytes, FALSE) != FALSE;
+}
+} // namespace
+
+ControlPipe::ControlPipe(Engine &engine) : m_engine(engine), m_stop(CreateEventW(nullptr, TRUE, FALSE, nullptr))
+{
+    m_thread = std::thread([this] { Run(); });
+}
+
+ControlPipe::~ControlPipe()
+{
+    SetEvent(m_stop);
+    if (m_thread.joinable())
+        m_thread.join();
+    CloseHandle(m_stop);
+}
+
+void ControlPipe::Run()
+{
+    std::wstring name = ControlPipeName(GetCurrentProcessId());
+    std::vector<wchar_t> buffer(kBufferBytes / sizeof(wchar_t));
+    HANDLE event = CreateEventW(nullptr, TRUE, FALSE, nullptr);
+    while (WaitForSingleObject(m_stop, 0) == WAIT_TIMEOUT) {
+        HANDLE pipe = CreateNamedPipeW(name.c_str(), PIPE_ACCESS_DUPLEX | FILE_FLAG_OVERLAPPED,
+                                       PIPE_TYPE_MESSAGE | PIPE_READMODE_MESSAGE | PIPE_WAIT, 1, kBufferBytes,
+                                       kBufferBytes, 0, nullptr);
+        if (pipe == INVALID_HANDLE_VALUE)
+            break;
+        OVERLAPPED ov = {};
+        ov.hEvent = event;
+        ResetEvent(event);
+        DWORD bytes = 0;
+        bool connected = ConnectNamedPipe(pipe, &ov) ? true : GetLastError() == ERROR_PIPE_CONNECTED;
+        if (!connected && GetLastError() == ERROR_IO_PENDING)
+            connected = Await(pipe, ov, m_stop, bytes);
+        if (connected) {
+            ResetEvent(event);
+            bool read = ReadFile(pipe, buffer.data(), kBufferBytes - sizeof(wchar_t), &bytes, &ov) ||
+                        (GetLastError() == ERROR_IO_PENDING && Await(pipe, ov, m_stop, bytes));
+            if (read) {
+                std::wstring answer = m_engine.Execute(std::wstring(buffer.data(), bytes / sizeof(wchar_t)));
+                DWORD size = static_cast<DWORD>(std::min<size_t>(answer.size() * sizeof(wchar_t), kBufferBytes));
+                ResetEvent(event);
+                if (!WriteFile(pipe, answer.data(), size, &bytes, &ov) && GetLastError() == ERROR_IO_PENDING)
+                    Await(pipe, ov, m_stop, bytes);
+                FlushFileBuffers(pipe);
+            }
+            DisconnectNamedPipe(pipe);
+        }
+        CloseHandle(pipe);
+    }
+    CloseHandle(event);
+}
+
+} // namespace cadrosim

@@ -1,0 +1,322 @@
+#include "Engine.h"
+
+#include "NetworkFile.h"
+
+#include <algorithm>
+
+namespace cadrosim {
+
+namespace {
+constexpr unsigned kShardCount = 2;
+const HRESULT kUnknownUrl = HRESULT_FROM_WIN32(ERROR_NOT_FOUND);
+const HRESULT kNotConnected = HRESULT_FROM_WIN32(ERROR_NOT_CONNECTED);
+
+std::wstring LocalHostName()
+{
+    wchar_t name[MAX_COMPUTERNAME_LENGTH + 1];
+    DWORD size = MAX_COMPUTERNAME_LENGTH + 1;
+    return GetComputerNameW(name, &size) ? std::wstring(name, size) : std::wstring(L"LOCALHOST");
+}
+
+// The description a user named: environment variable CADRO_NETWORK_FILE, else
+// the registry value "Network File" of HKLM\Software\Tarnwell\Cadro Simulator.
+std::wstring NetworkFilePath()
+{
+    wchar_t path[MAX_PATH * 2];
+    DWORD n = GetEnvironmentVariableW(L"CADRO_NETWORK_FILE", path, MAX_PATH * 2);
+    if (n > 0 && n < MAX_PATH * 2)
+        return path;
+    DWORD size = sizeof path;
+    if (RegGetValueW(HKEY_LOCAL_MACHINE, L"Software\\Tarnwell\\Cadro Simulator", L"Network File", RRF_RT_REG_SZ,
+                     nullptr, path, &size) == ERROR_SUCCESS)
+        return path;
+    return L"";
+}
+
+bool ReadTextFile(const std::wstring &path, std::wstring &text)
+{
+    HANDLE file = CreateFileW(path.c_str(), GENERIC_READ, FILE_SHARE_READ, nullptr, OPEN_EXISTING, 0, nullptr);
+    if (file == INVALID_HANDLE_VALUE)
+        return false;
+    std::string bytes;
+    char buffer[65536];
+    DWORD got = 0;
+    while (ReadFile(file, buffer, sizeof buffer, &got, nullptr) && got > 0)
+        bytes.append(buffer, got);
+    CloseHandle(file);
+    int n = MultiByteToWideChar(CP_UTF8, 0, bytes.data(), static_cast<int>(bytes.size()), nullptr, 0);
+    text.assign(n, L'\0');
+    MultiByteToWideChar(CP_UTF8, 0, bytes.data(), static_cast<int>(bytes.size()), text.data(), n);
+    return true;
+}
+} // namespace
+
+Subscription::Subscription(Engine &e, std::shared_ptr<Member> m, ICadroRealTimeReceiver *r, void *c)
+    : engine(e), member(std::move(m)), receiver(r), cookie(c)
+{
+    receiver->AddRef();
+    engine.AddUse();
+}
+
+Subscription::~Subscription()
+{
+    receiver->Release();
+    engine.ReleaseUse();
+}
+
+HRESULT STDMETHODCALLTYPE Subscription::Write(const CadroValue *value)
+{
+    return engine.Write(this, value);
+}
+
+HRESULT STDMETHODCALLTYPE Subscription::Read(uint32_t *flags, CadroValue *value, int32_t *errorFlag, FILETIME *time)
+{
+    return engine.Read(this, flags, value, errorFlag, time);
+}
+
+void Subscription::LastRelease()
+{
+    engine.Unsubscribe(this);
+}
+
+Engine &Engine::Instance()
+{
+    // Never destroyed: threads still running at process exit must not meet a
+    // destroyed engine, and a DLL must not join threads while unloading.
+    static Engine *engine = new Engine();
+    return *engine;
+}
+
+Engine::Engine() : m_host(LocalHostName()), m_epoch(std::chrono::steady_clock::now()), m_random(12345)
+{
+    for (unsigned i = 0; i < kShardCount; ++i)
+        m_shards.push_back(std::make_unique<Shard>(*this));
+    LoadInitialNetwork();
+}
+
+void Engine::LoadInitialNetwork()
+{
+    std::wstring path = NetworkFilePath();
+    std::wstring text;
+    if (path.empty()) {
+        m_networkSource = L"built-in default network";
+        text = DefaultNetworkDescription();
+    } else if (ReadTextFile(path, text)) {
+        m_networkSource = path;
+    } else {
+        m_networkSource = path;
+        Load(L"", text);
+        m_loadError = L"cannot read " + path;
+        return;
+    }
+    std::wstring error;
+    if (!Load(text, error)) {
+        // An empty network rather than a guess; "cadroctl status" tells why.
+        Load(L"", text);
+        m_loadError = path + L": " + error;
+    }
+}
+
+bool Engine::Load(const std::wstring &description, std::wstring &error)
+{
+    auto network = std::make_unique<Network>(m_host);
+    if (!ParseNetworkDescription(description, m_host, *network, error))
+        return false;
+    {
+        std::lock_guard<std::mutex> l(m_networkLock);
+        // Subscriptions may still hold members of the old network, which
+        // point at its machines: it is retired, never destroyed.
+        if (m_network)
+            m_retired.push_back(std::move(m_network));
+        m_network = std::move(network);
+        AssignShards();
+        m_loadError.clear();
+    }
+    NotifyTopologyChanged();
+    return true;
+}
+
+void Engine::AssignShards()
+{
+    m_network->ForEachMember([this](Machine &machine, std::shared_ptr<Member> &member) {
+        member->machine = &machine;
+        if (!member->shard)
+            member->shard = m_shards[NextShard()].get();
+    });
+}
+
+double Engine::ElapsedMs() const
+{
+    return std::chrono::duration<double, std::milli>(std::chrono::steady_clock::now() - m_epoch).count();
+}
+
+void Engine::AddUse()
+{
+    std::lock_guard<std::mutex> l(m_useLock);
+    if (m_uses++ == 0)
+        StartThreads();
+}
+
+void Engine::ReleaseUse()
+{
+    std::lock_guard<std::mutex> l(m_useLock);
+    if (--m_uses == 0)
+        StopThreads();
+}
+
+void Engine::StartThreads()
+{
+    for (auto &shard : m_shards)
+        shard->Start();
+    m_pipe = std::make_unique<ControlPipe>(*this);
+}
+
+void Engine::StopThreads()
+{
+    m_pipe.reset();
+    for (auto &shard : m_shards)
+        shard->Stop();
+}
+
+std::shared_ptr<Member> Engine::FindMember(const std::wstring &url, Machine **machine)
+{
+    std::lock_guard<std::mutex> l(m_networkLock);
+    auto member = m_network->FindMember(url);
+    if (member && machine)
+        *machine = member->machine;
+    return member;
+}
+
+HRESULT Engine::Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeReceiver *receiver, CadroDataItem **out)
+{
+    if (!out || !receiver || !url)
+        return E_POINTER;
+    *out = nullptr;
+    std::shared_ptr<Member> member = FindMember(url);
+    if (!member) {
+        // The network answers at once: contacted, but no such data item.
+        for (uint32_t status :
+             {kCadroStatusConnecting, kCadroStatusContacted, kCadroStatusSubscribing, kCadroStatusSubscribeFailed})
+            receiver->StatusChange(cookie, status, 0, 0);
+        return kUnknownUrl;
+    }
+    auto *sub = new (std::nothrow) Subscription(*this, member, receiver, cookie);
+    if (!sub)
+        return E_OUTOFMEMORY;
+    Shard &shard = *member->shard;
+    {
+        std::lock_guard<std::mutex> l(shard.lock);
+        member->subscriptions.push_back(sub);
+        shard.Post(sub, EventKind::Status, kCadroStatusConnecting);
+        if (member->machine->connected) {
+            for (uint32_t status : {kCadroStatusContacted, kCadroStatusSubscribing, kCadroStatusSubscribed})
+                shard.Post(sub, EventKind::Status, status);
+            shard.Post(sub, EventKind::Attributes);
+            shard.Post(sub, EventKind::Activate);
+        }
+    }
+    ++m_subscriptionCount;
+    *out = sub;
+    return S_OK;
+}
+
+void Engine::Unsubscribe(Subscription *sub)
+{
+    --m_subscriptionCount;
+    Shard &shard = *sub->member->shard;
+    std::unique_lock<std::mutex> l(shard.lock);
+    if (!shard.Detach(sub, l)) {
+        shard.Bury(sub);
+        return;
+    }
+    l.unlock();
+    delete sub;
+}
+
+HRESULT Engine::Write(Subscription *sub, const CadroValue *value)
+{
+    if (!value)
+        return E_POINTER;
+    Member &m = *sub->member;
+    if (!(m.access & 2))
+        return E_ACCESSDENIED;
+    if (!m.machine->connected)
+        return kNotConnected;
+    SimValue converted;
+    if (!FromCadroValue(*value, m.type, converted))
+        return DISP_E_TYPEMISMATCH;
+    Shard &shard = *m.shard;
+    std::lock_guard<std::mutex> l(shard.lock);
+    m.value = converted;
+    m.hasValue = true;
+    m.good = true;
+    GetSystemTimeAsFileTime(&m.time);
+    // The network echoes the written value to every subscriber.
+    for (Subscription *s : m.subscriptions)
+        if (s->active)
+            shard.Post(s, EventKind::Value);
+    return S_OK;
+}
+
+HRESULT Engine::Read(Subscription *sub, uint32_t *flags, CadroValue *value, int32_t *errorFlag, FILETIME *time)
+{
+    if (!flags || !value || !errorFlag || !time)
+        return E_POINTER;
+    *flags = 0;
+    *errorFlag = 0;
+    *time = {};
+    value->type = kCadroCleared;
+    value->number = 0;
+    Member &m = *sub->member;
+    if (!m.machine->connected)
+        return kNotConnected;
+    std::lock_guard<std::mutex> l(m.shard->lock);
+    if (!m.hasValue || m.removed)
+        return S_OK; // no value yet
+    if (!ToCadroValue(m.value, *value))
+        return E_OUTOFMEMORY;
+    *flags = kCadroHasValue | kCadroHasQuality | kCadroHasTime;
+    *errorFlag = m.good ? 0 : 1;
+    *time = m.time;
+    return S_OK;
+}
+
+bool Engine::List(const std::wstring &url, std::vector<BrowseEntry> &out)
+{
+    std::lock_guard<std::mutex> l(m_networkLock);
+    return m_network->List(url, out);
+}
+
+void Engine::AddBrowserReceiver(ICadroBrowserReceiver *receiver)
+{
+    std::lock_guard<std::mutex> l(m_receiversLock);
+    receiver->AddRef();
+    m_browserReceivers.push_back(receiver);
+}
+
+void Engine::RemoveBrowserReceiver(ICadroBrowserReceiver *receiver)
+{
+    std::lock_guard<std::mutex> l(m_receiversLock);
+    auto it = std::find(m_browserReceivers.begin(), m_browserReceivers.end(), receiver);
+    if (it != m_browserReceivers.end()) {
+        m_browserReceivers.erase(it);
+        receiver->Release();
+    }
+}
+
+void Engine::NotifyTopologyChanged()
+{
+    std::vector<ICadroBrowserReceiver *> receivers;
+    {
+        std::lock_guard<std::mutex> l(m_receiversLock);
+        receivers = m_browserReceivers;
+        for (auto *r : receivers)
+            r->AddRef();
+    }
+    for (auto *r : receivers) {
+        r->BrowseItemChanged();
+        r->Release();
+    }
+}
+
+} // namespace cadrosim

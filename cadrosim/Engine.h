@@ -1,0 +1,179 @@
+#pragma once
+// The one simulation engine of a process: the network, its delivery threads,
+// the subscriptions and the control commands. Every library object of CDREALT
+// and CDBROW is backed by it.
+#include "Network.h"
+#include "Unknown.h"
+
+#include <atomic>
+#include <chrono>
+#include <condition_variable>
+#include <deque>
+#include <functional>
+#include <memory>
+#include <mutex>
+#include <queue>
+#include <random>
+#include <thread>
+#include <vector>
+
+namespace cadrosim {
+
+class Engine;
+
+// One subscription; it is the CadroDataItem the subscriber holds.
+struct Subscription : CSimUnknown<CadroDataItem> {
+    Subscription(Engine &engine, std::shared_ptr<Member> member, ICadroRealTimeReceiver *receiver, void *cookie);
+    ~Subscription() override;
+
+    HRESULT STDMETHODCALLTYPE Write(const CadroValue *value) override;
+    HRESULT STDMETHODCALLTYPE Read(uint32_t *flags, CadroValue *value, int32_t *errorFlag, FILETIME *time) override;
+    void LastRelease() override;
+
+    Engine &engine;
+    std::shared_ptr<Member> member;
+    ICadroRealTimeReceiver *receiver;
+    void *cookie;
+    std::atomic<bool> dead{false};
+    bool active = false; // receives values; guarded by the member's shard
+};
+
+enum class EventKind { Status, Attributes, Activate, Value };
+
+struct Event {
+    Subscription *sub;
+    EventKind kind;
+    uint32_t status;
+};
+
+// A delivery thread with the members assigned to it: their periodic updates
+// (a heap of due times) and the events of their subscriptions, in order.
+class Shard {
+public:
+    explicit Shard(Engine &engine) : m_engine(engine) {}
+    void Start();
+    // Safe from the shard's own thread (it is then left to finish alone).
+    void Stop();
+
+    std::mutex lock;
+    // Under lock: queue an event / put a member on the heap.
+    void Post(Subscription *sub, EventKind kind, uint32_t status = 0);
+    void Schedule(const std::shared_ptr<Member> &member);
+    // Under lock (held by l): ends the subscription's deliveries; false when
+    // the caller is inside this shard's callbacks and must not wait.
+    bool Detach(Subscription *sub, std::unique_lock<std::mutex> &l);
+    void Bury(Subscription *sub) { m_graveyard.push_back(sub); }
+    bool OnShardThread() const { return GetCurrentThreadId() == m_threadId; }
+
+private:
+    using Clock = std::chrono::steady_clock;
+    struct Due {
+        Clock::time_point at;
+        std::shared_ptr<Member> member;
+        bool operator>(const Due &o) const { return at > o.at; }
+    };
+
+    void Run(unsigned generation);
+    void Tick(std::unique_lock<std::mutex> &l, const std::shared_ptr<Member> &member, Clock::time_point at);
+    void Dispatch(std::unique_lock<std::mutex> &l, Event e);
+    // Runs callbacks with the lock released, then wakes waiting releases.
+    template <class F> void Deliver(std::unique_lock<std::mutex> &l, F callbacks);
+
+    Engine &m_engine;
+    std::condition_variable m_wake;
+    std::condition_variable m_batchDone;
+    std::deque<Event> m_events;
+    std::priority_queue<Due, std::vector<Due>, std::greater<Due>> m_heap;
+    std::vector<Subscription *> m_graveyard;
+    bool m_delivering = false;
+    unsigned m_generation = 0;
+    DWORD m_threadId = 0;
+    std::thread m_thread;
+};
+
+class Engine {
+public:
+    static Engine &Instance();
+
+    // Library objects (sessions) and subscriptions keep the threads and the
+    // control channel running.
+    void AddUse();
+    void ReleaseUse();
+
+    HRESULT Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeReceiver *receiver, CadroDataItem **out);
+    void Unsubscribe(Subscription *sub);
+    HRESULT Write(Subscription *sub, const CadroValue *value);
+    HRESULT Read(Subscription *sub, uint32_t *flags, CadroValue *value, int32_t *errorFlag, FILETIME *time);
+    bool List(const std::wstring &url, std::vector<BrowseEntry> &out);
+
+    void AddBrowserReceiver(ICadroBrowserReceiver *receiver);
+    void RemoveBrowserReceiver(ICadroBrowserReceiver *receiver);
+
+    // Runs one control command; the answer's first line is "ok" or "error: ...".
+    std::wstring Execute(const std::wstring &command);
+    // Replaces the network with a description (subscriptions keep their old
+    // members). False with a line-numbered error.
+    bool Load(const std::wstring &description, std::wstring &error);
+
+    const std::wstring &HostName() const { return m_host; }
+    double ElapsedMs() const;
+    unsigned NextShard() { return m_nextShard++ % m_shards.size(); }
+    std::mt19937 &Random() { return m_random; }
+
+private:
+    Engine();
+    void LoadInitialNetwork();
+    void StartThreads();
+    void StopThreads();
+    void NotifyTopologyChanged();
+    void AssignShards();
+    std::shared_ptr<Member> FindMember(const std::wstring &url, Machine **machine = nullptr);
+
+    // Control commands.
+    std::wstring Publish(const std::vector<std::wstring> &args);
+    std::wstring AddMemberCommand(const std::vector<std::wstring> &args);
+    std::wstring RemoveMemberCommand(const std::vector<std::wstring> &args);
+    std::wstring SetConnected(const std::vector<std::wstring> &args, bool connected);
+    std::wstring SetStalled(const std::vector<std::wstring> &args, bool stalled);
+    std::wstring ListSubscriptions();
+    std::wstring Show(const std::vector<std::wstring> &args);
+    std::wstring BrowseCommand(const std::vector<std::wstring> &args);
+    std::wstring Status();
+
+    friend class Shard;
+    friend class ControlPipe;
+
+    std::wstring m_host;
+    std::mutex m_networkLock; // the topology; outside any shard lock
+    std::unique_ptr<Network> m_network;
+    std::vector<std::unique_ptr<Network>> m_retired;
+    std::wstring m_networkSource;
+    std::wstring m_loadError;
+    std::vector<std::unique_ptr<Shard>> m_shards;
+    std::atomic<unsigned> m_nextShard{0};
+    std::mutex m_useLock;
+    long m_uses = 0;
+    std::unique_ptr<class ControlPipe> m_pipe;
+    std::mutex m_receiversLock;
+    std::vector<ICadroBrowserReceiver *> m_browserReceivers;
+    std::chrono::steady_clock::time_point m_epoch;
+    std::mt19937 m_random;
+    std::atomic<long> m_subscriptionCount{0};
+};
+
+// Runs commands from other programs: one named pipe per engine,
+// "\\.\pipe\CadroSim-<process id>".
+class ControlPipe {
+public:
+    explicit ControlPipe(Engine &engine);
+    ~ControlPipe();
+
+private:
+    void Run();
+
+    Engine &m_engine;
+    HANDLE m_stop;
+    std::thread m_thread;
+};
+
+} // namespace cadrosim

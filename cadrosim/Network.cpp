@@ -1,0 +1,246 @@
+#include "Network.h"
+
+#include <algorithm>
+#include <cwctype>
+
+namespace cadrosim {
+
+namespace {
+bool EqualNoCase(const std::wstring &a, const std::wstring &b)
+{
+    return a.size() == b.size() &&
+           std::equal(a.begin(), a.end(), b.begin(), [](wchar_t x, wchar_t y) { return towlower(x) == towlower(y); });
+}
+
+// Reads one name at pos: quoted ('a''b') or plain up to a separator.
+bool ReadName(const std::wstring &url, size_t &pos, std::wstring &name)
+{
+    name.clear();
+    if (pos < url.size() && url[pos] == L'\'') {
+        for (++pos; pos < url.size(); ++pos) {
+            if (url[pos] == L'\'') {
+                if (pos + 1 < url.size() && url[pos + 1] == L'\'') {
+                    name += L'\'';
+                    ++pos;
+                    continue;
+                }
+                ++pos;
+                return true;
+            }
+            name += url[pos];
+        }
+        return false; // no closing quote
+    }
+    while (pos < url.size() && url[pos] != L'\\' && url[pos] != L'.')
+        name += url[pos++];
+    return !name.empty();
+}
+
+BrowseEntry Branch(const std::wstring &name)
+{
+    BrowseEntry e;
+    e.name = name;
+    return e;
+}
+} // namespace
+
+bool SplitUrl(const std::wstring &url, std::wstring &machine, std::vector<std::wstring> &segments, std::wstring &member,
+              bool &hasMember)
+{
+    segments.clear();
+    member.clear();
+    hasMember = false;
+    if (url.size() < 3 || url[0] != L'\\' || url[1] != L'\\')
+        return false;
+    size_t pos = url.find(L'\\', 2);
+    machine = url.substr(2, pos == std::wstring::npos ? std::wstring::npos : pos - 2);
+    if (machine.empty())
+        return false;
+    if (pos == std::wstring::npos)
+        return true;
+    ++pos; // the process and the objects, separated by "\"; a member after "."
+    while (true) {
+        std::wstring name;
+        if (!ReadName(url, pos, name))
+            return false;
+        segments.push_back(name);
+        if (pos == url.size())
+            return true;
+        if (url[pos] == L'\\') {
+            ++pos;
+            continue;
+        }
+        // "." : the rest names a member of the object (nothing after a final
+        // "." names the object's implicit member).
+        if (segments.size() < 2)
+            return false;
+        ++pos;
+        if (pos == url.size())
+            return true;
+        if (!ReadName(url, pos, member) || pos != url.size())
+            return false;
+        hasMember = true;
+        return true;
+    }
+}
+
+Network::Network(std::wstring hostName) : m_host(std::move(hostName)) {}
+
+Machine *Network::FindMachine(const std::wstring &name)
+{
+    const std::wstring &wanted = name == L"." ? m_host : name;
+    for (auto &m : m_machines)
+        if (EqualNoCase(m->name, wanted))
+            return m.get();
+    return nullptr;
+}
+
+Object *Network::FindObject(Process &process, const std::vector<std::wstring> &names, size_t count)
+{
+    Object *current = nullptr;
+    for (size_t i = 0; i < count; ++i) {
+        auto &children = current ? current->objects : process.objects;
+        auto it = std::find_if(children.begin(), children.end(), [&](auto &o) { return o->name == names[i]; });
+        if (it == children.end())
+            return nullptr;
+        current = it->get();
+    }
+    return current;
+}
+
+bool Network::ParseUrl(const std::wstring &url, Path &path)
+{
+    std::wstring machine;
+    std::vector<std::wstring> segments;
+    if (!SplitUrl(url, machine, segments, path.member, path.hasMember))
+        return false;
+    path.machine = FindMachine(machine);
+    if (!path.machine)
+        return false;
+    if (segments.empty())
+        return true;
+    auto &processes = path.machine->processes;
+    auto it = std::find_if(processes.begin(), processes.end(), [&](auto &p) { return p->name == segments[0]; });
+    if (it == processes.end())
+        return false;
+    path.process = it->get();
+    path.objects.assign(segments.begin() + 1, segments.end());
+    return true;
+}
+
+std::shared_ptr<Member> Network::FindMember(const std::wstring &url)
+{
+    Path path;
+    if (!ParseUrl(url, path) || !path.process || path.objects.empty())
+        return nullptr;
+    Object *object = FindObject(*path.process, path.objects, path.objects.size());
+    if (!object)
+        return nullptr;
+    const std::wstring &id = path.hasMember ? path.member : std::wstring();
+    for (auto &m : object->members)
+        if (m->idPart == id)
+            return m;
+    return nullptr;
+}
+
+bool Network::List(const std::wstring &url, std::vector<BrowseEntry> &out)
+{
+    out.clear();
+    if (url == L"\\" || url == L"\\\\") {
+        for (auto &m : m_machines)
+            out.push_back(Branch(L"\\\\" + m->name));
+        return true;
+    }
+    Path path;
+    if (!ParseUrl(url, path))
+        return false;
+    if (!path.process) {
+        for (auto &p : path.machine->processes)
+            out.push_back(Branch(p->name));
+        return true;
+    }
+    if (path.objects.empty()) {
+        for (auto &o : path.process->objects)
+            out.push_back(Branch(o->name));
+        return true;
+    }
+    Object *object = FindObject(*path.process, path.objects, path.objects.size());
+    if (!object)
+        return false;
+    if (path.hasMember) // a member has no children
+        return FindMember(url) != nullptr;
+    for (auto &o : object->objects)
+        out.push_back(Branch(o->name));
+    for (auto &m : object->members) {
+        BrowseEntry e;
+        e.name = m->name;
+        e.kind = L'.';
+        e.leaf = true;
+        e.dataType = static_cast<uint16_t>(m->type);
+        e.access = static_cast<uint16_t>(m->access);
+        out.push_back(e);
+    }
+    return true;
+}
+
+Object *Network::EnsureObject(const std::wstring &objectUrl, std::wstring &error)
+{
+    Path path;
+    if (!ParseUrl(objectUrl, path) || !path.process || path.objects.empty() || path.hasMember) {
+        error = L"no such process, or not an object URL: " + objectUrl;
+        return nullptr;
+    }
+    Object *object = nullptr;
+    auto *children = &path.process->objects;
+    for (const auto &name : path.objects) {
+        auto it = std::find_if(children->begin(), children->end(), [&](auto &o) { return o->name == name; });
+        if (it == children->end()) {
+            children->push_back(std::make_unique<Object>());
+            children->back()->name = name;
+            it = children->end() - 1;
+        }
+        object = it->get();
+        children = &object->objects;
+    }
+    return object;
+}
+
+bool Network::AddMember(const std::wstring &objectUrl, std::shared_ptr<Member> member, std::wstring &error)
+{
+    Object *object = EnsureObject(objectUrl, error);
+    if (!object)
+        return false;
+    std::wstring machineName;
+    std::vector<std::wstring> segments;
+    std::wstring ignored;
+    bool hasMember = false;
+    SplitUrl(objectUrl, machineName, segments, ignored, hasMember);
+    member->machine = FindMachine(machineName);
+    for (auto &m : object->members) {
+        if (m->idPart == member->idPart) {
+            error = L"the object already has a member " + (m->idPart.empty() ? m->name : m->idPart);
+            return false;
+        }
+    }
+    object->members.push_back(std::move(member));
+    return true;
+}
+
+std::shared_ptr<Member> Network::RemoveMember(const std::wstring &url)
+{
+    Path path;
+    if (!ParseUrl(url, path) || !path.process || path.objects.empty())
+        return nullptr;
+    Object *object = FindObject(*path.process, path.objects, path.objects.size());
+    if (!object)
+        return nullptr;
+    const std::wstring id = path.hasMember ? path.member : std::wstring();
+    auto it = std::find_if(object->members.begin(), object->members.end(), [&](auto &m) { return m->idPart == id; });
+    if (it == object->members.end())
+        return nullptr;
+    std::shared_ptr<Member> removed = *it;
+    object->members.erase(it);
+    return removed;
+}
+
+} // namespace cadrosim

@@ -1,0 +1,142 @@
+#pragma once
+// The simulated network's topology: machines, processes, objects (which may
+// nest) and data members, with each member's value source and current value.
+// Not thread-safe: the engine guards it.
+#include "SimValue.h"
+
+#include <atomic>
+#include <memory>
+#include <string>
+#include <vector>
+
+namespace cadrosim {
+
+class Shard;
+struct Subscription;
+
+enum class SourceKind { Const, Sine, Cosine, Ramp, Square, Random, Counter, Toggle };
+
+struct Source {
+    SourceKind kind = SourceKind::Const;
+    unsigned period = 1000; // ms between updates; 0: only on change
+    double cycle = 10000;   // ms of one waveform cycle
+    double amplitude = 1;
+    double offset = 0;
+    double min = 0;
+    double max = 1;
+    double step = 1;
+};
+
+struct Machine;
+
+struct Member {
+    std::wstring name;   // as browsed, e.g. "cosine-Cosine wave"
+    std::wstring idPart; // as in URLs, e.g. "cosine"; empty for "(implicit)"
+    uint32_t type = kCadroNumber;
+    uint32_t access = 3; // bit 0 readable, bit 1 writable
+    Source source;
+
+    // Guarded by the member's shard.
+    Machine *machine = nullptr;
+    Shard *shard = nullptr;
+    SimValue value;
+    bool hasValue = false;
+    bool good = true;
+    FILETIME time = {};
+    bool stalled = false;
+    bool removed = false;
+    bool scheduled = false;
+    std::vector<Subscription *> subscriptions; // active ones
+};
+
+struct Object {
+    std::wstring name;
+    std::vector<std::unique_ptr<Object>> objects;
+    std::vector<std::shared_ptr<Member>> members;
+};
+
+struct Process {
+    std::wstring name;
+    std::vector<std::unique_ptr<Object>> objects;
+};
+
+struct Machine {
+    std::wstring name;
+    std::atomic<bool> connected{true};
+    std::vector<std::unique_ptr<Process>> processes;
+};
+
+// One entry of a browse listing.
+struct BrowseEntry {
+    std::wstring name;
+    wchar_t kind = L'\\';
+    bool leaf = false;
+    uint16_t dataType = 0;
+    uint16_t access = 3;
+};
+
+class Network {
+public:
+    // The name that stands for the local machine: "$HOST" in descriptions,
+    // "." in URLs.
+    explicit Network(std::wstring hostName = L"");
+
+    const std::wstring &HostName() const { return m_host; }
+    std::vector<std::unique_ptr<Machine>> &Machines() { return m_machines; }
+
+    Machine *FindMachine(const std::wstring &name);
+    // The member a URL names (an object's URL names its "(implicit)"
+    // member); null when the network does not know it.
+    std::shared_ptr<Member> FindMember(const std::wstring &url);
+    // The children of a machine, process or object URL, or of "\" or "\\"
+    // (the machines). False when the URL is unknown.
+    bool List(const std::wstring &url, std::vector<BrowseEntry> &out);
+
+    // The object an object URL names, created with its path when missing;
+    // null (with error) when the URL names no process.
+    Object *EnsureObject(const std::wstring &objectUrl, std::wstring &error);
+    // Adds a member under an object URL (the object path is created when
+    // missing); false when the URL names no process or the member exists.
+    bool AddMember(const std::wstring &objectUrl, std::shared_ptr<Member> member, std::wstring &error);
+    // Detaches the member from the tree and returns it.
+    std::shared_ptr<Member> RemoveMember(const std::wstring &url);
+
+    // Every member, for walks over the whole network.
+    template <class F> void ForEachMember(F f)
+    {
+        for (auto &m : m_machines)
+            for (auto &p : m->processes)
+                for (auto &o : p->objects)
+                    ForEachInObject(*o, *m, f);
+    }
+
+private:
+    template <class F> static void ForEachInObject(Object &o, Machine &m, F &f)
+    {
+        for (auto &member : o.members)
+            f(m, member);
+        for (auto &sub : o.objects)
+            ForEachInObject(*sub, m, f);
+    }
+
+    struct Path {
+        Machine *machine = nullptr;
+        Process *process = nullptr;
+        std::vector<std::wstring> objects;
+        std::wstring member; // after the last ".", if any
+        bool hasMember = false;
+    };
+    bool ParseUrl(const std::wstring &url, Path &path);
+    Object *FindObject(Process &process, const std::vector<std::wstring> &names, size_t count);
+
+    std::wstring m_host;
+    std::vector<std::unique_ptr<Machine>> m_machines;
+};
+
+// Splits a URL into its segments: "\\m\p\o1\o2.member" gives machine "m",
+// then "p", "o1", "o2" and member "member". Quoted segments ('a''b') are
+// unquoted. False when malformed.
+bool SplitUrl(const std::wstring &url, std::wstring &machine, std::vector<std::wstring> &segments, std::wstring &member,
+              bool &hasMember);
+
+} // namespace cadrosim

@@ -1,0 +1,197 @@
+#include "Engine.h"
+
+#include "Source.h"
+
+#include <algorithm>
+
+namespace cadrosim {
+
+namespace {
+void Attributes(const Member &m, CadroAttributes &a)
+{
+    a = {};
+    a.mask = 0x02 | 0x04;
+    a.dataType = static_cast<uint16_t>(m.type);
+    a.access = m.access;
+}
+
+void Split(const FILETIME &ft, uint32_t &low, uint32_t &high)
+{
+    low = ft.dwLowDateTime;
+    high = ft.dwHighDateTime;
+}
+} // namespace
+
+void Shard::Start()
+{
+    std::lock_guard<std::mutex> l(lock);
+    unsigned generation = ++m_generation;
+    m_thread = std::thread([this, generation] { Run(generation); });
+}
+
+void Shard::Stop()
+{
+    std::thread thread;
+    {
+        std::lock_guard<std::mutex> l(lock);
+        ++m_generation;
+        thread = std::move(m_thread);
+    }
+    m_wake.notify_all();
+    if (!thread.joinable())
+        return;
+    if (thread.get_id() == std::this_thread::get_id())
+        thread.detach(); // stopped from its own callbacks: it ends after them
+    else
+        thread.join();
+}
+
+void Shard::Post(Subscription *sub, EventKind kind, uint32_t status)
+{
+    m_events.push_back({sub, kind, status});
+    m_wake.notify_one();
+}
+
+void Shard::Schedule(const std::shared_ptr<Member> &member)
+{
+    if (member->scheduled || member->source.kind == SourceKind::Const || member->source.period == 0)
+        return;
+    member->scheduled = true;
+    m_heap.push({Clock::now() + std::chrono::milliseconds(member->source.period), member});
+    m_wake.notify_one();
+}
+
+bool Shard::Detach(Subscription *sub, std::unique_lock<std::mutex> &l)
+{
+    sub->dead = true;
+    auto &subs = sub->member->subscriptions;
+    subs.erase(std::remove(subs.begin(), subs.end(), sub), subs.end());
+    m_events.erase(std::remove_if(m_events.begin(), m_events.end(), [sub](const Event &e) { return e.sub == sub; }),
+                   m_events.end());
+    if (!m_delivering)
+        return true;
+    if (OnShardThread())
+        return false; // released from inside a callback of this batch
+    m_batchDone.wait(l, [this] { return !m_delivering; });
+    return true;
+}
+
+template <class F> void Shard::Deliver(std::unique_lock<std::mutex> &l, F callbacks)
+{
+    m_delivering = true;
+    l.unlock();
+    callbacks();
+    l.lock();
+    m_delivering = false;
+    m_batchDone.notify_all();
+    // Subscriptions released by their own callbacks go now that nothing of
+    // this batch refers to them.
+    std::vector<Subscription *> dead;
+    dead.swap(m_graveyard);
+    if (!dead.empty()) {
+        l.unlock();
+        for (Subscription *sub : dead)
+            delete sub;
+        l.lock();
+    }
+}
+
+void Shard::Run(unsigned generation)
+{
+    m_threadId = GetCurrentThreadId();
+    std::unique_lock<std::mutex> l(lock);
+    while (m_generation == generation) {
+        if (!m_events.empty()) {
+            Event e = m_events.front();
+            m_events.pop_front();
+            Dispatch(l, e);
+            continue;
+        }
+        if (!m_heap.empty() && m_heap.top().at <= Clock::now()) {
+            Due due = m_heap.top();
+            m_heap.pop();
+            Tick(l, due.member, due.at);
+            continue;
+        }
+        if (m_heap.empty())
+            m_wake.wait(l);
+        else
+            m_wake.wait_until(l, m_heap.top().at);
+    }
+}
+
+void Shard::Tick(std::unique_lock<std::mutex> &l, const std::shared_ptr<Member> &member, Clock::time_point at)
+{
+    Member &m = *member;
+    if (m.removed || m.subscriptions.empty()) {
+        m.scheduled = false;
+        return;
+    }
+    auto next = at + std::chrono::milliseconds(m.source.period);
+    auto now = Clock::now();
+    m_heap.push({next < now ? now + std::chrono::milliseconds(m.source.period) : next, member});
+    if (m.stalled || !m.machine->connected)
+        return;
+    m.value = NextValue(m, m_engine.ElapsedMs(), m_engine.Random());
+    m.hasValue = true;
+    GetSystemTimeAsFileTime(&m.time);
+
+    CadroValue value = {};
+    ToCadroValue(m.value, value);
+    std::vector<Subscription *> targets;
+    targets.reserve(m.subscriptions.size());
+    for (Subscription *sub : m.subscriptions)
+        if (sub->active)
+            targets.push_back(sub);
+    int32_t error = m.good ? 0 : 1;
+    uint32_t low, high;
+    Split(m.time, low, high);
+    Deliver(l, [&] {
+        for (Subscription *sub : targets)
+            if (!sub->dead)
+                sub->receiver->OnData(sub->cookie, kCadroHasValue | kCadroHasQuality | kCadroHasTime, &value, error,
+                                      low, high);
+    });
+    ClearCadroValue(value);
+}
+
+void Shard::Dispatch(std::unique_lock<std::mutex> &l, Event e)
+{
+    Subscription *sub = e.sub;
+    Member &m = *sub->member;
+    switch (e.kind) {
+    case EventKind::Status:
+        if (e.status == kCadroStatusDisconnected)
+            sub->active = false;
+        Deliver(l, [&] { sub->receiver->StatusChange(sub->cookie, e.status, 0, 0); });
+        return;
+    case EventKind::Attributes: {
+        CadroAttributes a;
+        Attributes(m, a);
+        Deliver(l, [&] { sub->receiver->OnAttributes(sub->cookie, &a); });
+        return;
+    }
+    case EventKind::Activate:
+        sub->active = true;
+        Schedule(sub->member);
+        [[fallthrough]];
+    case EventKind::Value: {
+        if (!sub->active || m.stalled || !m.hasValue || !m.machine->connected)
+            return;
+        CadroValue value = {};
+        ToCadroValue(m.value, value);
+        int32_t error = m.good ? 0 : 1;
+        uint32_t low, high;
+        Split(m.time, low, high);
+        Deliver(l, [&] {
+            if (!sub->dead)
+                sub->receiver->OnData(sub->cookie, kCadroHasValue | kCadroHasQuality | kCadroHasTime, &value, error,
+                                      low, high);
+        });
+        ClearCadroValue(value);
+        return;
+    }
+    }
+}
+
+} // namespace cadrosim

@@ -1,0 +1,220 @@
+#include "SimFixture.h"
+
+#include <thread>
+
+namespace {
+std::vector<uint32_t> Statuses(const std::vector<Delivery> &ds)
+{
+    std::vector<uint32_t> out;
+    for (const auto &d : ds)
+        if (d.kind == Delivery::Status)
+            out.push_back(d.status);
+    return out;
+}
+} // namespace
+
+TEST_F(SimTest, SubscribeReportsStatusThenAttributesThenValues)
+{
+    ASSERT_TRUE(Subscribe(L"\\\\.\\p\\o.num"));
+    void *cookie = LastCookie();
+    ASSERT_TRUE(recorder.WaitFor([&](auto &all) { return HasData(all, cookie, 1); }));
+    auto ds = Of(recorder.Snapshot(), cookie);
+    ASSERT_GE(ds.size(), 6u);
+    EXPECT_EQ(Statuses(ds), (std::vector<uint32_t>{13, 14, 16, 17}));
+    EXPECT_EQ(ds[4].kind, Delivery::Attributes);
+    EXPECT_EQ(ds[4].type, kCadroNumber);
+    EXPECT_EQ(ds[4].access, 3u);
+    EXPECT_EQ(ds[5].kind, Delivery::Data);
+    EXPECT_EQ(ds[5].flags, 7u);
+    EXPECT_EQ(ds[5].error, 0);
+    EXPECT_NE(ds[5].time.dwHighDateTime, 0u);
+
+    // The host's own name, an object's implicit member, a described member,
+    // nested objects and a quoted name all resolve.
+    for (const std::wstring &url : {L"\\\\" + Host() + L"\\p\\o.ro", std::wstring(L"\\\\.\\p\\o"),
+                                    std::wstring(L"\\\\.\\p\\o.dash"), std::wstring(L"\\\\.\\p\\o\\inner.deep"),
+                                    std::wstring(L"\\\\.\\p\\'o'.'num'"), std::wstring(L"\\\\other\\q\\z.tick")}) {
+        HRESULT hr;
+        EXPECT_TRUE(Subscribe(url, &hr)) << url;
+        EXPECT_EQ(hr, S_OK);
+    }
+    ASSERT_TRUE(recorder.WaitFor([&](auto &all) { return HasData(all, LastCookie(), 1); }));
+    void *implicit = reinterpret_cast<char *>(cookie) + 2;
+    ASSERT_TRUE(recorder.WaitFor([&](auto &all) { return HasData(all, implicit, 42); }));
+}
+
+TEST_F(SimTest, UnknownUrlsFailWithStatus18AndNoItem)
+{
+    for (const wchar_t *url : {L"\\\\.\\p\\o.missing", L"\\\\nowhere\\p\\o.num", L"\\\\.\\p", L"garbage", L"",
+                               L"\\\\.\\p\\o.num.extra", L"\\\\.\\p\\'o.num"}) {
+        HRESULT hr = S_OK;
+        EXPECT_FALSE(Subscribe(url, &hr)) << url;
+        EXPECT_LT(hr, 0) << url;
+        auto ds = Of(recorder.Snapshot(), LastCookie());
+        EXPECT_EQ(Statuses(ds), (std::vector<uint32_t>{13, 14, 16, 18})) << url;
+    }
+    SubscribeOptions options = {13, 7, 0, 0, 0};
+    CadroDataItem *item = nullptr;
+    EXPECT_EQ(realTime->Subscribe(nullptr, nullptr, &options, &item), E_POINTER);
+    EXPECT_EQ(realTime->Subscribe(L"\\\\.\\p\\o.num", nullptr, &options, nullptr), E_POINTER);
+}
+
+TEST_F(SimTest, ValuesArriveAtTheMemberPeriodAndReadGivesTheNewest)
+{
+    CadroDataItem *item = Subscribe(L"\\\\.\\p\\o.fast");
+    ASSERT_TRUE(item);
+    void *cookie = LastCookie();
+    ASSERT_TRUE(recorder.WaitFor([&](auto &all) { return DataCount(all, cookie) >= 10; }));
+    auto ds = Of(recorder.Snapshot(), cookie);
+    double last = -1;
+    for (const auto &d : ds) {
+        if (d.kind != Delivery::Data)
+            continue;
+        EXPECT_GT(d.number, last) << "a counter only goes up";
+        last = d.number;
+    }
+    uint32_t flags = 0;
+    CadroValue value = {};
+    int32_t error = -1;
+    FILETIME time = {};
+    ASSERT_EQ(item->Read(&flags, &value, &error, &time), S_OK);
+    EXPECT_EQ(flags, 7u);
+    EXPECT_EQ(value.type, kCadroNumber);
+    EXPECT_GE(value.number, last);
+
+    CadroDataItem *never = Subscribe(L"\\\\.\\p\\o.never");
+    ASSERT_TRUE(never);
+    ASSERT_EQ(never->Read(&flags, &value, &error, &time), S_OK);
+    EXPECT_EQ(flags & kCadroHasValue, 0u) << "no value yet";
+    Sleep(100);
+    EXPECT_EQ(recorder.Count(LastCookie(), Delivery::Data), 0u);
+    EXPECT_EQ(Statuses(Of(recorder.Snapshot(), LastCookie())), (std::vector<uint32_t>{13, 14, 16, 17}));
+}
+
+TEST_F(SimTest, WritesComeBackAsUpdatesAndReadOnlyMembersRefuse)
+{
+    CadroDataItem *num = Subscribe(L"\\\\.\\p\\o.num");
+    void *numCookie = LastCookie();
+    CadroDataItem *watcher = Subscribe(L"\\\\.\\p\\o.num"); // a second subscriber sees the echo too
+    void *watcherCookie = LastCookie();
+    CadroDataItem *ro = Subscribe(L"\\\\.\\p\\o.ro");
+    CadroDataItem *wide = Subscribe(L"\\\\.\\p\\o.wide");
+    void *wideCookie = LastCookie();
+    CadroDataItem *narrow = Subscribe(L"\\\\.\\p\\o.narrow");
+    void *narrowCookie = LastCookie();
+    ASSERT_TRUE(num && watcher && ro && wide && narrow);
+    ASSERT_TRUE(recorder.WaitFor([&](auto &all) { return HasData(all, watcherCookie, 1); }));
+
+    CadroValue v = {};
+    v.type = kCadroNumber;
+    v.number = 99.5;
+    EXPECT_EQ(num->Write(&v), S_OK);
+    EXPECT_TRUE(recorder.WaitFor([&](auto &all) { return HasData(all, numCookie, 99.5); }));
+    EXPECT_TRUE(recorder.WaitFor([&](auto &all) { return HasData(all, watcherCookie, 99.5); }));
+
+    EXPECT_EQ(ro->Write(&v), E_ACCESSDENIED);
+    EXPECT_NE(Command(L"show \\\\.\\p\\o.ro").find(L"value 5\n"), std::wstring::npos);
+
+    // Texts travel as text objects: wide ones through NewUnicodeGuts, and
+    // narrow members deliver narrow text.
+    ASSERT_TRUE(recorder.WaitFor([&](auto &all) {
+        for (const auto &d : Of(all, narrowCookie))
+            if (d.kind == Delivery::Data && d.type == kCadroNarrowText && d.text == L"abc")
+                return true;
+        return false;
+    }));
+    CadroValue text = {};
+    text.type = kCadroWideText;
+    text.text = NewUnicodeGuts(L"hello");
+    EXPECT_EQ(wide->Write(&text), S_OK);
+    text.text->Release();
+    EXPECT_TRUE(recorder.WaitFor([&](auto &all) {
+        for (const auto &d : Of(all, wideCookie))
+            if (d.kind == Delivery::Data && d.type == kCadroWideText && d.text == L"hello")
+                return true;
+        return false;
+    }));
+    CadroValue empty = {};
+    empty.type = kCadroWideText; // no text object: the empty text
+    EXPECT_EQ(narrow->Write(&empty), S_OK);
+    EXPECT_NE(Command(L"show \\\\.\\p\\o.narrow").find(L"value \n"), std::wstring::npos);
+    CadroValue bad = {};
+    bad.type = 77;
+    EXPECT_EQ(num->Write(&bad), DISP_E_TYPEMISMATCH);
+    EXPECT_EQ(num->Write(nullptr), E_POINTER);
+}
+
+TEST_F(SimTest, ReleaseEndsCallbacksBeforeItReturns)
+{
+    for (int round = 0; round < 20; ++round) {
+        CadroDataItem *item = Subscribe(L"\\\\.\\p\\o.fast");
+        void *cookie = LastCookie();
+        ASSERT_TRUE(recorder.WaitFor([&](auto &all) { return DataCount(all, cookie) >= 2; }));
+        Drop(item);
+        size_t after = recorder.Count(cookie, Delivery::Data);
+        Sleep(20);
+        EXPECT_EQ(recorder.Count(cookie, Delivery::Data), after) << "no callback after Release returned";
+    }
+    // A receiver that releases its item from inside its own callback.
+    CadroDataItem *self = Subscribe(L"\\\\.\\p\\o.fast");
+    void *selfCookie = LastCookie();
+    std::atomic<CadroDataItem *> pending{self};
+    items.clear(); // released by the callback
+    recorder.onData = [&](void *cookie) {
+        if (cookie == selfCookie)
+            if (CadroDataItem *it = pending.exchange(nullptr))
+                it->Release();
+    };
+    ASSERT_TRUE(recorder.WaitFor([&](auto &) { return pending.load() == nullptr; }));
+    Sleep(30);
+    size_t n = recorder.Count(selfCookie, Delivery::Data);
+    Sleep(30);
+    EXPECT_EQ(recorder.Count(selfCookie, Delivery::Data), n);
+    recorder.onData = nullptr;
+}
+
+TEST_F(SimTest, FaultsDisconnectStallAndBadQuality)
+{
+    Subscribe(L"\\\\other\\q\\z.tick");
+    void *tick = LastCookie();
+    ASSERT_TRUE(recorder.WaitFor([&](auto &all) { return DataCount(all, tick) >= 2; }));
+    EXPECT_EQ(Command(L"disconnect OTHER"), L"ok\n");
+    ASSERT_TRUE(recorder.WaitFor([&](auto &all) {
+        auto s = Statuses(Of(all, tick));
+        return !s.empty() && s.back() == 15;
+    }));
+    Sleep(50);
+    size_t during = recorder.Count(tick, Delivery::Data);
+    Sleep(100);
+    EXPECT_EQ(recorder.Count(tick, Delivery::Data), during) << "no values while disconnected";
+    EXPECT_EQ(Command(L"reconnect OTHER"), L"ok\n");
+    ASSERT_TRUE(recorder.WaitFor([&](auto &all) { return DataCount(all, tick) > during + 1; }));
+    auto s = Statuses(Of(recorder.Snapshot(), tick));
+    EXPECT_EQ(std::vector<uint32_t>(s.end() - 4, s.end()), (std::vector<uint32_t>{13, 14, 16, 17}));
+
+    EXPECT_EQ(Command(L"stall \\\\other\\q\\z.tick"), L"ok\n");
+    Sleep(60);
+    size_t stalled = recorder.Count(tick, Delivery::Data);
+    Sleep(100);
+    EXPECT_EQ(recorder.Count(tick, Delivery::Data), stalled);
+    EXPECT_EQ(Command(L"unstall \\\\other\\q\\z.tick"), L"ok\n");
+
+    Subscribe(L"\\\\.\\p\\o.ro");
+    void *ro = LastCookie();
+    EXPECT_EQ(Command(L"publish \\\\.\\p\\o.ro 17 quality=bad time=2026-01-02T03:04:05.678Z"), L"ok\n");
+    ASSERT_TRUE(recorder.WaitFor([&](auto &all) { return HasData(all, ro, 17); }));
+    for (const auto &d : Of(recorder.Snapshot(), ro)) {
+        if (d.kind == Delivery::Data && d.number == 17) {
+            EXPECT_EQ(d.error, 1);
+            SYSTEMTIME st;
+            FileTimeToSystemTime(&d.time, &st);
+            EXPECT_EQ(st.wYear, 2026);
+            EXPECT_EQ(st.wSecond, 5);
+            EXPECT_EQ(st.wMilliseconds, 678);
+        }
+    }
+    EXPECT_EQ(Command(L"publish \\\\.\\p\\o.ro notanumber").rfind(L"error:", 0), 0u);
+    EXPECT_EQ(Command(L"publish \\\\.\\p\\o.missing 1").rfind(L"error:", 0), 0u);
+    EXPECT_EQ(Command(L"disconnect NOWHERE").rfind(L"error:", 0), 0u);
+    EXPECT_EQ(Command(L"frobnicate").rfind(L"error:", 0), 0u);
+}
