@@ -86,6 +86,10 @@ private:
     std::priority_queue<Due, std::vector<Due>, std::greater<Due>> m_heap;
     std::vector<Subscription *> m_graveyard;
     bool m_delivering = false;
+    // Batches of callbacks begun and ended; a release waits only for the
+    // batch in flight when it detached, never for an idle moment.
+    uint64_t m_batchesStarted = 0;
+    uint64_t m_batchesFinished = 0;
     unsigned m_generation = 0;
     DWORD m_threadId = 0;
     std::thread m_thread;

@@ -72,16 +72,19 @@ bool Shard::Detach(Subscription *sub, std::unique_lock<std::mutex> &l)
         return true;
     if (OnShardThread())
         return false; // released from inside a callback of this batch
-    m_batchDone.wait(l, [this] { return !m_delivering; });
+    uint64_t inFlight = m_batchesStarted;
+    m_batchDone.wait(l, [this, inFlight] { return m_batchesFinished >= inFlight; });
     return true;
 }
 
 template <class F> void Shard::Deliver(std::unique_lock<std::mutex> &l, F callbacks)
 {
+    uint64_t batch = ++m_batchesStarted;
     m_delivering = true;
     l.unlock();
     callbacks();
     l.lock();
+    m_batchesFinished = batch;
     m_delivering = false;
     m_batchDone.notify_all();
     // Subscriptions released by their own callbacks go now that nothing of

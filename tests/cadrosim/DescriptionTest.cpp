@@ -1,5 +1,7 @@
 #include "SimFixture.h"
 
+#include <cstring>
+
 TEST(NetworkDescription, BadFilesGiveLineNumberedErrors)
 {
     struct Case {
@@ -52,4 +54,33 @@ TEST(NetworkDescription, TheDefaultNetworkServesEveryKindOfMember)
     // One waveform or generator member per kind of value source.
     for (const wchar_t *source : {L"sine", L"cosine", L"ramp", L"square", L"random", L"counter", L"toggle"})
         EXPECT_NE(all.find(source), std::wstring::npos) << source;
+}
+
+TEST(NetworkDescription, AFileNamedByTheEnvironmentReplacesTheDefault)
+{
+    wchar_t dir[MAX_PATH], path[MAX_PATH];
+    GetTempPathW(MAX_PATH, dir);
+    GetTempFileNameW(dir, L"net", 0, path);
+    auto write = [&](const char *text) {
+        HANDLE f = CreateFileW(path, GENERIC_WRITE, 0, nullptr, CREATE_ALWAYS, 0, nullptr);
+        DWORD n;
+        WriteFile(f, text, static_cast<DWORD>(strlen(text)), &n, nullptr);
+        CloseHandle(f);
+    };
+    write("machine FILEHOST\nprocess p\nobject o\nmember \"gr\xc3\xbc\xc3\x9f-utf8\" value=4\n");
+    SetEnvironmentVariableW(L"CADRO_NETWORK_FILE", path);
+    EXPECT_EQ(Command(L"reset"), L"ok\n");
+    EXPECT_NE(Command(L"status").find(std::wstring(L"network ") + path), std::wstring::npos);
+    EXPECT_NE(Command(L"browse \\\\FILEHOST\\p\\o").find(L"gr\u00fc\u00df-utf8"), std::wstring::npos);
+
+    write("machine A\nprocess p\nobject o\nmember x type=bogus\n");
+    EXPECT_EQ(Command(L"reset").rfind(L"error:", 0), 0u);
+    std::wstring status = Command(L"status");
+    EXPECT_NE(status.find(L"line 4: unknown member type 'bogus'"), std::wstring::npos) << status;
+    EXPECT_EQ(Command(L"browse \\"), L"ok\n") << "an unreadable description leaves the network empty";
+
+    SetEnvironmentVariableW(L"CADRO_NETWORK_FILE", nullptr);
+    DeleteFileW(path);
+    EXPECT_EQ(Command(L"reset"), L"ok\n");
+    EXPECT_NE(Command(L"status").find(L"built-in default network"), std::wstring::npos);
 }
