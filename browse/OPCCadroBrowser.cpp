@@ -2,6 +2,7 @@
 
 #include "Trace.h"
 
+#include <cstdio>
 #include <new>
 
 OPCCadroBrowser *OPCCadroBrowser::Create()
@@ -11,14 +12,46 @@ OPCCadroBrowser *OPCCadroBrowser::Create()
 
 HRESULT OPCCadroBrowser::Init()
 {
-    // The browse session is opened once the network libraries are linked.
-    m_open = true;
-    Trace("browser receiver initialised\n");
+    if (!NewCadroBrowser(0, this, &m_browser)) {
+        printf("Failed to get a CadroBrowser interface\n");
+        fflush(stdout);
+        Shutdown();
+        return E_FAIL;
+    }
     return S_OK;
 }
 
 void OPCCadroBrowser::Shutdown()
 {
-    m_open = false;
-    Trace("browser receiver shut down\n");
+    Trace("Freeing OPCCadroBrowser\n");
+    if (m_browser) {
+        Trace("Releasing the CadroBrowser interface\n");
+        m_browser->Release();
+        m_browser = nullptr;
+    }
+    if (m_session) {
+        Trace("Releasing the CadroSession interface\n");
+        m_session->Release();
+        m_session = nullptr;
+    }
+}
+
+STDMETHODIMP OPCCadroBrowser::QueryInterface(REFIID riid, void **ppv)
+{
+    if (!ppv)
+        return E_POINTER;
+    if (IsEqualIID(riid, IID_IUnknown) || IsEqualIID(riid, __uuidof(ICadroBrowserReceiver))) {
+        *ppv = static_cast<ICadroBrowserReceiver *>(this);
+        AddRef();
+        return S_OK;
+    }
+    *ppv = nullptr;
+    return E_NOINTERFACE;
+}
+
+HRESULT STDMETHODCALLTYPE OPCCadroBrowser::BrowseItemChanged()
+{
+    // The tree is refreshed on every descent; the notice is only traced.
+    Trace("Some browse item on the network has changed\n");
+    return 0;
 }

@@ -271,8 +271,10 @@ HRESULT Engine::Read(Subscription *sub, uint32_t *flags, CadroValue *value, int3
     if (!m.machine->connected)
         return kNotConnected;
     std::lock_guard<std::mutex> l(m.shard->lock);
-    if (!m.hasValue || m.removed)
-        return S_OK; // no value yet
+    if (!m.hasValue || m.removed) {
+        GetSystemTimeAsFileTime(time); // no value yet: the time of the query
+        return S_OK;
+    }
     if (!ToCadroValue(m.value, *value))
         return E_OUTOFMEMORY;
     *flags = kCadroHasValue | kCadroHasQuality | kCadroHasTime;

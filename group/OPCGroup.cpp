@@ -42,6 +42,8 @@ void *COPCGroup::FindInterface(REFIID riid)
 {
     if (IsEqualIID(riid, IID_IOPCGroupStateMgt))
         return static_cast<IOPCGroupStateMgt *>(this);
+    if (IsEqualIID(riid, IID_IOPCSyncIO))
+        return static_cast<IOPCSyncIO *>(this);
     if (IsEqualIID(riid, IID_IOPCItemMgt))
         return static_cast<IOPCItemMgt *>(this);
     return nullptr;
@@ -104,8 +106,7 @@ void COPCGroup::Destroy()
         return;
     m_destroyed = true;
     m_removing = true;
-    // Items arrive with item management; the group owns them.
-    m_items.clear();
+    m_items.clear(); // each item leaves the active list and ends its subscription
     if (m_serverHandle != 0)
         CIdMgr::Instance().ReleaseId(m_serverHandle);
     if (!m_idle.Reset())
@@ -120,8 +121,11 @@ void COPCGroup::SetActive(BOOL active)
     if (m_active == active)
         return;
     m_active = active;
-    // The update scanner and the items' out-of-service quality join here with
-    // subscriptions.
+    // Scheduling on the update scanner joins here with subscriptions.
+    if (!active) {
+        for (auto &entry : m_items)
+            entry.second->SetOutOfService();
+    }
 }
 
 STDMETHODIMP COPCGroup::GetState(DWORD *pUpdateRate, BOOL *pActive, LPWSTR *ppName, LONG *pTimeBias,
@@ -268,42 +272,13 @@ STDMETHODIMP COPCGroup::CloneGroup(LPCWSTR szName, REFIID riid, LPUNKNOWN *ppUnk
             server->RemoveGroup(newHandle, TRUE);
             return hr;
         }
-        // The items are copied once item management serves them.
-        return S_OK;
+        hr = CopyItems(itemMgt.Get());
+        if (FAILED(hr)) {
+            (*ppUnk)->Release();
+            *ppUnk = nullptr;
+            itemMgt.Reset();
+            server->RemoveGroup(newHandle, TRUE);
+        }
+        return hr;
     });
-}
-
-STDMETHODIMP COPCGroup::AddItems(DWORD, OPCITEMDEF *, OPCITEMRESULT **, HRESULT **)
-{
-    return E_NOTIMPL;
-}
-
-STDMETHODIMP COPCGroup::ValidateItems(DWORD, OPCITEMDEF *, BOOL, OPCITEMRESULT **, HRESULT **)
-{
-    return E_NOTIMPL;
-}
-
-STDMETHODIMP COPCGroup::RemoveItems(DWORD, OPCHANDLE *, HRESULT **)
-{
-    return E_NOTIMPL;
-}
-
-STDMETHODIMP COPCGroup::SetActiveState(DWORD, OPCHANDLE *, BOOL, HRESULT **)
-{
-    return E_NOTIMPL;
-}
-
-STDMETHODIMP COPCGroup::SetClientHandles(DWORD, OPCHANDLE *, OPCHANDLE *, HRESULT **)
-{
-    return E_NOTIMPL;
-}
-
-STDMETHODIMP COPCGroup::SetDatatypes(DWORD, OPCHANDLE *, VARTYPE *, HRESULT **)
-{
-    return E_NOTIMPL;
-}
-
-STDMETHODIMP COPCGroup::CreateEnumerator(REFIID, LPUNKNOWN *)
-{
-    return E_NOTIMPL;
 }

@@ -5,15 +5,22 @@
 #include "GroupOwner.h"
 #include "GroupRegistry.h"
 #include "Handle.h"
+#include "ItemOwner.h"
+#include "OPCItem.h"
 #include "SyncObject.h"
 #include "opcda.h"
 
+#include <atomic>
 #include <map>
+#include <memory>
 #include <string>
+#include <vector>
 
-class COPCItem;
-
-class COPCGroup : public CComObjectRoot, public IOPCGroupStateMgt, public IOPCItemMgt {
+class COPCGroup : public CComObjectRoot,
+                  public IOPCGroupStateMgt,
+                  public IOPCSyncIO,
+                  public IOPCItemMgt,
+                  private CItemOwner {
 public:
     // A group with a fresh server handle and no references; null when out of
     // memory or when no identifier is left.
@@ -29,7 +36,12 @@ public:
     STDMETHODIMP SetName(LPCWSTR szName) override;
     STDMETHODIMP CloneGroup(LPCWSTR szName, REFIID riid, LPUNKNOWN *ppUnk) override;
 
-    // IOPCItemMgt: items are not served yet.
+    // IOPCSyncIO
+    STDMETHODIMP Read(OPCDATASOURCE dwSource, DWORD dwCount, OPCHANDLE *phServer, OPCITEMSTATE **ppItemValues,
+                      HRESULT **ppErrors) override;
+    STDMETHODIMP Write(DWORD dwCount, OPCHANDLE *phServer, VARIANT *pItemValues, HRESULT **ppErrors) override;
+
+    // IOPCItemMgt
     STDMETHODIMP AddItems(DWORD dwCount, OPCITEMDEF *pItemArray, OPCITEMRESULT **ppAddResults,
                           HRESULT **ppErrors) override;
     STDMETHODIMP ValidateItems(DWORD dwCount, OPCITEMDEF *pItemArray, BOOL bBlobUpdate,
@@ -48,6 +60,21 @@ public:
     std::wstring Name();
     bool IsActive();
 
+    // The read and write passes of synchronous I/O, also run by the
+    // asynchronous transactions. Per item: client handle, value, quality,
+    // time stamp and result; S_FALSE when any item failed. Call with the
+    // group lock held.
+    struct ReadResult {
+        OPCHANDLE client = 0xFFFFFFFF;
+        VARIANT value;
+        WORD quality = 0;
+        FILETIME time = {};
+        HRESULT error = S_OK;
+    };
+    HRESULT ReadPass(OPCDATASOURCE source, DWORD count, const OPCHANDLE *handles, std::vector<ReadResult> &results);
+    HRESULT WritePass(DWORD count, const OPCHANDLE *handles, const VARIANT *values, HRESULT *errors,
+                      OPCHANDLE *clientHandles = nullptr);
+
     // Scanner entries and transactions that refer to the group.
     LONG AddPendingWork();
     LONG ReleasePendingWork();
@@ -65,6 +92,18 @@ protected:
     void FinalRelease() override;
 
 private:
+    // CItemOwner
+    CSyncObject &GroupLock() override { return m_lock; }
+    ActiveItemList &ActiveItems() override { return m_activeItems; }
+    bool GroupActive() const override { return m_active != FALSE; }
+
+    COPCItem *FindItem(OPCHANDLE handle);
+    // The common frame of the per-item operations on existing items.
+    template <class PerItem>
+    HRESULT ForEachHandle(DWORD count, const OPCHANDLE *handles, HRESULT **ppErrors, PerItem perItem);
+    HRESULT AddItemsLocked(DWORD count, const OPCITEMDEF *items, OPCITEMRESULT *results, HRESULT *errors);
+    HRESULT CopyItems(IOPCItemMgt *target);
+
     template <class T, class... Args> friend T *NewComObject(Args &&...args);
     COPCGroup();
     ~COPCGroup() override = default;
@@ -73,11 +112,12 @@ private:
     UniqueHandle m_idle;     // manual reset; signalled while no work is pending
     LONG m_pendingWork = 0;
     CGroupOwner *m_owner = nullptr;
-    std::map<OPCHANDLE, COPCItem *> m_items;
+    std::map<OPCHANDLE, std::unique_ptr<COPCItem>> m_items;
+    ActiveItemList m_activeItems;
     bool m_removing = false;
     bool m_destroyed = false;
     DWORD m_updateRate = 0;
-    BOOL m_active = FALSE;
+    std::atomic<BOOL> m_active{FALSE}; // also read without the lock by items
     BOOL m_enable = TRUE;
     std::wstring m_name;
     LONG m_timeBias = 0;

@@ -1,7 +1,10 @@
 #include "OPCCadroClient.h"
 
+#include "OPCItem.h"
 #include "Trace.h"
 
+#include <cstdio>
+#include <cwchar>
 #include <new>
 
 OPCCadroClient *OPCCadroClient::Create()
@@ -11,14 +14,103 @@ OPCCadroClient *OPCCadroClient::Create()
 
 HRESULT OPCCadroClient::Init()
 {
-    // The real-time session is opened once the network libraries are linked.
-    m_open = true;
-    Trace("real-time client initialised\n");
+    Trace("Initializing OPCCadroClient\n");
+    if (!NewCadroRealTime(0, this, &m_realTime)) {
+        printf("Failed to get a CadroRealTime interface\n");
+        fflush(stdout);
+        Shutdown();
+        return E_FAIL;
+    }
     return S_OK;
 }
 
 void OPCCadroClient::Shutdown()
 {
-    m_open = false;
-    Trace("real-time client shut down\n");
+    Trace("Freeing OPCCadroClient\n");
+    if (m_realTime) {
+        Trace("Releasing the CadroRealTime interface\n");
+        m_realTime->Release();
+        m_realTime = nullptr;
+    }
+    if (m_session) {
+        Trace("Releasing the CadroSession interface\n");
+        m_session->Release();
+        m_session = nullptr;
+    }
+}
+
+wchar_t *ExpandLocalMachine(const wchar_t *url)
+{
+    if (wcsncmp(url, L"\\\\.\\", 4) != 0)
+        return nullptr;
+    BSTR host = nullptr;
+    GetHostMachineName(&host);
+    size_t hostLength = host ? SysStringLen(host) : 0;
+    size_t rest = wcslen(url + 3); // from the backslash after the dot
+    auto *expanded = static_cast<wchar_t *>(cdd_malloc((2 + hostLength + rest + 1) * sizeof(wchar_t)));
+    if (expanded) {
+        wcscpy(expanded, L"\\\\");
+        if (host)
+            wcscat(expanded, host);
+        wcscat(expanded, url + 3);
+    }
+    SysFreeString(host);
+    return expanded;
+}
+
+HRESULT OPCCadroClient::Subscribe(const wchar_t *url, COPCItem *item, CadroDataItem **out)
+{
+    *out = nullptr;
+    // No session (the factory failed): the network cannot know the item.
+    if (!m_realTime)
+        return E_FAIL;
+    SubscribeOptions options = {13, 7, 0, 0, 0};
+    wchar_t *expanded = ExpandLocalMachine(url);
+    HRESULT hr = m_realTime->Subscribe(expanded ? expanded : url, item, &options, out);
+    cdd_free(expanded);
+    return hr;
+}
+
+STDMETHODIMP OPCCadroClient::QueryInterface(REFIID riid, void **ppv)
+{
+    if (!ppv)
+        return E_POINTER;
+    if (IsEqualIID(riid, IID_IUnknown) || IsEqualIID(riid, __uuidof(ICadroRealTimeReceiver))) {
+        *ppv = static_cast<ICadroRealTimeReceiver *>(this);
+        AddRef();
+        return S_OK;
+    }
+    *ppv = nullptr;
+    return E_NOINTERFACE;
+}
+
+HRESULT STDMETHODCALLTYPE OPCCadroClient::OnData(void *cookie, uint32_t flags, const CadroValue *value,
+                                                 int32_t errorFlag, uint32_t timeLow, uint32_t timeHigh)
+{
+    if (cookie && value)
+        static_cast<COPCItem *>(cookie)->OnDataUpdate(flags, *value, errorFlag, FILETIME{timeLow, timeHigh});
+    return S_OK;
+}
+
+HRESULT STDMETHODCALLTYPE OPCCadroClient::OnAttributes(void *cookie, const CadroAttributes *attributes)
+{
+    if (cookie && attributes)
+        static_cast<COPCItem *>(cookie)->OnAttributesUpdate(*attributes);
+    return S_OK;
+}
+
+HRESULT STDMETHODCALLTYPE OPCCadroClient::StatusChange(void *cookie, uint32_t status, uint32_t, uint32_t)
+{
+    static const char *const texts[] = {"Cadro: Connecting to the server....\n",
+                                        "Cadro: The server has been contacted.\n",
+                                        "Cadro: The connection was disconnected by the server!\n",
+                                        "Cadro: Subscribing to the data item on the server.\n",
+                                        "Cadro: The subscription was successful.\n",
+                                        "Cadro: The subscription failed!\n"};
+    Trace("StatusChange\n");
+    if (status >= 13 && status <= 18)
+        Trace("%s", texts[status - 13]);
+    if (cookie)
+        static_cast<COPCItem *>(cookie)->OnStatusUpdate(status);
+    return S_OK;
 }

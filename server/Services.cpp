@@ -1,6 +1,7 @@
 #include "Services.h"
 
 #include "AddrSpace.h"
+#include "ItemServices.h"
 #include "OPCCadroBrowser.h"
 #include "OPCCadroClient.h"
 #include "SyncObject.h"
@@ -50,6 +51,7 @@ void ServerServices::ServerConstructed()
                 INTERNAL_ASSERT_FAILED("address space construction");
         }
         StartService(g_realTimeClient);
+        ItemServices::SetRealTimeClient(g_realTimeClient);
         StartService(g_browser);
     }
     ++g_serverCount;
@@ -59,6 +61,7 @@ void ServerServices::ServerReleased()
 {
     CSingleLock lock(&g_servicesLock);
     if (--g_serverCount == 0) {
+        ItemServices::SetRealTimeClient(nullptr);
         StopService(g_realTimeClient);
         StopService(g_browser);
     }

@@ -1,0 +1,110 @@
+// IOPCSyncIO of the group and the read and write passes that the
+// asynchronous transactions reuse.
+#include "ComUtil.h"
+#include "OPCGroup.h"
+#include "OpcErrors.h"
+#include "TaskMem.h"
+
+namespace {
+template <class T> bool Readable(const T *array, DWORD count)
+{
+    return array && count != 0 && IsReadable(array, static_cast<size_t>(count) * sizeof(T));
+}
+} // namespace
+
+HRESULT COPCGroup::ReadPass(OPCDATASOURCE source, DWORD count, const OPCHANDLE *handles,
+                            std::vector<ReadResult> &results)
+{
+    results.resize(count);
+    bool anyFailed = false;
+    for (DWORD i = 0; i < count; ++i) {
+        ReadResult &r = results[i];
+        VariantInit(&r.value);
+        COPCItem *item = FindItem(handles[i]);
+        if (item)
+            r.client = item->ClientHandle();
+        if (!item)
+            r.error = OPC_E_INVALIDHANDLE;
+        else if (!(item->AccessRights() & OPC_READABLE))
+            r.error = OPC_E_BADRIGHTS;
+        else
+            r.error = item->Read(source, &r.client, &r.value, &r.quality, &r.time);
+        if (FAILED(r.error)) {
+            r.quality = 0;
+            VariantClear(&r.value);
+            anyFailed = true;
+        }
+    }
+    return anyFailed ? S_FALSE : S_OK;
+}
+
+HRESULT COPCGroup::WritePass(DWORD count, const OPCHANDLE *handles, const VARIANT *values, HRESULT *errors,
+                             OPCHANDLE *clientHandles)
+{
+    bool anyFailed = false;
+    for (DWORD i = 0; i < count; ++i) {
+        COPCItem *item = FindItem(handles[i]);
+        if (!item) {
+            errors[i] = OPC_E_INVALIDHANDLE;
+        } else {
+            if (clientHandles)
+                clientHandles[i] = item->ClientHandle();
+            errors[i] = item->Write(values[i]);
+        }
+        anyFailed |= errors[i] != S_OK;
+    }
+    return anyFailed ? S_FALSE : S_OK;
+}
+
+STDMETHODIMP COPCGroup::Read(OPCDATASOURCE dwSource, DWORD dwCount, OPCHANDLE *phServer, OPCITEMSTATE **ppItemValues,
+                             HRESULT **ppErrors)
+{
+    return ComBoundary([&]() -> HRESULT {
+        CSingleLock lock(&m_lock);
+        if (m_removing)
+            return E_FAIL;
+        if (!IsWritableOut(ppItemValues) || !IsWritableOut(ppErrors))
+            return E_INVALIDARG;
+        *ppItemValues = nullptr;
+        *ppErrors = nullptr;
+        if ((dwSource != OPC_DS_CACHE && dwSource != OPC_DS_DEVICE) || !Readable(phServer, dwCount))
+            return E_INVALIDARG;
+        TaskMem<OPCITEMSTATE> states;
+        TaskMem<HRESULT> errors;
+        if (!states.Allocate(dwCount) || !errors.Allocate(dwCount))
+            return E_OUTOFMEMORY;
+        std::vector<ReadResult> results;
+        HRESULT overall = ReadPass(dwSource, dwCount, phServer, results);
+        for (DWORD i = 0; i < dwCount; ++i) {
+            OPCITEMSTATE &s = states[i];
+            s.hClient = results[i].client;
+            s.ftTimeStamp = results[i].time;
+            s.wQuality = results[i].quality;
+            s.vDataValue = results[i].value; // moved in
+            errors[i] = results[i].error;
+        }
+        *ppItemValues = states.Detach();
+        *ppErrors = errors.Detach();
+        return overall;
+    });
+}
+
+STDMETHODIMP COPCGroup::Write(DWORD dwCount, OPCHANDLE *phServer, VARIANT *pItemValues, HRESULT **ppErrors)
+{
+    return ComBoundary([&]() -> HRESULT {
+        CSingleLock lock(&m_lock);
+        if (m_removing)
+            return E_FAIL;
+        if (!IsWritableOut(ppErrors))
+            return E_INVALIDARG;
+        *ppErrors = nullptr;
+        if (!Readable(phServer, dwCount) || !Readable(pItemValues, dwCount))
+            return E_INVALIDARG;
+        TaskMem<HRESULT> errors;
+        if (!errors.Allocate(dwCount))
+            return E_OUTOFMEMORY;
+        HRESULT overall = WritePass(dwCount, phServer, pItemValues, errors.Get());
+        *ppErrors = errors.Detach();
+        return overall;
+    });
+}

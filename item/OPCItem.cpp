@@ -1,0 +1,303 @@
+#include "OPCItem.h"
+
+#include "IdMgr.h"
+#include "ItemServices.h"
+#include "OPCCadroClient.h"
+#include "OpcErrors.h"
+#include "Trace.h"
+
+#include <cstring>
+
+namespace {
+constexpr DWORD kFirstValueWaitMs = 3000;
+
+bool IsZero(const FILETIME &t)
+{
+    return t.dwLowDateTime == 0 && t.dwHighDateTime == 0;
+}
+
+wchar_t *CopyText(const std::wstring &text, void *(*allocate)(size_t))
+{
+    auto *copy = static_cast<wchar_t *>(allocate((text.size() + 1) * sizeof(wchar_t)));
+    if (copy)
+        memcpy(copy, text.c_str(), (text.size() + 1) * sizeof(wchar_t));
+    return copy;
+}
+} // namespace
+
+COPCItem::COPCItem() : m_valueArrived(CreateEventW(nullptr, TRUE, FALSE, nullptr))
+{
+    if (!m_valueArrived)
+        INTERNAL_ASSERT_FAILED("CreateEvent for an item's value-arrived event");
+}
+
+COPCItem::~COPCItem()
+{
+    SetActive(FALSE);
+    // Released without the item lock: the release waits for callbacks in
+    // flight, which take that lock.
+    if (m_dataItem)
+        m_dataItem->Release();
+}
+
+HRESULT COPCItem::Init(CItemOwner *group, const OPCITEMDEF &definition, OPCITEMRESULT &result)
+{
+    {
+        CSingleLock lock(&m_lock);
+        memset(&result, 0, sizeof result);
+        m_group = group;
+        m_accessPath = definition.szAccessPath ? definition.szAccessPath : L"";
+        m_itemId = definition.szItemID ? definition.szItemID : L"";
+        m_clientHandle = definition.hClient;
+        m_requestedType = definition.vtRequestedDataType;
+        m_serverHandle = CIdMgr::Instance().GetId();
+        m_accessRights = OPC_READABLE | OPC_WRITEABLE;
+        m_canonicalType = VT_EMPTY;
+        if (m_itemId.empty())
+            return OPC_E_INVALIDITEMID;
+        if (m_serverHandle == 0)
+            return E_OUTOFMEMORY; // no identifier left for a handle
+        DWORD rights;
+        VARTYPE type;
+        if (ItemServices::FindNode(m_itemId, type, rights)) {
+            m_canonicalType = type;
+            m_accessRights = rights;
+        } else {
+            // Unknown to the address space: the requested type, normalized.
+            m_canonicalType = NormalizedType(m_requestedType);
+            if (m_canonicalType == VT_EMPTY)
+                m_canonicalType = VT_R8;
+        }
+    }
+    // Subscribed without the item lock: the library may call back at once.
+    if (OPCCadroClient *client = ItemServices::RealTimeClient()) {
+        CadroDataItem *dataItem = nullptr;
+        HRESULT hr = client->Subscribe(m_itemId.c_str(), this, &dataItem);
+        if (FAILED(hr))
+            return OPC_E_UNKNOWNITEMID;
+        m_dataItem = dataItem;
+    }
+    CSingleLock lock(&m_lock);
+    if (m_requestedType != VT_EMPTY && FAILED(IsConvertible(m_canonicalType, m_requestedType)))
+        return OPC_E_BADTYPE;
+    result.hServer = m_serverHandle;
+    result.vtCanonicalDataType = m_canonicalType;
+    result.dwAccessRights = m_accessRights;
+    lock.Unlock();
+    return SetActive(definition.bActive);
+}
+
+HRESULT COPCItem::SetActive(BOOL active)
+{
+    CSingleLock lock(&m_lock);
+    active = active ? TRUE : FALSE;
+    if (m_active == active || !m_group)
+        return S_OK;
+    CSingleLock groupLock(&m_group->GroupLock());
+    m_active = active;
+    if (!active) {
+        m_group->ActiveItems().erase(m_activePosition);
+        if (m_group->GroupActive())
+            m_lastQuality = OPC_QUALITY_OUT_OF_SERVICE;
+    } else {
+        m_group->ActiveItems().push_front(this);
+        m_activePosition = m_group->ActiveItems().begin();
+    }
+    return S_OK;
+}
+
+HRESULT COPCItem::SetOutOfService()
+{
+    CSingleLock lock(&m_lock);
+    m_lastQuality = OPC_QUALITY_OUT_OF_SERVICE;
+    return S_OK;
+}
+
+DWORD COPCItem::AccessRights()
+{
+    CSingleLock lock(&m_lock);
+    return m_accessRights;
+}
+
+OPCHANDLE COPCItem::ClientHandle()
+{
+    CSingleLock lock(&m_lock);
+    return m_clientHandle;
+}
+
+void COPCItem::SetClientHandle(OPCHANDLE client)
+{
+    CSingleLock lock(&m_lock);
+    m_clientHandle = client;
+}
+
+void COPCItem::SetRequestedType(VARTYPE type)
+{
+    CSingleLock lock(&m_lock);
+    m_requestedType = type;
+}
+
+HRESULT COPCItem::GetAttributes(OPCITEMATTRIBUTES &record, void *(*allocate)(size_t))
+{
+    CSingleLock lock(&m_lock);
+    memset(&record, 0, sizeof record);
+    record.szAccessPath = CopyText(m_accessPath, allocate);
+    record.szItemID = CopyText(m_itemId, allocate);
+    record.bActive = m_active;
+    record.hClient = m_clientHandle;
+    record.hServer = m_serverHandle;
+    record.dwAccessRights = m_accessRights;
+    record.vtRequestedDataType = m_requestedType;
+    record.vtCanonicalDataType = m_canonicalType;
+    record.dwEUType = OPC_NOENUM;
+    VariantInit(&record.vEUInfo);
+    return record.szAccessPath && record.szItemID ? S_OK : E_OUTOFMEMORY;
+}
+
+HRESULT COPCItem::ToRequestedType(VARIANT *value)
+{
+    if (m_requestedType == VT_EMPTY || m_requestedType == m_canonicalType)
+        return S_OK;
+    HRESULT hr = VariantChangeType(value, value, 0, m_requestedType);
+    if (FAILED(hr))
+        VariantClear(value);
+    return hr;
+}
+
+void COPCItem::CopyDeviceToLastReported()
+{
+    CopyVariant(m_lastValue.Get(), m_deviceValue.Value());
+    m_lastQuality = m_deviceQuality;
+    m_lastTime = m_deviceTime;
+}
+
+HRESULT COPCItem::Read(OPCDATASOURCE source, OPCHANDLE *client, VARIANT *value, WORD *quality, FILETIME *time)
+{
+    // Ask the network first, and wait for a first value, without the item
+    // lock: updates must be able to arrive meanwhile.
+    if (m_dataItem) {
+        uint32_t flags = 0;
+        CCadroValue record;
+        int32_t error = 0;
+        FILETIME stamp = {};
+        HRESULT hr = m_dataItem->Read(&flags, record.Get(), &error, &stamp);
+        if (SUCCEEDED(hr) && (flags & kCadroHasValue)) {
+            OnDataUpdate(flags, record.Value(), error, stamp);
+            hr = S_OK;
+        } else {
+            hr = WaitForSingleObject(m_valueArrived.Get(), kFirstValueWaitMs) == WAIT_OBJECT_0 ? S_OK
+                                                                                               : OPC_E_UNKNOWNITEMID;
+        }
+        CSingleLock lock(&m_lock);
+        if (SUCCEEDED(hr)) {
+            if (m_accessRights == 0 || IsZero(stamp))
+                hr = OPC_E_UNKNOWNITEMID;
+            else if (!(m_accessRights & OPC_READABLE))
+                hr = OPC_E_BADRIGHTS;
+        }
+        m_lastReadResult = hr;
+    }
+
+    VariantInit(value);
+    CSingleLock lock(&m_lock);
+    *client = m_clientHandle;
+    HRESULT result = m_lastReadResult;
+    bool inactive = !m_active || (m_group && !m_group->GroupActive());
+    if (source != OPC_DS_DEVICE && inactive) {
+        CopyVariant(m_lastValue.Get(), m_deviceValue.Value());
+        m_lastQuality = OPC_QUALITY_OUT_OF_SERVICE;
+    } else {
+        CopyDeviceToLastReported();
+    }
+    *quality = m_lastQuality;
+    *time = m_lastTime;
+    if (FAILED(result))
+        return result;
+    result = VariantCopy(value, m_lastValue.Get());
+    if (SUCCEEDED(result))
+        result = ToRequestedType(value);
+    if (FAILED(result))
+        VariantClear(value);
+    return result;
+}
+
+HRESULT COPCItem::Write(const VARIANT &value)
+{
+    CSingleLock lock(&m_lock);
+    HRESULT hr = S_OK;
+    CCadroValue record;
+    if (!(m_accessRights & OPC_WRITEABLE)) {
+        hr = OPC_E_BADRIGHTS;
+    } else {
+        CopyVariant(m_lastWritten.Get(), value);
+        if (V_VT(m_lastWritten.Get()) != m_canonicalType)
+            hr = VariantChangeType(m_lastWritten.Get(), m_lastWritten.Get(), 0, m_canonicalType);
+        if (SUCCEEDED(hr))
+            hr = VariantToCadroValue(m_lastWritten.Value(), record);
+        if (SUCCEEDED(hr)) {
+            if (m_dataItem)
+                m_dataItem->Write(record.Get()); // the network answers with an update
+            else
+                hr = E_FAIL;
+        }
+    }
+    m_writeResult = hr;
+    return hr;
+}
+
+HRESULT COPCItem::CheckChanged(double, OPCHANDLE *client, VARIANT *value, WORD *quality, FILETIME *time, bool *changed)
+{
+    CSingleLock lock(&m_lock);
+    *client = m_clientHandle;
+    *changed = false;
+    bool readable = (m_accessRights & OPC_READABLE) != 0;
+    CVariant copy;
+    if (readable)
+        CopyVariant(copy.Get(), m_deviceValue.Value());
+    *quality = m_deviceQuality;
+    *time = m_deviceTime;
+    if (!readable)
+        return OPC_E_BADRIGHTS;
+    // Time stamps are not compared; the deadband has no effect without
+    // engineering units.
+    if (m_deviceQuality == m_lastQuality && VariantEquals(m_deviceValue.Value(), m_lastValue.Value()))
+        return S_OK;
+    *changed = true;
+    CopyDeviceToLastReported();
+    MoveVariant(value, copy.Get());
+    return ToRequestedType(value);
+}
+
+void COPCItem::OnDataUpdate(uint32_t flags, const CadroValue &value, int32_t errorFlag, const FILETIME &time)
+{
+    CSingleLock lock(&m_lock);
+    if (flags & kCadroHasQuality)
+        m_deviceQuality = errorFlag == 0 ? OPC_QUALITY_GOOD : OPC_QUALITY_BAD;
+    if (flags & kCadroHasValue) {
+        m_lastReadResult = CadroValueToVariant(value, m_deviceValue.Get());
+        SetEvent(m_valueArrived.Get());
+    }
+    if (flags & kCadroHasTime)
+        m_deviceTime = time;
+    else
+        GetSystemTimeAsFileTime(&m_deviceTime);
+}
+
+void COPCItem::OnAttributesUpdate(const CadroAttributes &attributes)
+{
+    CSingleLock lock(&m_lock);
+    if (attributes.mask & 0x02)
+        m_canonicalType = NetworkTypeToVarType(attributes.dataType);
+    if (attributes.mask & 0x04) {
+        m_accessRights = ((attributes.access & 1) ? OPC_READABLE : 0) | ((attributes.access & 2) ? OPC_WRITEABLE : 0);
+        if (!(m_accessRights & OPC_READABLE))
+            SetEvent(m_valueArrived.Get()); // a read waiting for a value stops waiting
+    }
+}
+
+void COPCItem::OnStatusUpdate(uint32_t status)
+{
+    // No lock: only the event changes.
+    if (status == 5 || status == 15)
+        ResetEvent(m_valueArrived.Get());
+}

@@ -1,0 +1,71 @@
+#pragma once
+// One data value of the Cadro network as a group's client sees it: identity,
+// handles, types, rights, the newest network value (device record), the
+// value last handed to the client (last reported record) and the item's own
+// network subscription. Owned and deleted by its group.
+#include "CadroNetwork.h"
+#include "Handle.h"
+#include "ItemOwner.h"
+#include "SyncObject.h"
+#include "ValueConversion.h"
+#include "opcda.h"
+
+#include <string>
+
+class COPCItem {
+public:
+    COPCItem();
+    virtual ~COPCItem();
+    COPCItem(const COPCItem &) = delete;
+    COPCItem &operator=(const COPCItem &) = delete;
+
+    HRESULT Init(CItemOwner *group, const OPCITEMDEF &definition, OPCITEMRESULT &result);
+    HRESULT SetActive(BOOL active);
+    // Copies of the texts come from allocate (CoTaskMemAlloc or malloc).
+    HRESULT GetAttributes(OPCITEMATTRIBUTES &record, void *(*allocate)(size_t));
+    HRESULT Read(OPCDATASOURCE source, OPCHANDLE *client, VARIANT *value, WORD *quality, FILETIME *time);
+    HRESULT Write(const VARIANT &value);
+    HRESULT CheckChanged(double deadbandFraction, OPCHANDLE *client, VARIANT *value, WORD *quality, FILETIME *time,
+                         bool *changed);
+    HRESULT SetOutOfService();
+
+    // Network updates, from the real-time client.
+    void OnDataUpdate(uint32_t flags, const CadroValue &value, int32_t errorFlag, const FILETIME &time);
+    void OnAttributesUpdate(const CadroAttributes &attributes);
+    void OnStatusUpdate(uint32_t status);
+
+    OPCHANDLE ServerHandle() const { return m_serverHandle; }
+    DWORD AccessRights();
+    OPCHANDLE ClientHandle();
+    void SetClientHandle(OPCHANDLE client);
+    void SetRequestedType(VARTYPE type);
+    CSyncObject &Lock() { return m_lock; }
+
+private:
+    // Converts an output value to the requested type when one is set.
+    HRESULT ToRequestedType(VARIANT *value);
+    void CopyDeviceToLastReported();
+
+    CCriticalSection m_lock;
+    CItemOwner *m_group = nullptr;
+    std::wstring m_accessPath;
+    std::wstring m_itemId;
+    BOOL m_active = FALSE;
+    ActiveItemList::iterator m_activePosition;
+    OPCHANDLE m_clientHandle = 0;
+    OPCHANDLE m_serverHandle = 0;
+    DWORD m_accessRights = 3;
+    VARTYPE m_requestedType = VT_EMPTY;
+    VARTYPE m_canonicalType = VT_EMPTY;
+    CVariant m_lastValue;
+    WORD m_lastQuality = 0x00;
+    FILETIME m_lastTime = {};
+    HRESULT m_lastReadResult = S_OK;
+    CVariant m_lastWritten;
+    HRESULT m_writeResult = S_OK;
+    CVariant m_deviceValue;
+    WORD m_deviceQuality = 0xC0;
+    FILETIME m_deviceTime = {};
+    UniqueHandle m_valueArrived;
+    CadroDataItem *m_dataItem = nullptr;
+};
