@@ -34,7 +34,7 @@ bool WaitForNoServerProcess(DWORD timeoutMs)
     return true;
 }
 
-std::wstring ServerExePath()
+std::wstring BinPath(const wchar_t *file)
 {
     if (const char *dir = getenv("SKYLARC_BIN_DIR")) {
         // A Unix path from CTest: Wine maps it through drive Z:.
@@ -42,12 +42,12 @@ std::wstring ServerExePath()
         std::wstring path = L"Z:";
         for (char c : unix)
             path += c == '/' ? L'\\' : static_cast<wchar_t>(c);
-        return path + L"\\Local.exe";
+        return path + L"\\" + file;
     }
     wchar_t self[MAX_PATH];
     GetModuleFileNameW(nullptr, self, MAX_PATH);
     std::wstring path(self);
-    return path.substr(0, path.find_last_of(L'\\') + 1) + L"Local.exe";
+    return path.substr(0, path.find_last_of(L'\\') + 1) + file;
 }
 
 HANDLE StartProcess(const std::wstring &commandLine)
@@ -93,4 +93,35 @@ std::wstring ReadString(HKEY root, const std::wstring &path, const wchar_t *name
     if (RegGetValueW(root, path.c_str(), name, RRF_RT_REG_SZ, nullptr, data, &size) != ERROR_SUCCESS)
         return L"<missing>";
     return data;
+}
+
+long RunAndCapture(const std::wstring &commandLine, std::string &output, DWORD timeoutMs)
+{
+    SECURITY_ATTRIBUTES sa = {sizeof sa, nullptr, TRUE};
+    HANDLE readEnd = nullptr, writeEnd = nullptr;
+    if (!CreatePipe(&readEnd, &writeEnd, &sa, 0))
+        return -1;
+    UniqueHandle reader(readEnd), writer(writeEnd);
+    SetHandleInformation(readEnd, HANDLE_FLAG_INHERIT, 0);
+    STARTUPINFOW si = {};
+    si.cb = sizeof si;
+    si.dwFlags = STARTF_USESTDHANDLES;
+    si.hStdOutput = writeEnd;
+    si.hStdError = writeEnd;
+    PROCESS_INFORMATION pi = {};
+    std::wstring line = commandLine;
+    if (!CreateProcessW(nullptr, line.data(), nullptr, nullptr, TRUE, 0, nullptr, nullptr, &si, &pi))
+        return -1;
+    UniqueHandle process(pi.hProcess), thread(pi.hThread);
+    writer.Reset();
+    output.clear();
+    char buffer[4096];
+    DWORD got = 0;
+    while (ReadFile(readEnd, buffer, sizeof buffer, &got, nullptr) && got)
+        output.append(buffer, got);
+    if (WaitForSingleObject(process.Get(), timeoutMs) != WAIT_OBJECT_0)
+        return -1;
+    DWORD code = 0;
+    GetExitCodeProcess(process.Get(), &code);
+    return static_cast<long>(code);
 }

@@ -11,10 +11,17 @@ extern const CLSID CLSID_SkylarcOPCServerE2E;
 int CountServerProcesses();
 // Waits up to timeoutMs for no server process to be left.
 bool WaitForNoServerProcess(DWORD timeoutMs);
-// Full path of Local.exe (from SKYLARC_BIN_DIR, else beside this program).
-std::wstring ServerExePath();
+// Full path of a program of the build (from SKYLARC_BIN_DIR, else beside
+// this program).
+std::wstring BinPath(const wchar_t *file);
+inline std::wstring ServerExePath()
+{
+    return BinPath(L"Local.exe");
+}
 // Starts commandLine; null handle on failure.
 HANDLE StartProcess(const std::wstring &commandLine);
+// Runs commandLine, collecting what it prints; returns its exit code or -1.
+long RunAndCapture(const std::wstring &commandLine, std::string &output, DWORD timeoutMs = 30000);
 // Runs commandLine and returns its exit code, or -1 if it cannot be started
 // or does not end within timeoutMs.
 long RunAndWait(const std::wstring &commandLine, DWORD timeoutMs);
