@@ -25,11 +25,7 @@ wchar_t *CopyText(const std::wstring &text, void *(*allocate)(size_t))
 }
 } // namespace
 
-COPCItem::COPCItem() : m_valueArrived(CreateEventW(nullptr, TRUE, FALSE, nullptr))
-{
-    if (!m_valueArrived)
-        INTERNAL_ASSERT_FAILED("CreateEvent for an item's value-arrived event");
-}
+COPCItem::COPCItem() = default;
 
 COPCItem::~COPCItem()
 {
@@ -185,8 +181,7 @@ HRESULT COPCItem::Read(OPCDATASOURCE source, OPCHANDLE *client, VARIANT *value, 
             OnDataUpdate(flags, record.Value(), error, stamp);
             hr = S_OK;
         } else {
-            hr = WaitForSingleObject(m_valueArrived.Get(), kFirstValueWaitMs) == WAIT_OBJECT_0 ? S_OK
-                                                                                               : OPC_E_UNKNOWNITEMID;
+            hr = m_valueArrived.Wait(kFirstValueWaitMs) ? S_OK : OPC_E_UNKNOWNITEMID;
         }
         CSingleLock lock(&m_lock);
         if (SUCCEEDED(hr)) {
@@ -275,7 +270,7 @@ void COPCItem::OnDataUpdate(uint32_t flags, const CadroValue &value, int32_t err
         m_deviceQuality = errorFlag == 0 ? OPC_QUALITY_GOOD : OPC_QUALITY_BAD;
     if (flags & kCadroHasValue) {
         m_lastReadResult = CadroValueToVariant(value, m_deviceValue.Get());
-        SetEvent(m_valueArrived.Get());
+        m_valueArrived.Set();
     }
     if (flags & kCadroHasTime)
         m_deviceTime = time;
@@ -291,7 +286,7 @@ void COPCItem::OnAttributesUpdate(const CadroAttributes &attributes)
     if (attributes.mask & 0x04) {
         m_accessRights = ((attributes.access & 1) ? OPC_READABLE : 0) | ((attributes.access & 2) ? OPC_WRITEABLE : 0);
         if (!(m_accessRights & OPC_READABLE))
-            SetEvent(m_valueArrived.Get()); // a read waiting for a value stops waiting
+            m_valueArrived.Set(); // a read waiting for a value stops waiting
     }
 }
 
@@ -299,5 +294,5 @@ void COPCItem::OnStatusUpdate(uint32_t status)
 {
     // No lock: only the event changes.
     if (status == 5 || status == 15)
-        ResetEvent(m_valueArrived.Get());
+        m_valueArrived.Reset();
 }

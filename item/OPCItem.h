@@ -4,8 +4,8 @@
 // value last handed to the client (last reported record) and the item's own
 // network subscription. Owned and deleted by its group.
 #include "CadroNetwork.h"
-#include "Handle.h"
 #include "ItemOwner.h"
+#include "ManualResetEvent.h"
 #include "SyncObject.h"
 #include "ValueConversion.h"
 #include "opcda.h"
@@ -66,6 +66,6 @@ private:
     CVariant m_deviceValue;
     WORD m_deviceQuality = 0xC0;
     FILETIME m_deviceTime = {};
-    UniqueHandle m_valueArrived;
+    CManualResetEvent m_valueArrived; // created unsignalled
     CadroDataItem *m_dataItem = nullptr;
 };

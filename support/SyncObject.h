@@ -27,6 +27,8 @@ public:
         LeaveCriticalSection(&m_cs);
         return TRUE;
     }
+    // For condition variables (entered exactly once by the sleeper).
+    CRITICAL_SECTION *Native() { return &m_cs; }
 
 private:
     CRITICAL_SECTION m_cs;

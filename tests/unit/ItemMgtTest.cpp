@@ -348,3 +348,28 @@ TEST_F(ItemMgtTest, SyncReadAndWriteTalkToTheNetwork)
     CoTaskMemFree(errors);
     EXPECT_EQ(io->Write(1, handles, nullptr, &errors), E_INVALIDARG);
 }
+
+TEST_F(ItemMgtTest, HugeIdentifiersAndDuplicateHandlesGetPerItemAnswers)
+{
+    std::wstring huge = L"\\\\.\\proc1\\" + std::wstring(100000, L'x');
+    std::wstring quote = L"\\\\.\\proc1\\'" + std::wstring(1000, L'q');
+    std::vector<OPCITEMRESULT> r;
+    std::vector<HRESULT> e;
+    EXPECT_EQ(Add({Def(huge.c_str()), Def(quote.c_str()), Def(kTemperature)}, r, e), S_FALSE);
+    EXPECT_EQ(e, (std::vector<HRESULT>{OPC_E_UNKNOWNITEMID, OPC_E_UNKNOWNITEMID, S_OK}));
+
+    OPCITEMDEF defs[] = {Def(huge.c_str()), Def(quote.c_str())};
+    OPCITEMRESULT *results = nullptr;
+    HRESULT *errors = nullptr;
+    EXPECT_EQ(items->ValidateItems(2, defs, FALSE, &results, &errors), S_FALSE);
+    EXPECT_EQ(errors[0], S_OK) << "well formed, unknown to the address space";
+    EXPECT_EQ(errors[1], OPC_E_UNKNOWNITEMID) << "an unterminated quote";
+    CoTaskMemFree(results);
+    CoTaskMemFree(errors);
+
+    OPCHANDLE twice[] = {r[2].hServer, r[2].hServer};
+    EXPECT_EQ(items->RemoveItems(2, twice, &errors), S_FALSE);
+    EXPECT_EQ(errors[0], S_OK);
+    EXPECT_EQ(errors[1], OPC_E_INVALIDHANDLE);
+    CoTaskMemFree(errors);
+}

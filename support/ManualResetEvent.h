@@ -1,0 +1,25 @@
+#pragma once
+// A manual-reset event in user space: a flag with a condition variable. Used
+// where events are set and waited for very often; a kernel event costs a
+// round trip to the kernel (under Wine, to the wineserver) for every
+// create, set and close.
+#include "SyncObject.h"
+
+#include <windows.h>
+
+class CManualResetEvent {
+public:
+    CManualResetEvent() { InitializeConditionVariable(&m_changed); }
+    CManualResetEvent(const CManualResetEvent &) = delete;
+    CManualResetEvent &operator=(const CManualResetEvent &) = delete;
+
+    void Set();
+    void Reset();
+    // True when the event is (or becomes) signalled within timeoutMs.
+    bool Wait(DWORD timeoutMs);
+
+private:
+    CCriticalSection m_lock;
+    CONDITION_VARIABLE m_changed;
+    bool m_signalled = false;
+};
