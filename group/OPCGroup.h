@@ -8,6 +8,7 @@
 #include "ItemOwner.h"
 #include "OPCItem.h"
 #include "SyncObject.h"
+#include "TaskMem.h"
 #include "opcda.h"
 
 #include <atomic>
@@ -101,6 +102,9 @@ private:
     // The common frame of the per-item operations on existing items.
     template <class PerItem>
     HRESULT ForEachHandle(DWORD count, const OPCHANDLE *handles, HRESULT **ppErrors, PerItem perItem);
+    // The checks and allocations that AddItems and ValidateItems share.
+    HRESULT BeginItemDefinitions(DWORD count, const OPCITEMDEF *items, OPCITEMRESULT **ppResults, HRESULT **ppErrors,
+                                 TaskMem<OPCITEMRESULT> &results, TaskMem<HRESULT> &errors);
     HRESULT AddItemsLocked(DWORD count, const OPCITEMDEF *items, OPCITEMRESULT *results, HRESULT *errors);
     HRESULT CopyItems(IOPCItemMgt *target);
 

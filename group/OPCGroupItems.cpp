@@ -14,11 +14,6 @@
 #include <cstring>
 
 namespace {
-// An input array the process can read for count elements.
-template <class T> bool Readable(const T *array, DWORD count)
-{
-    return array && count != 0 && IsReadable(array, static_cast<size_t>(count) * sizeof(T));
-}
 
 HRESULT Overall(const HRESULT *errors, DWORD count)
 {
@@ -46,7 +41,7 @@ HRESULT COPCGroup::ForEachHandle(DWORD count, const OPCHANDLE *handles, HRESULT 
     if (!IsWritableOut(ppErrors))
         return E_INVALIDARG;
     *ppErrors = nullptr;
-    if (!Readable(handles, count))
+    if (!IsReadableArray(handles, count))
         return E_INVALIDARG;
     TaskMem<HRESULT> errors;
     if (!errors.Allocate(count))
@@ -61,24 +56,32 @@ HRESULT COPCGroup::ForEachHandle(DWORD count, const OPCHANDLE *handles, HRESULT 
     return overall;
 }
 
+HRESULT COPCGroup::BeginItemDefinitions(DWORD count, const OPCITEMDEF *items, OPCITEMRESULT **ppResults,
+                                        HRESULT **ppErrors, TaskMem<OPCITEMRESULT> &results, TaskMem<HRESULT> &errors)
+{
+    if (m_removing)
+        return E_FAIL;
+    if (!IsWritableOut(ppResults) || !IsWritableOut(ppErrors))
+        return E_INVALIDARG;
+    *ppResults = nullptr;
+    *ppErrors = nullptr;
+    if (!IsReadableArray(items, count))
+        return E_INVALIDARG;
+    if (!results.Allocate(count) || !errors.Allocate(count))
+        return E_OUTOFMEMORY;
+    return S_OK;
+}
+
 STDMETHODIMP COPCGroup::AddItems(DWORD dwCount, OPCITEMDEF *pItemArray, OPCITEMRESULT **ppAddResults,
                                  HRESULT **ppErrors)
 {
     return ComBoundary([&]() -> HRESULT {
         CSingleLock lock(&m_lock);
-        if (m_removing)
-            return E_FAIL;
-        if (!IsWritableOut(ppAddResults) || !IsWritableOut(ppErrors))
-            return E_INVALIDARG;
-        *ppAddResults = nullptr;
-        *ppErrors = nullptr;
-        if (!Readable(pItemArray, dwCount))
-            return E_INVALIDARG;
         TaskMem<OPCITEMRESULT> results;
         TaskMem<HRESULT> errors;
-        if (!results.Allocate(dwCount) || !errors.Allocate(dwCount))
-            return E_OUTOFMEMORY;
-        HRESULT hr = AddItemsLocked(dwCount, pItemArray, results.Get(), errors.Get());
+        HRESULT hr = BeginItemDefinitions(dwCount, pItemArray, ppAddResults, ppErrors, results, errors);
+        if (SUCCEEDED(hr))
+            hr = AddItemsLocked(dwCount, pItemArray, results.Get(), errors.Get());
         if (FAILED(hr))
             return hr;
         *ppAddResults = results.Detach();
@@ -119,18 +122,11 @@ STDMETHODIMP COPCGroup::ValidateItems(DWORD dwCount, OPCITEMDEF *pItemArray, BOO
 {
     return ComBoundary([&]() -> HRESULT {
         CSingleLock lock(&m_lock);
-        if (m_removing)
-            return E_FAIL;
-        if (!IsWritableOut(ppValidationResults) || !IsWritableOut(ppErrors))
-            return E_INVALIDARG;
-        *ppValidationResults = nullptr;
-        *ppErrors = nullptr;
-        if (!Readable(pItemArray, dwCount))
-            return E_INVALIDARG;
         TaskMem<OPCITEMRESULT> results;
         TaskMem<HRESULT> errors;
-        if (!results.Allocate(dwCount) || !errors.Allocate(dwCount))
-            return E_OUTOFMEMORY;
+        HRESULT begun = BeginItemDefinitions(dwCount, pItemArray, ppValidationResults, ppErrors, results, errors);
+        if (FAILED(begun))
+            return begun;
         for (DWORD i = 0; i < dwCount; ++i) {
             const OPCITEMDEF &def = pItemArray[i];
             VARTYPE canonical = VT_R8;
@@ -186,7 +182,7 @@ STDMETHODIMP COPCGroup::SetActiveState(DWORD dwCount, OPCHANDLE *phServer, BOOL 
 STDMETHODIMP COPCGroup::SetClientHandles(DWORD dwCount, OPCHANDLE *phServer, OPCHANDLE *phClient, HRESULT **ppErrors)
 {
     return ComBoundary([&]() -> HRESULT {
-        if (!Readable(phClient, dwCount) && IsWritableOut(ppErrors)) {
+        if (!IsReadableArray(phClient, dwCount) && IsWritableOut(ppErrors)) {
             *ppErrors = nullptr;
             return m_removing ? E_FAIL : E_INVALIDARG;
         }
@@ -201,7 +197,7 @@ STDMETHODIMP COPCGroup::SetDatatypes(DWORD dwCount, OPCHANDLE *phServer, VARTYPE
                                      HRESULT **ppErrors)
 {
     return ComBoundary([&]() -> HRESULT {
-        if (!Readable(pRequestedDatatypes, dwCount) && IsWritableOut(ppErrors)) {
+        if (!IsReadableArray(pRequestedDatatypes, dwCount) && IsWritableOut(ppErrors)) {
             *ppErrors = nullptr;
             return m_removing ? E_FAIL : E_INVALIDARG;
         }

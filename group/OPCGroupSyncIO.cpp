@@ -5,13 +5,6 @@
 #include "OpcErrors.h"
 #include "TaskMem.h"
 
-namespace {
-template <class T> bool Readable(const T *array, DWORD count)
-{
-    return array && count != 0 && IsReadable(array, static_cast<size_t>(count) * sizeof(T));
-}
-} // namespace
-
 HRESULT COPCGroup::ReadPass(OPCDATASOURCE source, DWORD count, const OPCHANDLE *handles,
                             std::vector<ReadResult> &results)
 {
@@ -67,7 +60,7 @@ STDMETHODIMP COPCGroup::Read(OPCDATASOURCE dwSource, DWORD dwCount, OPCHANDLE *p
             return E_INVALIDARG;
         *ppItemValues = nullptr;
         *ppErrors = nullptr;
-        if ((dwSource != OPC_DS_CACHE && dwSource != OPC_DS_DEVICE) || !Readable(phServer, dwCount))
+        if ((dwSource != OPC_DS_CACHE && dwSource != OPC_DS_DEVICE) || !IsReadableArray(phServer, dwCount))
             return E_INVALIDARG;
         TaskMem<OPCITEMSTATE> states;
         TaskMem<HRESULT> errors;
@@ -98,7 +91,7 @@ STDMETHODIMP COPCGroup::Write(DWORD dwCount, OPCHANDLE *phServer, VARIANT *pItem
         if (!IsWritableOut(ppErrors))
             return E_INVALIDARG;
         *ppErrors = nullptr;
-        if (!Readable(phServer, dwCount) || !Readable(pItemValues, dwCount))
+        if (!IsReadableArray(phServer, dwCount) || !IsReadableArray(pItemValues, dwCount))
             return E_INVALIDARG;
         TaskMem<HRESULT> errors;
         if (!errors.Allocate(dwCount))

@@ -15,6 +15,12 @@ inline bool IsReadable(const void *p, size_t size)
 {
     return p != nullptr && !IsBadReadPtr(p, size);
 }
+// A client's input array that the process can read for count (non-zero)
+// elements; a count larger than the array is refused, not read past.
+template <class T> bool IsReadableArray(const T *array, DWORD count)
+{
+    return array && count != 0 && IsReadable(array, static_cast<size_t>(count) * sizeof(T));
+}
 
 #include "Trace.h"
 

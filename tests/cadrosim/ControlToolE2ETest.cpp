@@ -1,5 +1,6 @@
 // The control tool, a separate process, publishes into this process's
 // running network and a subscriber here sees the value.
+#include "ChildProcess.h"
 #include "SimFixture.h"
 
 namespace {
@@ -14,35 +15,7 @@ std::wstring ToolPath()
 // Runs cadroctl with arguments; returns its exit code and its output.
 DWORD RunTool(const std::wstring &arguments, std::string &output)
 {
-    SECURITY_ATTRIBUTES sa = {sizeof sa, nullptr, TRUE};
-    HANDLE readEnd, writeEnd;
-    CreatePipe(&readEnd, &writeEnd, &sa, 0);
-    SetHandleInformation(readEnd, HANDLE_FLAG_INHERIT, 0);
-    STARTUPINFOW si = {};
-    si.cb = sizeof si;
-    si.dwFlags = STARTF_USESTDHANDLES;
-    si.hStdOutput = writeEnd;
-    si.hStdError = writeEnd;
-    PROCESS_INFORMATION pi = {};
-    std::wstring line = L"\"" + ToolPath() + L"\" " + arguments;
-    if (!CreateProcessW(nullptr, line.data(), nullptr, nullptr, TRUE, 0, nullptr, nullptr, &si, &pi)) {
-        CloseHandle(readEnd);
-        CloseHandle(writeEnd);
-        return 999;
-    }
-    CloseHandle(writeEnd);
-    char buffer[4096];
-    DWORD got;
-    output.clear();
-    while (ReadFile(readEnd, buffer, sizeof buffer, &got, nullptr) && got)
-        output.append(buffer, got);
-    WaitForSingleObject(pi.hProcess, 30000);
-    DWORD code = 999;
-    GetExitCodeProcess(pi.hProcess, &code);
-    CloseHandle(pi.hProcess);
-    CloseHandle(pi.hThread);
-    CloseHandle(readEnd);
-    return code;
+    return static_cast<DWORD>(RunAndCapture(L"\"" + ToolPath() + L"\" " + arguments, output));
 }
 } // namespace
 

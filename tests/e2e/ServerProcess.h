@@ -1,6 +1,8 @@
 #pragma once
 // Helpers for end-to-end tests: the server's processes in this Wine prefix,
 // running the executable with switches, and reading the registry back.
+#include "ChildProcess.h"
+
 #include <windows.h>
 
 #include <string>
@@ -20,8 +22,6 @@ inline std::wstring ServerExePath()
 }
 // Starts commandLine; null handle on failure.
 HANDLE StartProcess(const std::wstring &commandLine);
-// Runs commandLine, collecting what it prints; returns its exit code or -1.
-long RunAndCapture(const std::wstring &commandLine, std::string &output, DWORD timeoutMs = 30000);
 // Runs commandLine and returns its exit code, or -1 if it cannot be started
 // or does not end within timeoutMs.
 long RunAndWait(const std::wstring &commandLine, DWORD timeoutMs);
