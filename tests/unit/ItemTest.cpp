@@ -1,4 +1,5 @@
 // COPCItem on its own: a fake group, no network (updates are fed by hand).
+#include "OPCCadroClient.h"
 #include "OPCItem.h"
 #include "OpcErrors.h"
 
@@ -195,4 +196,18 @@ TEST(Item, WritesCheckRightsAndNeedANetwork)
     CheckOf(item, c);
     EXPECT_EQ(c.hr, OPC_E_BADRIGHTS);
     EXPECT_FALSE(c.changed);
+}
+
+TEST(RealTimeClient, ExpandsOnlyALeadingLocalMachine)
+{
+    BSTR host = nullptr;
+    GetHostMachineName(&host);
+    std::wstring name = host;
+    SysFreeString(host);
+    wchar_t *expanded = ExpandLocalMachine(L"\\\\.\\a\\b");
+    ASSERT_NE(expanded, nullptr);
+    EXPECT_EQ(std::wstring(expanded), L"\\\\" + name + L"\\a\\b");
+    cdd_free(expanded);
+    for (const wchar_t *unchanged : {L"\\\\.", L"\\\\.x\\a", L"\\\\HOST\\a", L"\\\\.a\\b", L""})
+        EXPECT_EQ(ExpandLocalMachine(unchanged), nullptr) << unchanged;
 }
