@@ -1,0 +1,107 @@
+#include "tw/hmx/osdep/OSException.h"
+#include "tw/hmx/osdep/WideToAnsi.h"
+
+#include <gtest/gtest.h>
+
+#include <string>
+
+using namespace tw::hmx;
+
+namespace {
+std::string FakeIcuDir(const char *variant)
+{
+    char self[MAX_PATH];
+    GetModuleFileNameA(nullptr, self, MAX_PATH);
+    std::string dir(self);
+    return dir.substr(0, dir.find_last_of('\\')) + "\\fakeicu\\" + variant;
+}
+} // namespace
+
+TEST(Support, IcuBindingNeedsBothLibrariesAndEveryEntryPoint)
+{
+    // Before any stand-in is loaded (a bare-name load would find a loaded one).
+    osdep::Icu absent("C:\\no\\such\\dir");
+    EXPECT_FALSE(absent.IsBound()) << "no ICU there nor on the search path";
+    // The process-wide binding finds no ICU here: conversions of text raise.
+    EXPECT_THROW(osdep::WideToAnsi(L"x", ""), exception::LibraryNotLoaded);
+    EXPECT_STREQ(osdep::WideToAnsi(L"", "").get(), "") << "an empty text needs no ICU";
+
+    osdep::Icu full(FakeIcuDir("full"));
+    EXPECT_TRUE(full.IsBound());
+    EXPECT_NE(full.u_strcasecmp, nullptr);
+    osdep::Icu partial(FakeIcuDir("partial"));
+    EXPECT_FALSE(partial.IsBound()) << "a missing entry point leaves the binding unbound";
+    EXPECT_EQ(partial.ucnv_fromUChars, nullptr);
+}
+
+TEST(Support, WideToAnsiSubstitutesAndChecksTheEncoding)
+{
+    osdep::Icu icu(FakeIcuDir("full"));
+    ASSERT_TRUE(icu.IsBound());
+    std::wstring text = L"caf\u00e9 \u20ac!";
+    EXPECT_STREQ(osdep::WideToAnsi(text.data(), text.data() + text.size(), "", icu).get(), "caf\xe9 ?!");
+    EXPECT_STREQ(osdep::WideToAnsi(text.data(), text.data() + text.size(), "US-ASCII", icu).get(), "caf? ?!");
+    std::wstring allOut(50, L'\u4e2d');
+    EXPECT_EQ(std::string(osdep::WideToAnsi(allOut.data(), allOut.data() + allOut.size(), "", icu).get()),
+              std::string(50, '?'));
+    EXPECT_THROW(osdep::WideToAnsi(text.data(), text.data() + 1, "KLINGON", icu), exception::InvalidLocale);
+    EXPECT_THROW(osdep::WideToAnsi(text.data(), text.data(), nullptr, icu), exception::InvalidLocale)
+        << "the encoding is checked first, even for an empty text";
+    try {
+        osdep::WideToAnsi(L"", nullptr);
+        FAIL();
+    } catch (const exception::InvalidLocale &e) {
+        EXPECT_STREQ(e.message(), "Invalid locale.");
+        EXPECT_EQ(e.code(), static_cast<long>(0x8ABC7024));
+        EXPECT_STREQ(e.source(), "tw/hmx/osdep/WideToAnsi");
+        EXPECT_EQ(e.line(), 103);
+    }
+}
+
+TEST(Support, ExceptionsCarryMessagesCodesAndSources)
+{
+    exception::LibraryNotLoaded missing("tw/hmx/osdep/icu", 59);
+    EXPECT_STREQ(missing.what(), "Failed to load library");
+    EXPECT_EQ(missing.code(), static_cast<long>(0x8ABC7021));
+    EXPECT_EQ(exception::Exception().code(), -1);
+    EXPECT_STREQ(exception::Exception().message(), "unspecified exception");
+    osdep::OSException os("text", 5);
+    EXPECT_EQ(os.code(), 42);
+    EXPECT_EQ(os.osError(), 5u);
+
+    struct {
+        unsigned long windows;
+        long mapped;
+    } map[] = {{0, 0},    {2, 7},  {3, 7},   {4, 11},    {5, static_cast<long>(0x80070005)},
+               {6, 1},    {8, 2},  {11, 23}, {14, 2},    {15, 7},
+               {16, 8},   {19, 8}, {20, 37}, {23, -508}, {32, 8},
+               {33, 8},   {38, 4}, {39, 9},  {80, -98},  {87, 1},
+               {1234, 42}};
+    for (const auto &m : map)
+        EXPECT_EQ(osdep::WinError::MapCode(m.windows), m.mapped) << m.windows;
+    osdep::WinError denied("", ERROR_ACCESS_DENIED);
+    std::string text = denied.message();
+    EXPECT_FALSE(text.empty());
+    EXPECT_EQ(text.find('\r'), std::string::npos);
+    EXPECT_NE(text.back(), '.') << "the final period is dropped: " << text;
+
+    osdep::SharedLibrary none("");
+    EXPECT_FALSE(none.IsLoaded());
+    EXPECT_EQ(none.GetSymbol("x", true), nullptr);
+    try {
+        none.GetSymbol("x");
+        FAIL();
+    } catch (const osdep::WinError &e) {
+        EXPECT_STREQ(e.message(), "library not loaded");
+        EXPECT_EQ(e.osError(), 9999u);
+    }
+    osdep::SharedLibrary kernel("kernel32.dll");
+    EXPECT_NE(kernel.GetSymbol("GetTickCount"), nullptr);
+    try {
+        kernel.GetSymbol("NoSuchEntryPoint");
+        FAIL();
+    } catch (const osdep::WinError &e) {
+        EXPECT_STREQ(e.source(), "tw/hmx/osdep/SharedLibrary");
+        EXPECT_EQ(e.line(), 161);
+    }
+}
