@@ -1,13 +1,60 @@
 #pragma once
-// The browsable tree of the Cadro network. Built once, by the first server
-// object, and kept until the process ends.
-#include <windows.h>
+// The server's picture of the Cadro network: configured roots (registry
+// value "Cadro Root URLs"), under them the processes, objects and members the
+// network reports. Children are read from the network again on every descent
+// and merged into the tree. Built once per process and kept until it ends.
+//
+// One recursive lock guards the whole tree and the network browse session
+// (which is stateful: Open, then Next); nodes are shared, so a node that a
+// refresh drops stays valid, detached, for whoever still holds it.
+#include "AddrNode.h"
+#include "CadroNetwork.h"
+#include "SyncObject.h"
+
+#include <functional>
 
 class CAddrSpace {
 public:
     static CAddrSpace *Create();
+    // Reads (and on first use writes) the root URLs from the registry.
     HRESULT Build();
 
+    DWORD Organization() const { return 1; } // OPC_NS_HIERARCHIAL
+    AddrNodePtr Root() const { return m_root; }
+    CSyncObject &Lock() { return m_lock; }
+
+    // Reads a branch's children from the network and merges them in; the
+    // root and leaves are left as they are. OPC_E_UNKNOWNITEMID when the
+    // network refuses the browse.
+    HRESULT Refresh(const AddrNodePtr &node);
+    // The node an item identifier names, descending (and refreshing) from
+    // the root; null when none.
+    AddrNodePtr FindByItemId(const std::wstring &itemId);
+    // The direct child whose display name (or part, without one) equals name
+    // exactly; no refresh.
+    AddrNodePtr FindChild(const AddrNodePtr &node, const std::wstring &name);
+
+    // A node from one browse record of the network.
+    static AddrNodePtr MakeNode(const BrowseRecord &record);
+    // Adds root children from "name=URL,name=URL" text.
+    void AddRoots(const std::string &text);
+
+    // How the tree reaches the network: Open(url) then Next(mask, record)
+    // until a negative result. Installed by the server's services.
+    struct Browser {
+        std::function<HRESULT(const wchar_t *url)> open;
+        std::function<HRESULT(BrowseRecord *record)> next;
+        std::shared_ptr<void> keep; // keeps the session alive while in use
+    };
+    using BrowserSource = std::function<bool(Browser &browser)>;
+    void SetBrowserSource(BrowserSource source);
+
 private:
-    CAddrSpace() = default;
+    CAddrSpace();
+    AddrNodePtr FindFrom(const AddrNodePtr &node, const std::wstring &text);
+    void AddRoot(const std::wstring &name, const std::wstring &url);
+
+    CCriticalSection m_lock;
+    AddrNodePtr m_root;
+    BrowserSource m_browserSource;
 };

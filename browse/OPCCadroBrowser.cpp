@@ -1,9 +1,54 @@
 #include "OPCCadroBrowser.h"
 
+#include "SyncObject.h"
 #include "Trace.h"
 
 #include <cstdio>
+#include <cwchar>
 #include <new>
+#include <string>
+
+namespace {
+CCriticalSection g_currentLock;
+OPCCadroBrowser *g_current = nullptr;
+} // namespace
+
+void OPCCadroBrowser::SetCurrent(OPCCadroBrowser *browser)
+{
+    CSingleLock lock(&g_currentLock);
+    if (browser)
+        browser->AddRef();
+    if (g_current)
+        g_current->Release();
+    g_current = browser;
+}
+
+OPCCadroBrowser *OPCCadroBrowser::AcquireCurrent()
+{
+    CSingleLock lock(&g_currentLock);
+    if (g_current)
+        g_current->AddRef();
+    return g_current;
+}
+
+HRESULT OPCCadroBrowser::Open(const wchar_t *url)
+{
+    // No session (the factory failed): nothing can be browsed.
+    if (!m_browser || !url)
+        return E_FAIL;
+    if (wcsncmp(url, L"\\\\.\\", 4) != 0 && wcscmp(url, L"\\\\.") != 0)
+        return m_browser->Open(url);
+    BSTR host = nullptr;
+    GetHostMachineName(&host);
+    std::wstring expanded = L"\\\\" + std::wstring(host ? host : L"") + (url + 3);
+    SysFreeString(host);
+    return m_browser->Open(expanded.c_str());
+}
+
+HRESULT OPCCadroBrowser::Next(uint32_t fieldMask, BrowseRecord *record)
+{
+    return m_browser ? m_browser->Next(fieldMask, record) : E_FAIL;
+}
 
 OPCCadroBrowser *OPCCadroBrowser::Create()
 {

@@ -13,7 +13,15 @@ public:
     HRESULT Init();
     // Free: releases the browser and session interfaces.
     void Shutdown();
-    CadroBrowser *Browser() const { return m_browser; }
+    // Lists the children of url ("\\." and "\\.\..." name this machine);
+    // E_FAIL without a browse session.
+    HRESULT Open(const wchar_t *url);
+    HRESULT Next(uint32_t fieldMask, BrowseRecord *record);
+
+    // The process's browser receiver while the services run; the caller
+    // releases the reference it gets.
+    static void SetCurrent(OPCCadroBrowser *browser);
+    static OPCCadroBrowser *AcquireCurrent();
 
     // ICadroBrowserReceiver
     STDMETHODIMP QueryInterface(REFIID riid, void **ppv) override;

@@ -5,6 +5,7 @@
 #include "ComPtr.h"
 #include "ComUtil.h"
 #include "IdMgr.h"
+#include "OPCBrowseServerAddressSpace.h"
 #include "OPCGroup.h"
 #include "OpcErrors.h"
 #include "Services.h"
@@ -36,6 +37,17 @@ void *COPCServer::FindInterface(REFIID riid)
     if (IsEqualIID(riid, IID_IOPCServer))
         return static_cast<IOPCServer *>(this);
     return nullptr;
+}
+
+HRESULT COPCServer::CreateOnQuery(REFIID riid, void **ppv)
+{
+    if (!IsEqualIID(riid, IID_IOPCBrowseServerAddressSpace))
+        return E_NOINTERFACE;
+    // A new browse object, with its own position, for every query.
+    CAddrSpace *space = ServerServices::AddressSpace();
+    if (!space)
+        return E_FAIL;
+    return COPCBrowseServerAddressSpace::Create(space, riid, ppv);
 }
 
 HRESULT COPCServer::FinalConstruct()

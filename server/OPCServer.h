@@ -38,6 +38,7 @@ public:
 
 protected:
     void *FindInterface(REFIID riid) override;
+    HRESULT CreateOnQuery(REFIID riid, void **ppv) override;
     void FinalRelease() override;
 
 private:

@@ -39,6 +39,42 @@ template <class Service> void StopService(Service *&slot)
     slot->Release();
     slot = nullptr;
 }
+// The tree reaches the network through the current browser receiver.
+bool CurrentBrowser(CAddrSpace::Browser &browser)
+{
+    OPCCadroBrowser *current = OPCCadroBrowser::AcquireCurrent();
+    if (!current)
+        return false;
+    browser.keep = std::shared_ptr<OPCCadroBrowser>(current, [](OPCCadroBrowser *b) { b->Release(); });
+    browser.open = [current](const wchar_t *url) { return current->Open(url); };
+    browser.next = [current](BrowseRecord *record) { return current->Next(kBrowseFieldMask, record); };
+    return true;
+}
+
+// Items take their canonical type and access rights from the tree.
+bool LookupNode(const std::wstring &itemId, VARTYPE &type, DWORD &rights)
+{
+    CAddrSpace *space = g_addrSpace.get();
+    AddrNodePtr node = space ? space->FindByItemId(itemId) : nullptr;
+    if (!node)
+        return false;
+    type = node->DataType();
+    rights = node->AccessRights();
+    return true;
+}
+
+void BuildAddressSpace()
+{
+    std::unique_ptr<CAddrSpace> space(CAddrSpace::Create());
+    if (!space || FAILED(space->Build())) {
+        // Out of memory: the server goes on without an address space.
+        INTERNAL_ASSERT_FAILED("address space construction");
+        return;
+    }
+    space->SetBrowserSource(CurrentBrowser);
+    g_addrSpace = std::move(space);
+    ItemServices::SetNodeLookup(LookupNode);
+}
 } // namespace
 
 void ServerServices::ServerConstructed()
@@ -46,13 +82,12 @@ void ServerServices::ServerConstructed()
     CSingleLock lock(&g_servicesLock);
     if (g_serverCount == 0) {
         if (!g_addrSpace) {
-            g_addrSpace.reset(CAddrSpace::Create());
-            if (!g_addrSpace || FAILED(g_addrSpace->Build()))
-                INTERNAL_ASSERT_FAILED("address space construction");
+            BuildAddressSpace();
         }
         StartService(g_realTimeClient);
         ItemServices::SetRealTimeClient(g_realTimeClient);
         StartService(g_browser);
+        OPCCadroBrowser::SetCurrent(g_browser);
     }
     ++g_serverCount;
 }
@@ -63,6 +98,7 @@ void ServerServices::ServerReleased()
     if (--g_serverCount == 0) {
         ItemServices::SetRealTimeClient(nullptr);
         StopService(g_realTimeClient);
+        OPCCadroBrowser::SetCurrent(nullptr);
         StopService(g_browser);
     }
 }

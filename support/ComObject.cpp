@@ -25,7 +25,7 @@ HRESULT CComObjectRoot::InnerQueryInterface(REFIID riid, void **ppv)
     }
     void *found = FindInterface(riid);
     if (!found)
-        return E_NOINTERFACE;
+        return CreateOnQuery(riid, ppv);
     static_cast<IUnknown *>(found)->AddRef();
     *ppv = found;
     return S_OK;

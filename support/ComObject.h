@@ -24,6 +24,9 @@ protected:
     // Pointer to the requested interface (IUnknown excluded) without a
     // reference added, or null.
     virtual void *FindInterface(REFIID riid) = 0;
+    // Interfaces that are new objects on every query (the server's browse
+    // interface); E_NOINTERFACE unless overridden.
+    virtual HRESULT CreateOnQuery(REFIID, void **) { return E_NOINTERFACE; }
     // Runs once, before the destructor.
     virtual void FinalRelease() {}
 
