@@ -1,0 +1,337 @@
+// The address space and the browse interface: the pattern matcher, nodes
+// from browse records, merges on refresh, lookups, and browsing the simulated
+// default network through the server object.
+#include "AddrSpace.h"
+#include "CadroSim.h"
+#include "InProcServer.h"
+#include "OpcErrors.h"
+#include "PatternMatch.h"
+
+#include <chrono>
+#include <map>
+#include <memory>
+
+namespace {
+BrowseRecord Record(const wchar_t *name, wchar_t kind, bool leaf, uint16_t type = 0, uint16_t access = 3)
+{
+    BrowseRecord r = {};
+    r.mask = kBrowseFieldMask;
+    r.name = SysAllocString(name);
+    r.kind = kind;
+    r.flags = leaf ? 1 : 0;
+    r.dataType = type;
+    r.access = access;
+    return r;
+}
+
+// A network whose listings the test sets per URL.
+struct FakeNetwork {
+    std::map<std::wstring, std::vector<std::tuple<std::wstring, wchar_t, bool>>> listings;
+    std::vector<std::wstring> opened;
+    std::vector<std::tuple<std::wstring, wchar_t, bool>> current;
+    size_t next = 0;
+
+    CAddrSpace::BrowserSource Source()
+    {
+        return [this](CAddrSpace::Browser &b) {
+            b.open = [this](const wchar_t *url) {
+                opened.push_back(url);
+                auto it = listings.find(url);
+                if (it == listings.end())
+                    return E_FAIL;
+                current = it->second;
+                next = 0;
+                return S_OK;
+            };
+            b.next = [this](BrowseRecord *r) {
+                if (next >= current.size())
+                    return E_FAIL;
+                auto &[name, kind, leaf] = current[next++];
+                *r = Record(name.c_str(), kind, leaf, kCadroNumber);
+                return S_OK;
+            };
+            return true;
+        };
+    }
+};
+
+std::vector<std::wstring> Names(IEnumString *e)
+{
+    std::vector<std::wstring> out;
+    LPOLESTR s;
+    while (e && e->Next(1, &s, nullptr) == S_OK) {
+        out.push_back(s);
+        CoTaskMemFree(s);
+    }
+    return out;
+}
+} // namespace
+
+TEST(PatternMatch, FollowsTheFilterRules)
+{
+    struct Case {
+        const char *name, *pattern;
+        bool match;
+    } cases[] = {
+        {"dx", "[!a-c]x", true},
+        {"bx", "[!a-c]x", false},
+        {"bx", "[a-c]x", true},
+        {"dx", "[a-c]x", false},
+        {"a", "[a-", false},
+        {"7abc", "#*", true},
+        {"ABC", "abc", false},
+        {"abc", "a?c", true},
+        {"ac", "a?c", false},
+        {"", "*", true},
+        {"", "", true},
+        {"x", "", false},
+        {"abc", "*c", true},
+        {"abc", "a*b*c*", true},
+        {"abc", "*d", false},
+        {"b", "[-c]", true},
+        {"x", "[ax]", true},
+        {"x", "[a]", false},
+        {"a]", "[a]]", true},
+        {"a", "[a", false},
+        {"a", "[!a", false},
+        {"b", "[!a", false},
+        {"a", "[a-]", true},
+        {"b", "[a-]", false},
+        {"q", "[!a-]", false},
+        {"b", "[ab-c]", true},
+        {"9", "[#]", false},
+        {"c", "[a-bc]", true},
+        {"cosine", "co*", true},
+        {"\xe9", "[\x01-\xff]", false}, // signed: 1 to -1 is an empty range
+        {"a", "[\x01-\xff]", false},
+        {"\xe9", "[\x80-\xff]", true},
+        {"\xe9", "[\xe0-\xef]", true},
+    };
+    for (const Case &c : cases)
+        EXPECT_EQ(MatchPattern(std::string(c.name), std::string(c.pattern)), c.match) << c.name << " ~ " << c.pattern;
+    EXPECT_TRUE(MatchPattern(std::wstring(L"caf\u00e9"), std::wstring(L"caf?")));
+
+    // Thousands of stars and long names stay fast.
+    std::string stars(10000, '*');
+    std::string name(20000, 'a');
+    auto start = std::chrono::steady_clock::now();
+    EXPECT_TRUE(MatchPattern(name, stars));
+    EXPECT_FALSE(MatchPattern(name, stars + "b"));
+    EXPECT_FALSE(MatchPattern(name, std::string(5000, '*') + "a*b" + std::string(5000, '*')));
+    EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(20));
+    EXPECT_FALSE(MatchPattern(name, "[[[[[["));
+    EXPECT_FALSE(MatchPattern(name, "]]]"));
+}
+
+TEST(AddressSpace, NodesFollowKindsImplicitAndDescribedMembers)
+{
+    auto node = [](BrowseRecord r) {
+        AddrNodePtr n = CAddrSpace::MakeNode(r);
+        SysFreeString(r.name);
+        return n;
+    };
+    AddrNodePtr machine = node(Record(L"\\\\HOST", L'\\', false));
+    EXPECT_EQ(machine->DisplayName(), L"HOST");
+    EXPECT_EQ(machine->Separator(), L"\\");
+    EXPECT_TRUE(machine->IsBranch());
+    AddrNodePtr implicit = node(Record(L"(implicit)", L'.', true));
+    EXPECT_EQ(implicit->IdPart(), L"");
+    EXPECT_EQ(implicit->Separator(), L"");
+    EXPECT_FALSE(implicit->IsBranch());
+    AddrNodePtr described = node(Record(L"cosine-Cosine wave", L'.', true, kCadroNumber, 1));
+    EXPECT_EQ(described->DisplayName(), L"cosine-Cosine wave");
+    EXPECT_EQ(described->IdPart(), L"cosine");
+    EXPECT_EQ(described->DataType(), VT_R8);
+    EXPECT_EQ(described->AccessRights(), OPC_READABLE);
+    AddrNodePtr dashed = node(Record(L"a-b", L'\\', false));
+    EXPECT_EQ(dashed->IdPart(), L"a-b") << "only members take the part before the dash";
+    BrowseRecord bare = {};
+    AddrNodePtr unnamed = CAddrSpace::MakeNode(bare);
+    EXPECT_EQ(unnamed->DisplayName(), L"???");
+    EXPECT_EQ(unnamed->AccessRights(), 3u);
+    EXPECT_TRUE(unnamed->IsBranch());
+}
+
+TEST(AddressSpace, RefreshMergesCaseInsensitivelyAndLookupsDescend)
+{
+    std::unique_ptr<CAddrSpace> space(CAddrSpace::Create());
+    space->AddRoots("A=\\\\x,B=\\\\y,Dangling");
+    auto roots = *space->Root()->Children();
+    ASSERT_EQ(roots.size(), 3u);
+    std::wstring id;
+    ASSERT_TRUE(roots[1]->ItemId(id));
+    EXPECT_EQ(id, L"\\\\y");
+    EXPECT_EQ(roots[2]->IdPart(), L"");
+
+    FakeNetwork net;
+    space->SetBrowserSource(net.Source());
+    net.listings[L"\\\\x"] = {{L"proc", L'\\', false}, {L"Other", L'\\', false}};
+    net.listings[L"\\\\x\\proc"] = {{L"Obj", L'\\', false}};
+    net.listings[L"\\\\x\\proc\\Obj"] = {{L"m", L'.', true}, {L"(implicit)", L'.', true}, {L"M", L'.', true}};
+
+    AddrNodePtr member = space->FindByItemId(L"\\\\x\\proc\\Obj.m");
+    ASSERT_TRUE(member);
+    EXPECT_EQ(net.opened, (std::vector<std::wstring>{L"\\\\x", L"\\\\x\\proc", L"\\\\x\\proc\\Obj"}));
+    AddrNodePtr object = space->FindByItemId(L"\\\\x\\proc\\Obj");
+    ASSERT_TRUE(object);
+    EXPECT_EQ(object->Children()->size(), 2u) << "\"M\" duplicates \"m\" without regard to case";
+    EXPECT_FALSE(space->FindByItemId(L"\\\\x\\proc\\Obj.mmore")) << "text past a leaf";
+    EXPECT_FALSE(space->FindByItemId(L"\\\\x\\proc\\Nope"));
+    EXPECT_FALSE(space->FindByItemId(L"\\\\z"));
+
+    // The same names in another case keep the old nodes and their subtrees;
+    // a vanished node is detached but stays valid for its holder.
+    AddrNodePtr proc = space->FindChild(roots[0], L"proc");
+    ASSERT_TRUE(proc);
+    AddrNodePtr other = space->FindChild(roots[0], L"Other");
+    net.listings[L"\\\\x"] = {{L"PROC", L'\\', false}, {L"new", L'\\', false}};
+    ASSERT_EQ(space->Refresh(roots[0]), S_OK);
+    EXPECT_EQ(space->FindChild(roots[0], L"proc"), proc);
+    EXPECT_EQ(proc->Children()->size(), 1u);
+    EXPECT_TRUE(other->IsDetached());
+    EXPECT_EQ(space->Refresh(other), OPC_E_UNKNOWNITEMID);
+    EXPECT_TRUE(space->FindChild(roots[0], L"new"));
+    net.listings.erase(L"\\\\x");
+    EXPECT_EQ(space->Refresh(roots[0]), OPC_E_UNKNOWNITEMID) << "a browse the network refuses";
+}
+
+namespace {
+class BrowseServer : public testing::Test {
+protected:
+    void SetUp() override
+    {
+        server = CreateInProcServer();
+        ASSERT_EQ(server.As(browse), S_OK);
+    }
+    std::vector<std::wstring> List(OPCBROWSETYPE type, const wchar_t *filter = L"", VARTYPE vt = VT_EMPTY,
+                                   DWORD access = 0, HRESULT *hr = nullptr)
+    {
+        ComPtr<IEnumString> e;
+        HRESULT result = browse->BrowseOPCItemIDs(type, filter, vt, access, e.Out());
+        if (hr)
+            *hr = result;
+        return Names(e.Get());
+    }
+    ComPtr<IOPCServer> server;
+    ComPtr<IOPCBrowseServerAddressSpace> browse;
+};
+} // namespace
+
+TEST_F(BrowseServer, WalksTheDefaultNetworkDownAndUp)
+{
+    OPCNAMESPACETYPE type;
+    EXPECT_EQ(browse->QueryOrganization(&type), S_OK);
+    EXPECT_EQ(type, OPC_NS_HIERARCHIAL);
+    EXPECT_EQ(browse->ChangeBrowsePosition(OPC_BROWSE_UP, L""), E_FAIL) << "at the root";
+    LPWSTR id = nullptr;
+    EXPECT_EQ(browse->GetItemID(const_cast<wchar_t *>(L""), &id), S_OK);
+    EXPECT_STREQ(id, L"");
+    CoTaskMemFree(id);
+
+    auto roots = List(OPC_BRANCH); // this machine's name and "Network", sorted
+    ASSERT_EQ(roots.size(), 2u);
+    std::wstring host = roots[0] == L"Network" ? roots[1] : roots[0];
+    EXPECT_NE(std::find(roots.begin(), roots.end(), L"Network"), roots.end());
+    EXPECT_EQ(browse->ChangeBrowsePosition(OPC_BROWSE_DOWN, host.c_str()), S_OK);
+    EXPECT_EQ(List(OPC_BRANCH), (std::vector<std::wstring>{L"proc1", L"proc2"}));
+    EXPECT_EQ(browse->ChangeBrowsePosition(OPC_BROWSE_DOWN, L"proc1"), S_OK);
+    EXPECT_EQ(browse->ChangeBrowsePosition(OPC_BROWSE_DOWN, L"Pump"), S_OK);
+    auto leaves = List(OPC_LEAF);
+    EXPECT_EQ(leaves, (std::vector<std::wstring>{L"(implicit)", L"speed-Pump speed", L"status"}));
+    EXPECT_EQ(List(OPC_LEAF, L"s*"), (std::vector<std::wstring>{L"speed-Pump speed", L"status"}));
+    EXPECT_EQ(List(OPC_LEAF, L"", VT_BSTR), leaves) << "numbers and texts both give a BSTR";
+    EXPECT_EQ(List(OPC_LEAF, L"", VT_BOOL), (std::vector<std::wstring>{L"(implicit)", L"speed-Pump speed"}));
+    EXPECT_EQ(browse->GetItemID(const_cast<wchar_t *>(L"(implicit)"), &id), S_OK);
+    EXPECT_STREQ(id, L"\\\\.\\proc1\\Pump") << "the implicit member is its object";
+    CoTaskMemFree(id);
+    EXPECT_EQ(browse->GetItemID(const_cast<wchar_t *>(L"speed-Pump speed"), &id), S_OK);
+    EXPECT_STREQ(id, L"\\\\.\\proc1\\Pump.speed");
+    CoTaskMemFree(id);
+    EXPECT_EQ(browse->GetItemID(const_cast<wchar_t *>(L"nothing"), &id), OPC_E_UNKNOWNITEMID);
+    EXPECT_EQ(id, nullptr);
+    EXPECT_EQ(browse->ChangeBrowsePosition(OPC_BROWSE_UP, nullptr), S_OK);
+    EXPECT_EQ(browse->ChangeBrowsePosition(OPC_BROWSE_DOWN, L"NoSuch"), E_FAIL);
+    EXPECT_EQ(browse->ChangeBrowsePosition(OPC_BROWSE_TO, L"\\\\.\\proc1\\Setpoints"), S_OK);
+    EXPECT_EQ(List(OPC_LEAF, L"", VT_EMPTY, OPC_WRITEABLE).size(), 5u);
+    EXPECT_EQ(List(OPC_LEAF, L"", VT_EMPTY, OPC_READABLE).size(), 7u);
+    EXPECT_EQ(browse->ChangeBrowsePosition(OPC_BROWSE_TO, L"\\\\.\\proc1\\Nope"), E_FAIL);
+    EXPECT_EQ(browse->ChangeBrowsePosition(OPC_BROWSE_TO, L""), S_OK);
+    EXPECT_EQ(List(OPC_BRANCH).size(), 2u) << "back at the root";
+    EXPECT_EQ(browse->ChangeBrowsePosition(static_cast<OPCBROWSEDIRECTION>(9), L"x"), E_INVALIDARG);
+}
+
+TEST_F(BrowseServer, FlatListingsFiltersAndBadArguments)
+{
+    ASSERT_EQ(browse->ChangeBrowsePosition(OPC_BROWSE_TO, L"\\\\.\\proc1"), S_OK);
+    auto flat = List(OPC_FLAT);
+    EXPECT_NE(std::find(flat.begin(), flat.end(), L"\\\\.\\proc1\\Line\\Tank.level"), flat.end());
+    EXPECT_NE(std::find(flat.begin(), flat.end(), L"\\\\.\\proc1\\Waveform.cosine"), flat.end());
+    EXPECT_TRUE(std::is_sorted(flat.begin(), flat.end()));
+    EXPECT_EQ(List(OPC_FLAT, L"cos*"), std::vector<std::wstring>{L"\\\\.\\proc1\\Waveform.cosine"});
+    EXPECT_EQ(List(OPC_FLAT, L""), List(OPC_FLAT, L"*"));
+
+    HRESULT hr;
+    List(static_cast<OPCBROWSETYPE>(4), L"", VT_EMPTY, 0, &hr);
+    EXPECT_EQ(hr, E_INVALIDARG);
+    List(OPC_LEAF, L"", VT_EMPTY, 4, &hr);
+    EXPECT_EQ(hr, E_INVALIDARG);
+    EXPECT_TRUE(List(static_cast<OPCBROWSETYPE>(0), L"", VT_EMPTY, 0, &hr).empty());
+    EXPECT_EQ(hr, S_FALSE);
+    ComPtr<IEnumString> e;
+    ASSERT_EQ(browse->BrowseOPCItemIDs(OPC_LEAF, L"zzz*", VT_EMPTY, 0, e.Out()), S_FALSE);
+    LPOLESTR s;
+    EXPECT_EQ(e->Next(1, &s, nullptr), E_FAIL) << "an empty result";
+    EXPECT_EQ(browse->BrowseOPCItemIDs(OPC_LEAF, L"*", VT_EMPTY, 0, nullptr), E_INVALIDARG);
+    List(OPC_LEAF, L"[a-", VT_EMPTY, 0, &hr);
+    EXPECT_EQ(hr, S_FALSE);
+    std::wstring huge(100000, L'*');
+    List(OPC_FLAT, huge.c_str(), VT_EMPTY, 0, &hr);
+    EXPECT_EQ(hr, S_OK);
+    IEnumString *paths = nullptr;
+    EXPECT_EQ(browse->BrowseAccessPaths(L"x", &paths), E_NOTIMPL);
+
+    // Two browse objects move independently.
+    ComPtr<IOPCBrowseServerAddressSpace> second;
+    ASSERT_EQ(server.As(second), S_OK);
+    EXPECT_NE(second.Get(), browse.Get());
+    LPWSTR id = nullptr;
+    second->GetItemID(const_cast<wchar_t *>(L""), &id);
+    EXPECT_STREQ(id, L"");
+    CoTaskMemFree(id);
+}
+
+TEST_F(BrowseServer, MembersAppearAndDisappearAndPositionsSurviveTheirNodes)
+{
+    auto run = [](const wchar_t *command) {
+        BSTR answer = nullptr;
+        CadroSim_Execute(command, &answer);
+        std::wstring text = answer ? answer : L"";
+        SysFreeString(answer);
+        return text;
+    };
+    ASSERT_EQ(run(L"add-member \\\\.\\proc2\\Extra fresh type=bool"), L"ok\n");
+    ASSERT_EQ(browse->ChangeBrowsePosition(OPC_BROWSE_TO, L"\\\\.\\proc2\\Extra"), S_OK);
+    EXPECT_EQ(List(OPC_LEAF), std::vector<std::wstring>{L"fresh"});
+    ASSERT_EQ(run(L"remove-member \\\\.\\proc2\\Extra.fresh"), L"ok\n");
+    EXPECT_TRUE(List(OPC_LEAF).empty());
+
+    ASSERT_EQ(browse->ChangeBrowsePosition(OPC_BROWSE_DOWN, L"(none)"), E_FAIL);
+    ASSERT_EQ(run(L"add-member \\\\.\\proc2\\Gone\\Deep leaf"), L"ok\n");
+    ASSERT_EQ(browse->ChangeBrowsePosition(OPC_BROWSE_TO, L"\\\\.\\proc2\\Gone\\Deep"), S_OK);
+    ASSERT_EQ(run(L"reset"), L"ok\n"); // the objects vanish from the network
+    ComPtr<IOPCBrowseServerAddressSpace> other;
+    ASSERT_EQ(server.As(other), S_OK);
+    ASSERT_EQ(other->ChangeBrowsePosition(OPC_BROWSE_TO, L"\\\\.\\proc2"), S_OK);
+    ComPtr<IEnumString> e;
+    other->BrowseOPCItemIDs(OPC_BRANCH, L"", VT_EMPTY, 0, e.Out()); // drops "Gone" from the tree
+    HRESULT hr;
+    EXPECT_TRUE(List(OPC_LEAF, L"", VT_EMPTY, 0, &hr).empty());
+    EXPECT_EQ(hr, S_FALSE) << "a position whose node has gone lists nothing";
+    LPWSTR id = nullptr;
+    EXPECT_EQ(browse->GetItemID(const_cast<wchar_t *>(L""), &id), OPC_E_UNKNOWNITEMID)
+        << "its parent has gone too: it has no identifier any more";
+    EXPECT_EQ(id, nullptr);
+    EXPECT_EQ(browse->ChangeBrowsePosition(OPC_BROWSE_UP, L""), E_FAIL);
+    EXPECT_EQ(browse->ChangeBrowsePosition(OPC_BROWSE_TO, L""), S_OK);
+    EXPECT_EQ(List(OPC_BRANCH).size(), 2u);
+}
