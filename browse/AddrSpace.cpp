@@ -7,8 +7,9 @@
 #include "tw/hmx/osdep/WideToAnsi.h"
 
 #include <cstring>
+#include <cwctype>
+#include <map>
 #include <new>
-#include <set>
 #include <vector>
 
 namespace {
@@ -16,10 +17,27 @@ const char kKeyPath[] = "Software";
 const char *const kSubKeys[] = {"Tarnwell", "OPC Cadro Interface", "1.2"};
 const char kRootsValue[] = "Cadro Root URLs";
 
-struct NoCaseLess {
-    bool operator()(const AddrNodePtr &a, const AddrNodePtr &b) const
+// Ordinal comparison without regard to case; ASCII folds without the
+// locale machinery that _wcsicmp goes through for every character.
+wchar_t Fold(wchar_t c)
+{
+    if (c < 0x80)
+        return c >= L'a' && c <= L'z' ? static_cast<wchar_t>(c - 32) : c;
+    return static_cast<wchar_t>(towupper(c));
+}
+
+struct NoCaseStringLess {
+    bool operator()(const std::wstring &a, const std::wstring &b) const
     {
-        return _wcsicmp(a->IdPart().c_str(), b->IdPart().c_str()) < 0;
+        size_t n = a.size() < b.size() ? a.size() : b.size();
+        for (size_t i = 0; i < n; ++i) {
+            if (a[i] == b[i])
+                continue;
+            wchar_t x = Fold(a[i]), y = Fold(b[i]);
+            if (x != y)
+                return x < y;
+        }
+        return a.size() < b.size();
     }
 };
 
@@ -168,6 +186,19 @@ HRESULT CAddrSpace::Build()
     return S_OK;
 }
 
+std::wstring CAddrSpace::IdPartOf(const BrowseRecord &r)
+{
+    std::wstring name = !(r.mask & kBrowseName) ? L"???" : r.name ? r.name : L"";
+    if (name.size() >= 2 && name[0] == L'\\' && name[1] == L'\\')
+        name.erase(0, 2);
+    if ((r.mask & kBrowseKind) && r.kind == L'.') {
+        if (name == L"(implicit)")
+            return L"";
+        return name.substr(0, name.find(L'-'));
+    }
+    return name;
+}
+
 AddrNodePtr CAddrSpace::MakeNode(const BrowseRecord &r)
 {
     auto node = std::make_shared<CAddrNode>();
@@ -208,39 +239,34 @@ HRESULT CAddrSpace::Refresh(const AddrNodePtr &node)
     if (FAILED(browser.open(url.c_str())))
         return OPC_E_UNKNOWNITEMID;
 
-    std::set<AddrNodePtr, NoCaseLess> fresh;
+    // Children by identifier part without regard to case: a reported name
+    // that the tree has keeps its node (and subtree); only new names get new
+    // nodes; the first of names equal but for case wins.
+    std::map<std::wstring, AddrNodePtr, NoCaseStringLess> old;
+    for (const AddrNodePtr &child : *node->m_children)
+        old.emplace(child->m_idPart, child);
+    std::map<std::wstring, AddrNodePtr, NoCaseStringLess> fresh;
     BrowseRecord record = {};
     while (SUCCEEDED(browser.next(&record))) {
-        AddrNodePtr made = MakeNode(record);
+        std::wstring part = IdPartOf(record);
+        if (!fresh.count(part)) {
+            auto kept = old.find(part);
+            fresh.emplace(part, kept != old.end() ? kept->second : MakeNode(record));
+        }
         SysFreeString(record.name);
         SysFreeString(record.description);
         record = {};
-        fresh.insert(made); // a part already there in another case is dropped
     }
-    std::set<AddrNodePtr, NoCaseLess> old(node->m_children->begin(), node->m_children->end());
     node->m_children->clear();
-    auto n = fresh.begin();
-    auto o = old.begin();
-    NoCaseLess less;
-    auto keep = [&](const AddrNodePtr &child) {
-        child->m_parent = node;
-        node->m_children->push_back(child);
-    };
-    auto drop = [](const AddrNodePtr &child) { child->m_detached = true; };
-    while (n != fresh.end() && o != old.end()) {
-        if (less(*n, *o)) {
-            keep(*n++);
-        } else if (less(*o, *n)) {
-            drop(*o++);
-        } else {
-            keep(*o++); // the old node keeps its subtree
-            ++n;
-        }
+    for (auto &entry : fresh) {
+        entry.second->m_parent = node;
+        node->m_children->push_back(entry.second);
     }
-    for (; n != fresh.end(); ++n)
-        keep(*n);
-    for (; o != old.end(); ++o)
-        drop(*o);
+    for (auto &entry : old) {
+        auto now = fresh.find(entry.first);
+        if (now == fresh.end() || now->second != entry.second)
+            entry.second->m_detached = true;
+    }
     return S_OK;
 }
 

@@ -34,8 +34,10 @@ public:
     // exactly; no refresh.
     AddrNodePtr FindChild(const AddrNodePtr &node, const std::wstring &name);
 
-    // A node from one browse record of the network.
+    // A node from one browse record of the network, and just the
+    // identifier part such a node would have.
     static AddrNodePtr MakeNode(const BrowseRecord &record);
+    static std::wstring IdPartOf(const BrowseRecord &record);
     // Adds root children from "name=URL,name=URL" text.
     void AddRoots(const std::string &text);
 
