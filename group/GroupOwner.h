@@ -12,6 +12,8 @@ public:
     // server is already being released.
     virtual bool EnterGroupCall() = 0;
     virtual void LeaveGroupCall() = 0;
+    // A scan delivered a data change to a client.
+    virtual void SetLastUpdateTime(const FILETIME &time) = 0;
 
 protected:
     ~CGroupOwner() = default;

@@ -6,6 +6,7 @@
 #include "OpcErrors.h"
 #include "TaskMem.h"
 #include "Trace.h"
+#include "UpdateScanMgr.h"
 
 #include <cmath>
 
@@ -46,6 +47,10 @@ void *COPCGroup::FindInterface(REFIID riid)
         return static_cast<IOPCSyncIO *>(this);
     if (IsEqualIID(riid, IID_IOPCItemMgt))
         return static_cast<IOPCItemMgt *>(this);
+    if (IsEqualIID(riid, IID_IOPCAsyncIO2))
+        return static_cast<IOPCAsyncIO2 *>(this);
+    if (IsEqualIID(riid, IID_IConnectionPointContainer))
+        return static_cast<IConnectionPointContainer *>(this);
     return nullptr;
 }
 
@@ -72,20 +77,45 @@ bool COPCGroup::IsActive()
     return m_active != FALSE;
 }
 
+void COPCGroup::UpdateIdle()
+{
+    // Idle: no scan or transaction queued or running, but for the ones that
+    // are inside a client callback (which may itself be removing the group).
+    if (!m_idle)
+        return;
+    BOOL ok = m_pendingWork - m_callbacksInFlight <= 0 ? SetEvent(m_idle.Get()) : ResetEvent(m_idle.Get());
+    if (!ok)
+        INTERNAL_ASSERT_FAILED("setting the group's idle event");
+}
+
 LONG COPCGroup::AddPendingWork()
 {
     CSingleLock lock(&m_lock);
-    if (++m_pendingWork == 1 && !ResetEvent(m_idle.Get()))
-        INTERNAL_ASSERT_FAILED("ResetEvent for the group's idle event");
+    ++m_pendingWork;
+    UpdateIdle();
     return m_pendingWork;
 }
 
 LONG COPCGroup::ReleasePendingWork()
 {
     CSingleLock lock(&m_lock);
-    if (--m_pendingWork == 0 && !SetEvent(m_idle.Get()))
-        INTERNAL_ASSERT_FAILED("SetEvent for the group's idle event");
+    --m_pendingWork;
+    UpdateIdle();
     return m_pendingWork;
+}
+
+void COPCGroup::BeginCallback()
+{
+    CSingleLock lock(&m_lock);
+    ++m_callbacksInFlight;
+    UpdateIdle();
+}
+
+void COPCGroup::EndCallback()
+{
+    CSingleLock lock(&m_lock);
+    --m_callbacksInFlight;
+    UpdateIdle();
 }
 
 void COPCGroup::BeginRemoval()
@@ -101,6 +131,7 @@ void COPCGroup::BeginRemoval()
 
 void COPCGroup::Destroy()
 {
+    ComPtr<IOPCDataCallback> sink; // released after the lock
     CSingleLock lock(&m_lock);
     if (m_destroyed)
         return;
@@ -112,19 +143,32 @@ void COPCGroup::Destroy()
     if (!m_idle.Reset())
         INTERNAL_ASSERT_FAILED("CloseHandle for the group's idle event");
     m_owner = nullptr;
+    sink = std::move(m_callback);
 }
 
 void COPCGroup::SetActive(BOOL active)
 {
     CSingleLock lock(&m_lock);
+    m_failedScans = 0;
     active = active ? TRUE : FALSE;
     if (m_active == active)
         return;
     m_active = active;
-    // Scheduling on the update scanner joins here with subscriptions.
+    CUpdateScanMgr *scanner = CUpdateScanMgr::Instance();
     if (!active) {
+        // A queued entry goes now; one in flight is dropped by the scanner.
+        if (scanner && scanner->Unschedule(this)) {
+            --m_pendingWork;
+            UpdateIdle();
+            InnerUnknown()->Release(); // the caller holds another reference
+        }
         for (auto &entry : m_items)
             entry.second->SetOutOfService();
+    } else if (scanner) {
+        InnerUnknown()->AddRef();
+        ++m_pendingWork;
+        UpdateIdle();
+        scanner->Schedule(this, 0, true); // scanned at once
     }
 }
 
@@ -168,13 +212,15 @@ STDMETHODIMP COPCGroup::SetState(DWORD *pRequestedUpdateRate, DWORD *pRevisedUpd
 
         HRESULT result = S_OK;
         if (pRequestedUpdateRate) {
+            DWORD oldRate = m_updateRate;
             m_updateRate = *pRequestedUpdateRate;
             if (m_updateRate < kMinUpdateRate) {
                 m_updateRate = kMinUpdateRate;
                 result = OPC_S_UNSUPPORTEDRATE;
             }
-            // An active group's next scan moves with the rate once the
-            // scanner queues groups.
+            if (m_active && m_updateRate != oldRate)
+                if (CUpdateScanMgr *scanner = CUpdateScanMgr::Instance())
+                    scanner->ShiftDue(this, oldRate, m_updateRate);
             *pRevisedUpdateRate = m_updateRate;
         }
         if (pTimeBias)

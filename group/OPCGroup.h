@@ -2,6 +2,7 @@
 // The OPC group: its state, its items and the interfaces a client uses on it.
 // Created only by the server object's AddGroup (and for item properties).
 #include "ComObject.h"
+#include "ComPtr.h"
 #include "GroupOwner.h"
 #include "GroupRegistry.h"
 #include "Handle.h"
@@ -14,6 +15,7 @@
 #include <atomic>
 #include <map>
 #include <memory>
+#include <ocidl.h>
 #include <string>
 #include <vector>
 
@@ -21,6 +23,8 @@ class COPCGroup : public CComObjectRoot,
                   public IOPCGroupStateMgt,
                   public IOPCSyncIO,
                   public IOPCItemMgt,
+                  public IOPCAsyncIO2,
+                  public IConnectionPointContainer,
                   private CItemOwner {
 public:
     // A group with a fresh server handle and no references; null when out of
@@ -41,6 +45,40 @@ public:
     STDMETHODIMP Read(OPCDATASOURCE dwSource, DWORD dwCount, OPCHANDLE *phServer, OPCITEMSTATE **ppItemValues,
                       HRESULT **ppErrors) override;
     STDMETHODIMP Write(DWORD dwCount, OPCHANDLE *phServer, VARIANT *pItemValues, HRESULT **ppErrors) override;
+
+    // IOPCAsyncIO2
+    STDMETHODIMP Read(DWORD dwCount, OPCHANDLE *phServer, DWORD dwTransactionID, DWORD *pdwCancelID,
+                      HRESULT **ppErrors) override;
+    STDMETHODIMP Write(DWORD dwCount, OPCHANDLE *phServer, VARIANT *pItemValues, DWORD dwTransactionID,
+                       DWORD *pdwCancelID, HRESULT **ppErrors) override;
+    STDMETHODIMP Refresh2(OPCDATASOURCE dwSource, DWORD dwTransactionID, DWORD *pdwCancelID) override;
+    STDMETHODIMP Cancel2(DWORD dwCancelID) override;
+    STDMETHODIMP SetEnable(BOOL bEnable) override;
+    STDMETHODIMP GetEnable(BOOL *pbEnable) override;
+
+    // IConnectionPointContainer
+    STDMETHODIMP EnumConnectionPoints(IEnumConnectionPoints **ppEnum) override;
+    STDMETHODIMP FindConnectionPoint(REFIID riid, IConnectionPoint **ppCP) override;
+
+    // The data-callback sink, for the connection point.
+    static constexpr DWORD kCallbackCookie = 0xDA7A;
+    HRESULT AdviseCallback(const ComPtr<IOPCDataCallback> &sink, DWORD *cookie);
+    HRESULT UnadviseCallback(DWORD cookie);
+    ComPtr<IOPCDataCallback> CallbackSink();
+
+    // Work of the transactions, on the worker thread.
+    HRESULT ExecuteRead2(DWORD clientId, const std::vector<OPCHANDLE> &handles);
+    HRESULT ExecuteWrite2(DWORD clientId, const std::vector<OPCHANDLE> &handles, const std::vector<VARIANT> &values);
+    HRESULT ExecuteRefresh2(DWORD clientId, OPCDATASOURCE source);
+
+    // The update scan (scanner thread): delivers the changed active items;
+    // next receives the next due time. FALSE when the group is inactive or
+    // delivery failed.
+    BOOL Scan(LONGLONG &next);
+    void SetFailedScans(DWORD count);
+    DWORD IncrementFailedScans();
+    // The scanner lets go of its queue entry: work unit, then reference.
+    void ReleaseScanEntry();
 
     // IOPCItemMgt
     STDMETHODIMP AddItems(DWORD dwCount, OPCITEMDEF *pItemArray, OPCITEMRESULT **ppAddResults,
@@ -99,6 +137,18 @@ private:
     bool GroupActive() const override { return m_active != FALSE; }
 
     COPCItem *FindItem(OPCHANDLE handle);
+    // IOPCDataCallback calls in flight: removal does not wait for them, so
+    // that a client may remove the group from inside its own callback.
+    void BeginCallback();
+    void EndCallback();
+    void UpdateIdle();
+    // Reads the active items (list order) for a refresh.
+    std::vector<OPCHANDLE> ActiveHandles();
+    HRESULT QueueTransaction(std::unique_ptr<class CTransaction> t);
+    // Checks shared by the asynchronous Read and Write.
+    template <class Check> HRESULT CheckItems(DWORD count, const OPCHANDLE *handles, DWORD *cancelId,
+                                              HRESULT **ppErrors, TaskMem<HRESULT> &errors, std::vector<DWORD> &passed,
+                                              Check check);
     // The common frame of the per-item operations on existing items.
     template <class PerItem>
     HRESULT ForEachHandle(DWORD count, const OPCHANDLE *handles, HRESULT **ppErrors, PerItem perItem);
@@ -118,6 +168,9 @@ private:
     CGroupOwner *m_owner = nullptr;
     std::map<OPCHANDLE, std::unique_ptr<COPCItem>> m_items;
     ActiveItemList m_activeItems;
+    ComPtr<IOPCDataCallback> m_callback;
+    DWORD m_failedScans = 0;
+    LONG m_callbacksInFlight = 0;
     bool m_removing = false;
     bool m_destroyed = false;
     DWORD m_updateRate = 0;

@@ -228,7 +228,10 @@ STDMETHODIMP COPCServer::GetStatus(OPCSERVERSTATUS **ppServerStatus)
             return E_OUTOFMEMORY;
         status->ftStartTime = m_startTime;
         GetSystemTimeAsFileTime(&status->ftCurrentTime);
-        status->ftLastUpdateTime = m_lastUpdateTime;
+        {
+            CSingleLock timeLock(&m_updateTimeLock);
+            status->ftLastUpdateTime = m_lastUpdateTime;
+        }
         status->dwServerState = OPC_STATUS_RUNNING;
         status->dwGroupCount = m_groupCount;
         status->dwBandWidth = 0xFFFFFFFF;
@@ -330,6 +333,6 @@ HRESULT COPCServer::EnumerateGroups(REFIID riid, LPUNKNOWN *ppUnk)
 
 void COPCServer::SetLastUpdateTime(const FILETIME &time)
 {
-    CSingleLock lock(&m_lock);
+    CSingleLock lock(&m_updateTimeLock);
     m_lastUpdateTime = time;
 }

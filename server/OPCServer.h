@@ -33,9 +33,6 @@ public:
     STDMETHODIMP RemoveGroup(OPCHANDLE hServerGroup, BOOL bForce) override;
     STDMETHODIMP CreateGroupEnumerator(OPCENUMSCOPE dwScope, REFIID riid, LPUNKNOWN *ppUnk) override;
 
-    // Called by the update scanner when it has delivered a data change.
-    void SetLastUpdateTime(const FILETIME &time);
-
 protected:
     void *FindInterface(REFIID riid) override;
     HRESULT CreateOnQuery(REFIID riid, void **ppv) override;
@@ -47,6 +44,10 @@ private:
     CGroupRegistry &Registry() override { return m_registry; }
     bool EnterGroupCall() override;
     void LeaveGroupCall() override;
+    // Called by a scan that delivered a data change. The time has a lock of
+    // its own: a scan must never wait for the server lock, which RemoveGroup
+    // holds while it waits for that very group to be idle.
+    void SetLastUpdateTime(const FILETIME &time) override;
 
     template <class T, class... Args> friend T *NewComObject(Args &&...args);
     explicit COPCServer(IUnknown *outer) : CComObjectRoot(outer) {}
@@ -62,6 +63,7 @@ private:
     CAsyncIOMgr *m_asyncMgr = nullptr;
     CCriticalSection m_lock;
     FILETIME m_startTime = {};
+    CCriticalSection m_updateTimeLock; // innermost
     FILETIME m_lastUpdateTime = {};
     DWORD m_groupCount = 0;
     CGroupRegistry m_registry;

@@ -7,6 +7,7 @@
 #include "TaskMem.h"
 
 #include <objidl.h>
+#include <ocidl.h>
 
 #include <vector>
 
@@ -23,6 +24,39 @@ struct EnumCopyUnknown {
     {
         if (item)
             item->Release();
+    }
+};
+
+// Interface pointers of type I (AddRef'd copies).
+template <class I> struct EnumCopyInterface {
+    using Item = I *;
+    static bool Copy(Item &to, Item from)
+    {
+        to = from;
+        if (from)
+            from->AddRef();
+        return true;
+    }
+    static void Destroy(Item item)
+    {
+        if (item)
+            item->Release();
+    }
+};
+
+struct EnumCopyConnection {
+    using Item = CONNECTDATA;
+    static bool Copy(Item &to, const Item &from)
+    {
+        to = from;
+        if (from.pUnk)
+            from.pUnk->AddRef();
+        return true;
+    }
+    static void Destroy(const Item &item)
+    {
+        if (item.pUnk)
+            item.pUnk->Release();
     }
 };
 
@@ -76,7 +110,7 @@ public:
             if (!Policy::Copy(rgelt[i], items[m_index + i])) {
                 for (ULONG j = 0; j < i; ++j) {
                     Policy::Destroy(rgelt[j]);
-                    rgelt[j] = nullptr;
+                    rgelt[j] = Item();
                 }
                 return E_OUTOFMEMORY;
             }
@@ -136,7 +170,7 @@ protected:
 private:
     static void DestroyAll(std::vector<Item> &items)
     {
-        for (Item item : items)
+        for (const Item &item : items)
             Policy::Destroy(item);
         items.clear();
     }
@@ -151,3 +185,5 @@ private:
 
 using CEnumUnknown = CComEnum2<IEnumUnknown, EnumCopyUnknown>;
 using CEnumString = CComEnum2<IEnumString, EnumCopyString>;
+using CEnumConnections = CComEnum2<IEnumConnections, EnumCopyConnection>;
+using CEnumConnectionPoints = CComEnum2<IEnumConnectionPoints, EnumCopyInterface<IConnectionPoint>>;

@@ -1,0 +1,50 @@
+#include "Transaction.h"
+
+#include "OPCGroup.h"
+
+CTransaction::CTransaction(DWORD id, COPCGroup *group, DWORD request) : m_id(id), m_group(group), m_request(request)
+{
+    m_group->InnerUnknown()->AddRef();
+    m_group->AddPendingWork();
+}
+
+CTransaction::~CTransaction()
+{
+    // The work unit goes before the reference, which may be the last.
+    m_group->ReleasePendingWork();
+    m_group->InnerUnknown()->Release();
+}
+
+HRESULT CRead2Transaction::Execute()
+{
+    return m_group->ExecuteRead2(m_request, m_handles);
+}
+
+CWrite2Transaction::~CWrite2Transaction()
+{
+    for (VARIANT &v : m_values)
+        VariantClear(&v);
+}
+
+HRESULT CWrite2Transaction::Add(OPCHANDLE handle, const VARIANT &value)
+{
+    m_values.emplace_back();
+    VariantInit(&m_values.back());
+    HRESULT hr = VariantCopy(&m_values.back(), const_cast<VARIANT *>(&value));
+    if (FAILED(hr)) {
+        m_values.pop_back();
+        return hr;
+    }
+    m_handles.push_back(handle);
+    return S_OK;
+}
+
+HRESULT CWrite2Transaction::Execute()
+{
+    return m_group->ExecuteWrite2(m_request, m_handles, m_values);
+}
+
+HRESULT CRefresh2Transaction::Execute()
+{
+    return m_group->ExecuteRefresh2(m_request, m_source);
+}
