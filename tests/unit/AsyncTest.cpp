@@ -1,0 +1,310 @@
+// Subscriptions and DA 2.0 asynchronous I/O in this process, against the
+// simulated default network.
+#include "InProcServer.h"
+#include "OpcErrors.h"
+#include "TestSink.h"
+
+#include <olectl.h>
+
+#include <future>
+#include <thread>
+
+namespace {
+const wchar_t kFast[] = L"\\\\.\\proc1\\Counters.fast";                // a counter every 10 ms
+const wchar_t kTemperature[] = L"\\\\.\\proc1\\Setpoints.temperature"; // constant 21.5, rw
+const wchar_t kCommand[] = L"\\\\.\\proc1\\Setpoints.command";         // write-only
+const wchar_t kNever[] = L"\\\\.\\proc1\\Setpoints.never";             // never delivers
+
+class AsyncTest : public testing::Test {
+protected:
+    void SetUp() override
+    {
+        server = CreateInProcServer();
+        ASSERT_EQ(server->AddGroup(L"async", TRUE, 50, 777, nullptr, nullptr, 0, &hGroup, &rate, IID_IOPCItemMgt,
+                                   reinterpret_cast<IUnknown **>(items.Out())),
+                  S_OK);
+        ASSERT_EQ(items.As(async), S_OK);
+        ASSERT_EQ(items.As(state), S_OK);
+        ASSERT_EQ(items.As(container), S_OK);
+        ASSERT_EQ(container->FindConnectionPoint(IID_IOPCDataCallback, point.Out()), S_OK);
+    }
+    void TearDown() override
+    {
+        if (cookie)
+            point->Unadvise(cookie);
+        point.Reset();
+        container.Reset();
+        async.Reset();
+        state.Reset();
+        items.Reset();
+        if (server)
+            server->RemoveGroup(hGroup, TRUE);
+        server.Reset();
+    }
+    void Advise() { ASSERT_EQ(point->Advise(&sink, &cookie), S_OK); }
+    std::vector<OPCHANDLE> Add(std::vector<const wchar_t *> ids, BOOL active = TRUE)
+    {
+        std::vector<OPCITEMDEF> defs;
+        for (size_t i = 0; i < ids.size(); ++i) {
+            OPCITEMDEF d = {};
+            d.szItemID = const_cast<wchar_t *>(ids[i]);
+            d.bActive = active;
+            d.hClient = static_cast<OPCHANDLE>(100 + i);
+            defs.push_back(d);
+        }
+        OPCITEMRESULT *r = nullptr;
+        HRESULT *e = nullptr;
+        EXPECT_EQ(items->AddItems(static_cast<DWORD>(defs.size()), defs.data(), &r, &e), S_OK);
+        std::vector<OPCHANDLE> handles;
+        for (size_t i = 0; i < defs.size(); ++i)
+            handles.push_back(r ? r[i].hServer : 0);
+        CoTaskMemFree(r);
+        CoTaskMemFree(e);
+        return handles;
+    }
+    bool GroupActive() { return StateOf(state.Get()).active != FALSE; }
+
+    ComPtr<IOPCServer> server;
+    OPCHANDLE hGroup = 0;
+    DWORD rate = 0;
+    ComPtr<IOPCItemMgt> items;
+    ComPtr<IOPCAsyncIO2> async;
+    ComPtr<IOPCGroupStateMgt> state;
+    ComPtr<IConnectionPointContainer> container;
+    ComPtr<IConnectionPoint> point;
+    TestSink sink;
+    DWORD cookie = 0;
+};
+
+bool HasDataChangeWith(const std::vector<Callback> &calls, OPCHANDLE client, DWORD transid)
+{
+    for (const auto &c : calls)
+        if (c.kind == Callback::DataChange && c.transid == transid)
+            for (OPCHANDLE h : c.clients)
+                if (h == client)
+                    return true;
+    return false;
+}
+} // namespace
+
+TEST_F(AsyncTest, SubscriptionsReportOnlyChangedItemsAndFollowTheEnableFlag)
+{
+    Advise();
+    Add({kTemperature, kFast});
+    // First scan: both items; afterwards only the counter changes.
+    ASSERT_TRUE(sink.WaitFor([](auto &calls) { return HasDataChangeWith(calls, 100, 0); }));
+    ASSERT_TRUE(sink.WaitFor([](auto &calls) {
+        int fastOnly = 0;
+        for (const auto &c : calls)
+            fastOnly += c.kind == Callback::DataChange && c.clients == std::vector<OPCHANDLE>{101};
+        return fastOnly >= 3;
+    }));
+    for (const auto &c : sink.Snapshot()) {
+        EXPECT_EQ(c.group, 777u);
+        EXPECT_EQ(c.transid, 0u);
+        EXPECT_EQ(c.masterQuality, S_OK);
+        EXPECT_EQ(c.masterError, S_OK);
+    }
+    OPCSERVERSTATUS *status = nullptr;
+    ASSERT_EQ(server->GetStatus(&status), S_OK);
+    EXPECT_NE(status->ftLastUpdateTime.dwHighDateTime, 0u) << "a delivered change sets the last update time";
+    CoTaskMemFree(status->szVendorInfo);
+    CoTaskMemFree(status);
+
+    BOOL enabled = FALSE;
+    EXPECT_EQ(async->GetEnable(&enabled), S_OK);
+    EXPECT_TRUE(enabled);
+    EXPECT_EQ(async->SetEnable(FALSE), S_OK);
+    Sleep(150);
+    size_t before = sink.Count(Callback::DataChange);
+    Sleep(300);
+    EXPECT_EQ(sink.Count(Callback::DataChange), before) << "disabled: no subscription changes";
+    DWORD cancelId = 0;
+    ASSERT_EQ(async->Refresh2(OPC_DS_CACHE, 4242, &cancelId), S_OK);
+    EXPECT_NE(cancelId, 0u);
+    ASSERT_TRUE(sink.WaitFor([](auto &calls) { return HasDataChangeWith(calls, 100, 4242); }))
+        << "a refresh is answered whatever the enable flag";
+    EXPECT_EQ(async->GetEnable(nullptr), E_FAIL);
+}
+
+TEST_F(AsyncTest, ReadAndWriteCompleteFromTheWorker)
+{
+    auto h = Add({kTemperature, kCommand});
+    DWORD cancelId = 0;
+    HRESULT *errors = nullptr;
+    OPCHANDLE read[] = {h[0], 0xBAD, h[1]};
+    EXPECT_EQ(async->Read(3, read, 1, &cancelId, &errors), CONNECT_E_NOCONNECTION) << "no sink yet";
+    EXPECT_EQ(async->Read(0, read, 1, &cancelId, &errors), E_INVALIDARG);
+    Advise();
+    ASSERT_EQ(async->Read(3, read, 1, &cancelId, &errors), S_FALSE);
+    EXPECT_EQ(errors[0], S_OK);
+    EXPECT_EQ(errors[1], OPC_E_INVALIDHANDLE);
+    EXPECT_EQ(errors[2], OPC_E_BADRIGHTS);
+    CoTaskMemFree(errors);
+    ASSERT_TRUE(sink.WaitFor([](auto &calls) {
+        for (const auto &c : calls)
+            if (c.kind == Callback::ReadComplete && c.transid == 1)
+                return true;
+        return false;
+    }));
+    for (const auto &c : sink.Snapshot()) {
+        if (c.kind != Callback::ReadComplete)
+            continue;
+        EXPECT_EQ(c.clients, std::vector<OPCHANDLE>{100});
+        EXPECT_EQ(c.values[0], 21.5);
+        EXPECT_NE(c.thread, GetCurrentThreadId());
+    }
+    OPCHANDLE bad[] = {0xBAD};
+    EXPECT_EQ(async->Read(1, bad, 2, &cancelId, &errors), S_FALSE);
+    EXPECT_EQ(cancelId, 0u) << "nothing passed: no transaction";
+    CoTaskMemFree(errors);
+
+    VARIANT values[2];
+    V_VT(&values[0]) = VT_R8;
+    V_R8(&values[0]) = 30.5;
+    V_VT(&values[1]) = VT_R8;
+    V_R8(&values[1]) = 1;
+    ASSERT_EQ(async->Write(2, h.data(), values, 9, &cancelId, &errors), S_OK);
+    CoTaskMemFree(errors);
+    ASSERT_TRUE(sink.WaitFor([](auto &calls) {
+        for (const auto &c : calls)
+            if (c.kind == Callback::WriteComplete && c.transid == 9)
+                return c.masterError == S_OK && c.clients == std::vector<OPCHANDLE>{100, 101};
+        return false;
+    }));
+    EXPECT_EQ(sink.Count(Callback::CancelComplete), 0u);
+}
+
+TEST_F(AsyncTest, CancelDropsQueuedTransactionsWithoutCallbacks)
+{
+    auto h = Add({kNever, kTemperature});
+    Advise();
+    DWORD slowId = 0, queuedId = 0;
+    HRESULT *errors = nullptr;
+    // The worker spends about 3 s waiting for the member that never delivers.
+    ASSERT_EQ(async->Read(1, &h[0], 50, &slowId, &errors), S_OK);
+    CoTaskMemFree(errors);
+    ASSERT_EQ(async->Read(1, &h[1], 51, &queuedId, &errors), S_OK);
+    CoTaskMemFree(errors);
+    EXPECT_EQ(async->Cancel2(queuedId), S_OK);
+    EXPECT_EQ(async->Cancel2(queuedId), E_FAIL) << "already gone";
+    EXPECT_EQ(async->Cancel2(0xFFFFFF), E_FAIL) << "never issued";
+    ASSERT_TRUE(sink.WaitFor([](auto &calls) {
+        for (const auto &c : calls)
+            if (c.kind == Callback::ReadComplete && c.transid == 50)
+                return true;
+        return false;
+    }));
+    Sleep(100);
+    for (const auto &c : sink.Snapshot()) {
+        EXPECT_NE(c.transid, 51u) << "a cancelled read sends nothing";
+        if (c.transid == 50) {
+            EXPECT_EQ(c.errors, std::vector<HRESULT>{OPC_E_UNKNOWNITEMID});
+        }
+    }
+    EXPECT_EQ(async->Cancel2(slowId), E_FAIL) << "already completed";
+    EXPECT_EQ(sink.Count(Callback::CancelComplete), 0u);
+}
+
+TEST_F(AsyncTest, ConnectionPointRules)
+{
+    DWORD c2 = 0;
+    Advise();
+    TestSink other;
+    EXPECT_EQ(point->Advise(&other, &c2), CONNECT_E_ADVISELIMIT);
+    EXPECT_EQ(c2, 0u);
+    EXPECT_EQ(point->Unadvise(cookie + 1), CONNECT_E_NOCONNECTION);
+    ComPtr<IEnumConnections> connections;
+    ASSERT_EQ(point->EnumConnections(connections.Out()), S_OK);
+    CONNECTDATA data = {};
+    ASSERT_EQ(connections->Next(1, &data, nullptr), S_OK);
+    EXPECT_EQ(data.dwCookie, cookie);
+    data.pUnk->Release();
+    IID iid;
+    EXPECT_EQ(point->GetConnectionInterface(&iid), S_OK);
+    EXPECT_TRUE(IsEqualIID(iid, IID_IOPCDataCallback));
+    ComPtr<IConnectionPoint> none;
+    EXPECT_EQ(container->FindConnectionPoint(IID_IDispatch, none.Out()), CONNECT_E_NOCONNECTION);
+    EXPECT_EQ(point->Unadvise(cookie), S_OK);
+    cookie = 0;
+    EXPECT_EQ(point->Advise(&other, &c2), S_OK) << "free again after Unadvise";
+    EXPECT_EQ(point->Unadvise(c2), S_OK);
+    EXPECT_EQ(point->Advise(nullptr, &c2), E_POINTER);
+    EXPECT_EQ(async->SetEnable(TRUE), CONNECT_E_NOCONNECTION);
+    EXPECT_EQ(other.Refs(), 1u) << "the group released the sink";
+
+    Advise();
+    DWORD cancelId;
+    EXPECT_EQ(async->Refresh2(static_cast<OPCDATASOURCE>(3), 1, &cancelId), E_INVALIDARG);
+    EXPECT_EQ(async->Refresh2(OPC_DS_CACHE, 1, &cancelId), E_FAIL) << "an active group without active items";
+    Add({kTemperature}, FALSE);
+    EXPECT_EQ(async->Refresh2(OPC_DS_CACHE, 1, &cancelId), E_FAIL);
+}
+
+TEST_F(AsyncTest, ThreeFailedDeliveriesMakeTheGroupInactive)
+{
+    sink.dataChangeResult = E_FAIL;
+    Advise();
+    Add({kFast});
+    ASSERT_TRUE(sink.WaitFor([](auto &calls) { return calls.size() >= 3; }));
+    for (int i = 0; i < 100 && GroupActive(); ++i)
+        Sleep(20);
+    EXPECT_FALSE(GroupActive());
+    Sleep(200);
+    size_t after = sink.Count(Callback::DataChange);
+    Sleep(200);
+    EXPECT_EQ(sink.Count(Callback::DataChange), after);
+}
+
+TEST_F(AsyncTest, RemovalDuringACallbackNeverWaitsForThatCallback)
+{
+    // The hazard: RemoveGroup holds the server lock while it waits for the
+    // group to be idle, and a scan inside OnDataChange still holds the
+    // group's work. Without the fix this test hangs (each wait is bounded
+    // here so that it fails instead).
+    std::promise<void> inCallback, removed;
+    std::shared_future<void> removedFuture = removed.get_future().share();
+    std::atomic<bool> first{true};
+    sink.onDataChange = [&] {
+        if (first.exchange(false)) {
+            inCallback.set_value();
+            removedFuture.wait_for(std::chrono::seconds(10));
+        }
+    };
+    Advise();
+    Add({kFast});
+    ASSERT_EQ(inCallback.get_future().wait_for(std::chrono::seconds(10)), std::future_status::ready);
+    auto remover = std::async(std::launch::async, [&] {
+        CoInitializeEx(nullptr, COINIT_MULTITHREADED);
+        HRESULT hr = server->RemoveGroup(hGroup, FALSE);
+        CoUninitialize();
+        return hr;
+    });
+    ASSERT_EQ(remover.wait_for(std::chrono::seconds(5)), std::future_status::ready)
+        << "RemoveGroup waited for the callback that is waiting for it";
+    EXPECT_EQ(remover.get(), OPC_S_INUSE);
+    removed.set_value();
+    hGroup = 0;
+}
+
+TEST_F(AsyncTest, AClientMayRemoveItsGroupFromInsideItsOwnCallback)
+{
+    std::promise<HRESULT> result;
+    std::atomic<bool> first{true};
+    sink.onDataChange = [&] {
+        if (first.exchange(false))
+            result.set_value(server->RemoveGroup(hGroup, TRUE));
+    };
+    Advise();
+    Add({kFast});
+    auto f = result.get_future();
+    ASSERT_EQ(f.wait_for(std::chrono::seconds(10)), std::future_status::ready)
+        << "the removal inside the callback did not return";
+    EXPECT_EQ(f.get(), S_OK);
+    hGroup = 0;
+    cookie = 0; // the group went with its sink
+    Sleep(200);
+    size_t after = sink.Count(Callback::DataChange);
+    Sleep(200);
+    EXPECT_EQ(sink.Count(Callback::DataChange), after) << "a removed group is not scanned";
+}
