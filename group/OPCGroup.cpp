@@ -45,10 +45,14 @@ void *COPCGroup::FindInterface(REFIID riid)
         return static_cast<IOPCGroupStateMgt *>(this);
     if (IsEqualIID(riid, IID_IOPCSyncIO))
         return static_cast<IOPCSyncIO *>(this);
+    if (IsEqualIID(riid, IID_IOPCAsyncIO))
+        return static_cast<IOPCAsyncIO *>(this);
     if (IsEqualIID(riid, IID_IOPCItemMgt))
         return static_cast<IOPCItemMgt *>(this);
     if (IsEqualIID(riid, IID_IOPCAsyncIO2))
         return static_cast<IOPCAsyncIO2 *>(this);
+    if (IsEqualIID(riid, IID_IDataObject))
+        return static_cast<IDataObject *>(this);
     if (IsEqualIID(riid, IID_IConnectionPointContainer))
         return static_cast<IConnectionPointContainer *>(this);
     return nullptr;
@@ -144,6 +148,9 @@ void COPCGroup::Destroy()
         INTERNAL_ASSERT_FAILED("CloseHandle for the group's idle event");
     m_owner = nullptr;
     sink = std::move(m_callback);
+    m_dataAdvise.RemoveAll();
+    m_dataTimeAdvise.RemoveAll();
+    m_writeAdvise.RemoveAll();
 }
 
 void COPCGroup::SetActive(BOOL active)

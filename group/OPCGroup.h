@@ -1,6 +1,7 @@
 #pragma once
 // The OPC group: its state, its items and the interfaces a client uses on it.
 // Created only by the server object's AddGroup (and for item properties).
+#include "AdvisoryConnectionMgr.h"
 #include "ComObject.h"
 #include "ComPtr.h"
 #include "GroupOwner.h"
@@ -22,8 +23,10 @@
 class COPCGroup : public CComObjectRoot,
                   public IOPCGroupStateMgt,
                   public IOPCSyncIO,
+                  public IOPCAsyncIO,
                   public IOPCItemMgt,
                   public IOPCAsyncIO2,
+                  public IDataObject,
                   public IConnectionPointContainer,
                   private CItemOwner {
 public:
@@ -45,6 +48,25 @@ public:
     STDMETHODIMP Read(OPCDATASOURCE dwSource, DWORD dwCount, OPCHANDLE *phServer, OPCITEMSTATE **ppItemValues,
                       HRESULT **ppErrors) override;
     STDMETHODIMP Write(DWORD dwCount, OPCHANDLE *phServer, VARIANT *pItemValues, HRESULT **ppErrors) override;
+
+    // IOPCAsyncIO (DA 1.0)
+    STDMETHODIMP Read(DWORD dwConnection, OPCDATASOURCE dwSource, DWORD dwCount, OPCHANDLE *phServer,
+                      DWORD *pTransactionID, HRESULT **ppErrors) override;
+    STDMETHODIMP Write(DWORD dwConnection, DWORD dwCount, OPCHANDLE *phServer, VARIANT *pItemValues,
+                       DWORD *pTransactionID, HRESULT **ppErrors) override;
+    STDMETHODIMP Refresh(DWORD dwConnection, OPCDATASOURCE dwSource, DWORD *pTransactionID) override;
+    STDMETHODIMP Cancel(DWORD dwTransactionID) override;
+
+    // IDataObject
+    STDMETHODIMP GetData(FORMATETC *, STGMEDIUM *) override { return E_NOTIMPL; }
+    STDMETHODIMP GetDataHere(FORMATETC *, STGMEDIUM *) override { return E_NOTIMPL; }
+    STDMETHODIMP QueryGetData(FORMATETC *pformatetc) override;
+    STDMETHODIMP GetCanonicalFormatEtc(FORMATETC *, FORMATETC *) override { return E_NOTIMPL; }
+    STDMETHODIMP SetData(FORMATETC *, STGMEDIUM *, BOOL) override { return E_NOTIMPL; }
+    STDMETHODIMP EnumFormatEtc(DWORD, IEnumFORMATETC **) override { return E_NOTIMPL; }
+    STDMETHODIMP DAdvise(FORMATETC *pformatetc, DWORD advf, IAdviseSink *pAdvSink, DWORD *pdwConnection) override;
+    STDMETHODIMP DUnadvise(DWORD dwConnection) override;
+    STDMETHODIMP EnumDAdvise(IEnumSTATDATA **) override { return E_NOTIMPL; }
 
     // IOPCAsyncIO2
     STDMETHODIMP Read(DWORD dwCount, OPCHANDLE *phServer, DWORD dwTransactionID, DWORD *pdwCancelID,
@@ -70,6 +92,18 @@ public:
     HRESULT ExecuteRead2(DWORD clientId, const std::vector<OPCHANDLE> &handles);
     HRESULT ExecuteWrite2(DWORD clientId, const std::vector<OPCHANDLE> &handles, const std::vector<VARIANT> &values);
     HRESULT ExecuteRefresh2(DWORD clientId, OPCDATASOURCE source);
+    HRESULT ExecuteRead(DWORD connection, DWORD id, OPCDATASOURCE source, const std::vector<OPCHANDLE> &handles);
+    HRESULT ExecuteWrite(DWORD connection, DWORD id, const std::vector<OPCHANDLE> &handles,
+                         const std::vector<VARIANT> &values);
+    HRESULT ExecuteRefresh(DWORD connection, DWORD id, OPCDATASOURCE source);
+
+    // The DA 1.0 senders (group lock held while the sinks are called).
+    HRESULT NotifyAdviseSinks(DWORD count, const OPCHANDLE *clients, const VARIANT *values, const WORD *qualities,
+                              const FILETIME *times);
+    HRESULT SendReadComplete(DWORD connection, DWORD id, HRESULT overall, DWORD count, const OPCHANDLE *clients,
+                             const VARIANT *values, const WORD *qualities, const FILETIME *times);
+    HRESULT SendWriteComplete(DWORD connection, DWORD id, HRESULT overall, DWORD count, const OPCHANDLE *clients,
+                              const HRESULT *errors);
 
     // The update scan (scanner thread): delivers the changed active items;
     // next receives the next due time. FALSE when the group is inactive or
@@ -169,6 +203,9 @@ private:
     std::map<OPCHANDLE, std::unique_ptr<COPCItem>> m_items;
     ActiveItemList m_activeItems;
     ComPtr<IOPCDataCallback> m_callback;
+    CAdvisoryConnectionMgr m_dataAdvise;
+    CAdvisoryConnectionMgr m_dataTimeAdvise;
+    CAdvisoryConnectionMgr m_writeAdvise;
     DWORD m_failedScans = 0;
     LONG m_callbacksInFlight = 0;
     bool m_removing = false;

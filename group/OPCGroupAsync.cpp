@@ -401,8 +401,8 @@ BOOL COPCGroup::Scan(LONGLONG &next)
                                d.values.data(), d.qualities.data(), d.times.data(), d.errors.data());
         lock.Lock();
     }
-    // The IDataObject advise sinks (DA 1.0) join here.
-    HRESULT adviseResult = S_FALSE;
+    HRESULT adviseResult =
+        NotifyAdviseSinks(static_cast<DWORD>(n), d.clients.data(), d.values.data(), d.qualities.data(), d.times.data());
     if (callbackResult == S_OK || adviseResult == S_OK) {
         // Recorded without the server lock, which a removal of this group
         // may hold while it waits.

@@ -48,3 +48,37 @@ HRESULT CRefresh2Transaction::Execute()
 {
     return m_group->ExecuteRefresh2(m_request, m_source);
 }
+
+HRESULT CReadTransaction::Execute()
+{
+    return m_group->ExecuteRead(m_request, m_id, m_source, m_handles);
+}
+
+CWriteTransaction::~CWriteTransaction()
+{
+    for (VARIANT &v : m_values)
+        VariantClear(&v);
+}
+
+HRESULT CWriteTransaction::Add(OPCHANDLE handle, const VARIANT &value)
+{
+    m_values.emplace_back();
+    VariantInit(&m_values.back());
+    HRESULT hr = VariantCopy(&m_values.back(), const_cast<VARIANT *>(&value));
+    if (FAILED(hr)) {
+        m_values.pop_back();
+        return hr;
+    }
+    m_handles.push_back(handle);
+    return S_OK;
+}
+
+HRESULT CWriteTransaction::Execute()
+{
+    return m_group->ExecuteWrite(m_request, m_id, m_handles, m_values);
+}
+
+HRESULT CRefreshTransaction::Execute()
+{
+    return m_group->ExecuteRefresh(m_request, m_id, m_source);
+}

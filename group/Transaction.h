@@ -70,3 +70,47 @@ public:
 private:
     OPCDATASOURCE m_source;
 };
+
+// Version 1.0 requests (IOPCAsyncIO); completions go as streams to the
+// IDataObject advise connection named by the request.
+class CAsyncTransaction : public CTransaction {
+protected:
+    using CTransaction::CTransaction;
+};
+
+class CReadTransaction : public CAsyncTransaction {
+public:
+    CReadTransaction(DWORD id, COPCGroup *group, DWORD connection, OPCDATASOURCE source, std::vector<OPCHANDLE> handles)
+        : CAsyncTransaction(id, group, connection), m_source(source), m_handles(std::move(handles))
+    {
+    }
+    HRESULT Execute() override;
+
+private:
+    OPCDATASOURCE m_source;
+    std::vector<OPCHANDLE> m_handles;
+};
+
+class CWriteTransaction : public CAsyncTransaction {
+public:
+    CWriteTransaction(DWORD id, COPCGroup *group, DWORD connection) : CAsyncTransaction(id, group, connection) {}
+    ~CWriteTransaction() override;
+    HRESULT Add(OPCHANDLE handle, const VARIANT &value);
+    HRESULT Execute() override;
+
+private:
+    std::vector<OPCHANDLE> m_handles;
+    std::vector<VARIANT> m_values;
+};
+
+class CRefreshTransaction : public CAsyncTransaction {
+public:
+    CRefreshTransaction(DWORD id, COPCGroup *group, DWORD connection, OPCDATASOURCE source)
+        : CAsyncTransaction(id, group, connection), m_source(source)
+    {
+    }
+    HRESULT Execute() override;
+
+private:
+    OPCDATASOURCE m_source;
+};

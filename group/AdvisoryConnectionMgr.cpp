@@ -1,0 +1,80 @@
+#include "AdvisoryConnectionMgr.h"
+
+#include "IdMgr.h"
+
+CConnectionData::CConnectionData(const FORMATETC &f, DWORD a, IAdviseSink *s)
+    : format(f), advf(a), id(CIdMgr::Instance().GetId()), sink(s)
+{
+    sink->AddRef();
+}
+
+CConnectionData::~CConnectionData()
+{
+    CIdMgr::Instance().ReleaseId(id);
+    sink->Release();
+}
+
+HRESULT CAdvisoryConnectionMgr::Add(const FORMATETC &format, DWORD advf, IAdviseSink *sink, DWORD *id)
+{
+    auto record = std::make_unique<CConnectionData>(format, advf, sink);
+    CSingleLock lock(&m_lock);
+    *id = record->id;
+    m_connections.push_front(std::move(record));
+    return S_OK;
+}
+
+HRESULT CAdvisoryConnectionMgr::Remove(DWORD id)
+{
+    std::unique_ptr<CConnectionData> removed; // destroyed after the lock
+    CSingleLock lock(&m_lock);
+    for (auto it = m_connections.begin(); it != m_connections.end(); ++it) {
+        if ((*it)->id == id) {
+            removed = std::move(*it);
+            m_connections.erase(it);
+            return S_OK;
+        }
+    }
+    return S_FALSE;
+}
+
+void CAdvisoryConnectionMgr::RemoveAll()
+{
+    std::list<std::unique_ptr<CConnectionData>> removed;
+    CSingleLock lock(&m_lock);
+    removed.swap(m_connections);
+}
+
+bool CAdvisoryConnectionMgr::Contains(DWORD id)
+{
+    CSingleLock lock(&m_lock);
+    for (auto &c : m_connections)
+        if (c->id == id)
+            return true;
+    return false;
+}
+
+size_t CAdvisoryConnectionMgr::Count()
+{
+    CSingleLock lock(&m_lock);
+    return m_connections.size();
+}
+
+HRESULT CAdvisoryConnectionMgr::SendTo(DWORD id, STGMEDIUM &medium)
+{
+    CSingleLock lock(&m_lock);
+    for (auto &c : m_connections) {
+        if (c->id == id) {
+            c->sink->OnDataChange(&c->format, &medium);
+            return S_OK;
+        }
+    }
+    return S_FALSE;
+}
+
+HRESULT CAdvisoryConnectionMgr::SendToAll(STGMEDIUM &medium)
+{
+    CSingleLock lock(&m_lock);
+    for (auto &c : m_connections)
+        c->sink->OnDataChange(&c->format, &medium);
+    return m_connections.empty() ? E_FAIL : S_OK;
+}
