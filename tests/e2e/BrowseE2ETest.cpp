@@ -97,11 +97,10 @@ TEST(BrowseE2E, BrowsesDownAndUpAndAddsWhatItFound)
 
         // A member added and removed through the control channel.
         std::string out;
-        std::wstring tool = L"\"" + BinPath(L"cadroctl.exe") + L"\" ";
-        EXPECT_EQ(RunAndCapture(tool + L"add-member \\\\PLANT7\\control\\Boiler fresh type=bool", out), 0) << out;
+        EXPECT_EQ(RunCadroctl(L"add-member \\\\PLANT7\\control\\Boiler fresh type=bool", out), 0) << out;
         EXPECT_EQ(browse->ChangeBrowsePosition(OPC_BROWSE_TO, L"\\\\PLANT7\\control\\Boiler"), S_OK);
         EXPECT_TRUE(Contains(Names(browse.Get(), OPC_LEAF, L"f*"), L"fresh"));
-        EXPECT_EQ(RunAndCapture(tool + L"remove-member \\\\PLANT7\\control\\Boiler.fresh", out), 0) << out;
+        EXPECT_EQ(RunCadroctl(L"remove-member \\\\PLANT7\\control\\Boiler.fresh", out), 0) << out;
         EXPECT_FALSE(Contains(Names(browse.Get(), OPC_LEAF, L"f*"), L"fresh"));
     }
     EXPECT_TRUE(WaitForNoServerProcess(20000));

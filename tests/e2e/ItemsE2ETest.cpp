@@ -155,9 +155,7 @@ TEST_F(ItemsE2E, PublishedQualityWritesAndRights)
 
     // A bad-quality value published through the network's control channel.
     std::string out;
-    EXPECT_EQ(RunAndCapture(L"\"" + BinPath(L"cadroctl.exe") + L"\" publish " + kTemperature + L" 30 quality=bad", out),
-              0)
-        << out;
+    EXPECT_EQ(RunCadroctl(std::wstring(L"publish ") + kTemperature + L" 30 quality=bad", out), 0) << out;
     EXPECT_TRUE(ReadUntil(
         h[0], [](const Row &r) { return r.hr == S_OK && r.quality == OPC_QUALITY_BAD && V_R8(&r.value) == 30.0; }));
 

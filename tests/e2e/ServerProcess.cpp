@@ -23,6 +23,26 @@ int CountServerProcesses()
     return count;
 }
 
+DWORD ServerProcessId()
+{
+    UniqueHandle snapshot(CreateToolhelp32Snapshot(TH32CS_SNAPPROCESS, 0));
+    if (!snapshot)
+        return 0;
+    PROCESSENTRY32W entry = {};
+    entry.dwSize = sizeof entry;
+    for (BOOL more = Process32FirstW(snapshot.Get(), &entry); more; more = Process32NextW(snapshot.Get(), &entry))
+        if (_wcsicmp(entry.szExeFile, L"Local.exe") == 0)
+            return entry.th32ProcessID;
+    return 0;
+}
+
+long RunCadroctl(const std::wstring &arguments, std::string &output)
+{
+    return RunAndCapture(L"\"" + BinPath(L"cadroctl.exe") + L"\" --pid " + std::to_wstring(ServerProcessId()) + L" " +
+                             arguments,
+                         output);
+}
+
 bool WaitForNoServerProcess(DWORD timeoutMs)
 {
     DWORD start = GetTickCount();

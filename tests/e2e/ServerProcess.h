@@ -11,6 +11,11 @@ extern const CLSID CLSID_SkylarcOPCServerE2E;
 
 // Number of running processes whose image is Local.exe.
 int CountServerProcesses();
+// The id of a running Local.exe, 0 when none.
+DWORD ServerProcessId();
+// Runs cadroctl against the running server's network only (other programs
+// of the prefix serve networks of their own).
+long RunCadroctl(const std::wstring &arguments, std::string &output);
 // Waits up to timeoutMs for no server process to be left.
 bool WaitForNoServerProcess(DWORD timeoutMs);
 // Full path of a program of the build (from SKYLARC_BIN_DIR, else beside

@@ -71,7 +71,7 @@ protected:
     long Publish(const std::wstring &args)
     {
         std::string out;
-        return RunAndCapture(L"\"" + BinPath(L"cadroctl.exe") + L"\" publish " + args, out);
+        return RunCadroctl(L"publish " + args, out);
     }
 
     ComPtr<IOPCServer> server;
