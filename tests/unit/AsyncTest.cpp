@@ -1,5 +1,6 @@
 // Subscriptions and DA 2.0 asynchronous I/O in this process, against the
 // simulated default network.
+#include "ComModule.h"
 #include "InProcServer.h"
 #include "OpcErrors.h"
 #include "TestSink.h"
@@ -307,4 +308,92 @@ TEST_F(AsyncTest, AClientMayRemoveItsGroupFromInsideItsOwnCallback)
     size_t after = sink.Count(Callback::DataChange);
     Sleep(200);
     EXPECT_EQ(sink.Count(Callback::DataChange), after) << "a removed group is not scanned";
+}
+
+TEST_F(AsyncTest, TogglesAndRateChangesFromManyThreadsWhileScansRun)
+{
+    Advise();
+    auto h = Add({kFast, kTemperature});
+    std::atomic<bool> stop{false};
+    std::vector<std::thread> threads;
+    for (int t = 0; t < 4; ++t) {
+        threads.emplace_back([&, t] {
+            CoInitializeEx(nullptr, COINIT_MULTITHREADED);
+            for (int i = 0; !stop; ++i) {
+                DWORD requested = 10 + (i % 7) * 5, revised;
+                BOOL active = (i + t) % 3 != 0;
+                state->SetState(&requested, &revised, &active, nullptr, nullptr, nullptr, nullptr);
+                HRESULT *errors = nullptr;
+                items->SetActiveState(1, &h[t % 2], i % 2, &errors);
+                CoTaskMemFree(errors);
+                DWORD cancel = 0;
+                if (SUCCEEDED(async->Read(2, h.data(), i, &cancel, &errors)) && i % 3 == 0)
+                    async->Cancel2(cancel);
+                CoTaskMemFree(errors);
+            }
+            CoUninitialize();
+        });
+    }
+    Sleep(1500);
+    stop = true;
+    for (auto &t : threads)
+        t.join();
+    // Still working: an active group reports its items again.
+    BOOL active = TRUE;
+    DWORD requested = 10, revised;
+    EXPECT_EQ(state->SetState(&requested, &revised, &active, nullptr, nullptr, nullptr, nullptr), S_OK);
+    size_t before = sink.Count(Callback::DataChange);
+    EXPECT_TRUE(sink.WaitFor([before](auto &calls) { return calls.size() > before + 3; }));
+}
+
+TEST(AsyncShutdown, ThousandsOfQueuedTransactionsAtReleaseNeitherHangNorLeak)
+{
+    LONG locks = ComModule::LockCount();
+    TestSink sink;
+    auto server = CreateInProcServer();
+    auto makeGroup = [&](const wchar_t *item, ComPtr<IOPCAsyncIO2> &async, OPCHANDLE &h) {
+        OPCHANDLE hGroup;
+        DWORD rate;
+        ComPtr<IOPCItemMgt> items;
+        ASSERT_EQ(server->AddGroup(L"", TRUE, 1000, 0, nullptr, nullptr, 0, &hGroup, &rate, IID_IOPCItemMgt,
+                                   reinterpret_cast<IUnknown **>(items.Out())),
+                  S_OK);
+        items.As(async);
+        ComPtr<IConnectionPointContainer> container;
+        items.As(container);
+        ComPtr<IConnectionPoint> point;
+        container->FindConnectionPoint(IID_IOPCDataCallback, point.Out());
+        DWORD cookie;
+        ASSERT_EQ(point->Advise(&sink, &cookie), S_OK);
+        OPCITEMDEF def = {};
+        def.szItemID = const_cast<wchar_t *>(item);
+        OPCITEMRESULT *r = nullptr;
+        HRESULT *e = nullptr;
+        ASSERT_EQ(items->AddItems(1, &def, &r, &e), S_OK);
+        h = r[0].hServer;
+        CoTaskMemFree(r);
+        CoTaskMemFree(e);
+    };
+    ComPtr<IOPCAsyncIO2> blocker, busy;
+    OPCHANDLE hNever = 0, hTemperature = 0;
+    makeGroup(kNever, blocker, hNever);
+    makeGroup(kTemperature, busy, hTemperature);
+    DWORD cancel;
+    HRESULT *e = nullptr;
+    ASSERT_EQ(blocker->Read(1, &hNever, 1, &cancel, &e), S_OK); // the worker waits about 3 s
+    CoTaskMemFree(e);
+    for (int i = 0; i < 5000; ++i) {
+        ASSERT_EQ(busy->Read(1, &hTemperature, i, &cancel, &e), S_OK);
+        CoTaskMemFree(e);
+    }
+    blocker.Reset();
+    busy.Reset();
+    // The release removes the groups, which waits for their transactions.
+    auto release = std::async(std::launch::async, [&] {
+        CoInitializeEx(nullptr, COINIT_MULTITHREADED);
+        server.Reset();
+        CoUninitialize();
+    });
+    ASSERT_EQ(release.wait_for(std::chrono::seconds(60)), std::future_status::ready);
+    EXPECT_EQ(ComModule::LockCount(), locks) << "every group and transaction was released";
 }
