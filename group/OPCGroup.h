@@ -9,6 +9,7 @@
 #include "Handle.h"
 #include "ItemOwner.h"
 #include "OPCItem.h"
+#include "SingleSinkPoint.h"
 #include "SyncObject.h"
 #include "TaskMem.h"
 #include "opcda.h"
@@ -28,7 +29,8 @@ class COPCGroup : public CComObjectRoot,
                   public IOPCAsyncIO2,
                   public IDataObject,
                   public IConnectionPointContainer,
-                  private CItemOwner {
+                  private CItemOwner,
+                  private ISinkSlot {
 public:
     // A group with a fresh server handle and no references; null when out of
     // memory or when no identifier is left.
@@ -82,11 +84,8 @@ public:
     STDMETHODIMP EnumConnectionPoints(IEnumConnectionPoints **ppEnum) override;
     STDMETHODIMP FindConnectionPoint(REFIID riid, IConnectionPoint **ppCP) override;
 
-    // The data-callback sink, for the connection point.
+    // The data-callback sink's fixed cookie.
     static constexpr DWORD kCallbackCookie = 0xDA7A;
-    HRESULT AdviseCallback(const ComPtr<IOPCDataCallback> &sink, DWORD *cookie);
-    HRESULT UnadviseCallback(DWORD cookie);
-    ComPtr<IOPCDataCallback> CallbackSink();
 
     // Work of the transactions, on the worker thread.
     HRESULT ExecuteRead2(DWORD clientId, const std::vector<OPCHANDLE> &handles);
@@ -165,6 +164,12 @@ protected:
     void FinalRelease() override;
 
 private:
+    // ISinkSlot: the one IOPCDataCallback sink.
+    const IID &SinkIid() const override { return IID_IOPCDataCallback; }
+    HRESULT FillSlot(const ComPtr<IUnknown> &sink, DWORD *cookie) override;
+    HRESULT EmptySlot(DWORD cookie) override;
+    ComPtr<IUnknown> SlotSink(DWORD *cookie) override;
+
     // CItemOwner
     CSyncObject &GroupLock() override { return m_lock; }
     ActiveItemList &ActiveItems() override { return m_activeItems; }

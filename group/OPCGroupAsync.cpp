@@ -3,7 +3,6 @@
 #include "AsyncIOMgr.h"
 #include "ComEnum2.h"
 #include "ComUtil.h"
-#include "DataCallbackPoint.h"
 #include "IdMgr.h"
 #include "OPCGroup.h"
 #include "OpcErrors.h"
@@ -71,17 +70,17 @@ private:
 
 // ---- Connection point ------------------------------------------------
 
-HRESULT COPCGroup::AdviseCallback(const ComPtr<IOPCDataCallback> &sink, DWORD *cookie)
+HRESULT COPCGroup::FillSlot(const ComPtr<IUnknown> &sink, DWORD *cookie)
 {
     CSingleLock lock(&m_lock);
     if (m_callback)
         return CONNECT_E_ADVISELIMIT;
-    m_callback = sink;
+    m_callback = ComPtr<IOPCDataCallback>(static_cast<IOPCDataCallback *>(sink.Get()));
     *cookie = kCallbackCookie;
     return S_OK;
 }
 
-HRESULT COPCGroup::UnadviseCallback(DWORD cookie)
+HRESULT COPCGroup::EmptySlot(DWORD cookie)
 {
     ComPtr<IOPCDataCallback> released; // released after the lock
     CSingleLock lock(&m_lock);
@@ -91,32 +90,21 @@ HRESULT COPCGroup::UnadviseCallback(DWORD cookie)
     return S_OK;
 }
 
-ComPtr<IOPCDataCallback> COPCGroup::CallbackSink()
+ComPtr<IUnknown> COPCGroup::SlotSink(DWORD *cookie)
 {
     CSingleLock lock(&m_lock);
-    return m_callback;
+    *cookie = kCallbackCookie;
+    return ComPtr<IUnknown>(m_callback.Get());
 }
 
 STDMETHODIMP COPCGroup::FindConnectionPoint(REFIID riid, IConnectionPoint **ppCP)
 {
-    if (!ppCP)
-        return E_POINTER;
-    *ppCP = nullptr;
-    if (!IsEqualIID(riid, IID_IOPCDataCallback))
-        return CONNECT_E_NOCONNECTION;
-    return CDataCallbackPoint::Create(this, IID_IConnectionPoint, reinterpret_cast<void **>(ppCP));
+    return FindSingleSinkPoint(this, InnerUnknown(), riid, ppCP);
 }
 
 STDMETHODIMP COPCGroup::EnumConnectionPoints(IEnumConnectionPoints **ppEnum)
 {
-    if (!ppEnum)
-        return E_POINTER;
-    *ppEnum = nullptr;
-    IConnectionPoint *point = nullptr;
-    HRESULT hr = CDataCallbackPoint::Create(this, IID_IConnectionPoint, reinterpret_cast<void **>(&point));
-    if (FAILED(hr))
-        return hr;
-    return CEnumConnectionPoints::Create({point}, true, IID_IEnumConnectionPoints, reinterpret_cast<void **>(ppEnum));
+    return EnumSingleSinkPoint(this, InnerUnknown(), ppEnum);
 }
 
 // ---- IOPCAsyncIO2 ----------------------------------------------------

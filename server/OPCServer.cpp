@@ -12,6 +12,9 @@
 #include "TaskMem.h"
 #include "UpdateScanMgr.h"
 
+#include <algorithm>
+#include <iterator>
+
 namespace {
 constexpr DWORD kMinUpdateRate = 10;
 constexpr WORD kMajorVersion = 1;
@@ -36,6 +39,10 @@ void *COPCServer::FindInterface(REFIID riid)
 {
     if (IsEqualIID(riid, IID_IOPCServer))
         return static_cast<IOPCServer *>(this);
+    if (IsEqualIID(riid, IID_IOPCCommon))
+        return static_cast<IOPCCommon *>(this);
+    if (IsEqualIID(riid, IID_IConnectionPointContainer))
+        return static_cast<IConnectionPointContainer *>(this);
     return nullptr;
 }
 
@@ -106,6 +113,7 @@ void COPCServer::FinalRelease()
         CAsyncIOMgr::ReleaseInstance();
         m_asyncMgr = nullptr;
     }
+    m_shutdownSink.Reset(); // a sink still advised goes with the server
 }
 
 STDMETHODIMP COPCServer::AddGroup(LPCWSTR szName, BOOL bActive, DWORD dwRequestedUpdateRate, OPCHANDLE hClientGroup,
@@ -189,11 +197,124 @@ void COPCServer::UndoAddGroup(COPCGroup *group, LPUNKNOWN *ppUnk)
     group->Destroy();
 }
 
-STDMETHODIMP COPCServer::GetErrorString(HRESULT, LCID, LPWSTR *ppString)
+STDMETHODIMP COPCServer::GetErrorString(HRESULT dwError, LCID dwLocale, LPWSTR *ppString)
 {
-    if (IsWritableOut(ppString))
+    return ComBoundary([&]() -> HRESULT {
+        if (!IsWritableOut(ppString))
+            return E_INVALIDARG; // nowhere to write the text
         *ppString = nullptr;
-    return E_NOTIMPL;
+        // The executable's message table first, then the system's messages;
+        // the locale goes unchecked as the language.
+        char *text = nullptr;
+        DWORD n =
+            FormatMessageA(FORMAT_MESSAGE_ALLOCATE_BUFFER | FORMAT_MESSAGE_FROM_HMODULE | FORMAT_MESSAGE_FROM_SYSTEM,
+                           GetModuleHandleW(nullptr), static_cast<DWORD>(dwError), dwLocale,
+                           reinterpret_cast<char *>(&text), 256, nullptr);
+        if (n == 0 || !text)
+            return E_FAIL;
+        int wide = MultiByteToWideChar(CP_ACP, 0, text, -1, nullptr, 0);
+        auto *out = static_cast<wchar_t *>(CoTaskMemAlloc((wide > 0 ? wide : 1) * sizeof(wchar_t)));
+        if (!out) {
+            LocalFree(text);
+            return E_OUTOFMEMORY;
+        }
+        out[0] = L'\0';
+        MultiByteToWideChar(CP_ACP, 0, text, -1, out, wide);
+        LocalFree(text);
+        *ppString = out;
+        return S_OK;
+    });
+}
+
+namespace {
+const LCID kLocales[] = {0x409, LOCALE_SYSTEM_DEFAULT, LOCALE_NEUTRAL};
+} // namespace
+
+STDMETHODIMP COPCServer::SetLocaleID(LCID dwLcid)
+{
+    if (std::find(std::begin(kLocales), std::end(kLocales), dwLcid) == std::end(kLocales))
+        return E_INVALIDARG;
+    CSingleLock lock(&m_lock);
+    m_locale = dwLcid;
+    return S_OK;
+}
+
+STDMETHODIMP COPCServer::GetLocaleID(LCID *pdwLcid)
+{
+    if (!IsWritableOut(pdwLcid))
+        return E_INVALIDARG;
+    *pdwLcid = m_locale;
+    return S_OK;
+}
+
+STDMETHODIMP COPCServer::QueryAvailableLocaleIDs(DWORD *pdwCount, LCID **pdwLcid)
+{
+    if (!IsWritableOut(pdwCount) || !IsWritableOut(pdwLcid))
+        return E_INVALIDARG;
+    TaskMem<LCID> locales;
+    if (!locales.Allocate(std::size(kLocales)))
+        return E_FAIL;
+    std::copy(std::begin(kLocales), std::end(kLocales), locales.Get());
+    *pdwLcid = locales.Detach();
+    *pdwCount = static_cast<DWORD>(std::size(kLocales));
+    return S_OK;
+}
+
+STDMETHODIMP COPCServer::GetErrorString(HRESULT dwError, LPWSTR *ppString)
+{
+    return GetErrorString(dwError, m_locale, ppString);
+}
+
+STDMETHODIMP COPCServer::SetClientName(LPCWSTR szName)
+{
+    return ComBoundary([&]() -> HRESULT {
+        if (!szName)
+            return E_INVALIDARG;
+        CSingleLock lock(&m_lock);
+        try {
+            m_clientName = szName;
+        } catch (const std::bad_alloc &) {
+            return E_FAIL;
+        }
+        return S_OK;
+    });
+}
+
+HRESULT COPCServer::FillSlot(const ComPtr<IUnknown> &sink, DWORD *cookie)
+{
+    CSingleLock lock(&m_sinkLock);
+    if (m_shutdownSink)
+        return CONNECT_E_ADVISELIMIT;
+    m_shutdownSink = sink;
+    *cookie = kShutdownCookie;
+    return S_OK;
+}
+
+HRESULT COPCServer::EmptySlot(DWORD cookie)
+{
+    ComPtr<IUnknown> released; // released after the lock
+    CSingleLock lock(&m_sinkLock);
+    if (cookie != kShutdownCookie || !m_shutdownSink)
+        return CONNECT_E_NOCONNECTION;
+    released = std::move(m_shutdownSink);
+    return S_OK;
+}
+
+ComPtr<IUnknown> COPCServer::SlotSink(DWORD *cookie)
+{
+    CSingleLock lock(&m_sinkLock);
+    *cookie = kShutdownCookie;
+    return m_shutdownSink;
+}
+
+STDMETHODIMP COPCServer::FindConnectionPoint(REFIID riid, IConnectionPoint **ppCP)
+{
+    return FindSingleSinkPoint(this, InnerUnknown(), riid, ppCP);
+}
+
+STDMETHODIMP COPCServer::EnumConnectionPoints(IEnumConnectionPoints **ppEnum)
+{
+    return EnumSingleSinkPoint(this, InnerUnknown(), ppEnum);
 }
 
 STDMETHODIMP COPCServer::GetGroupByName(LPCWSTR szName, REFIID riid, LPUNKNOWN *ppUnk)

@@ -4,7 +4,9 @@
 #include "ComObject.h"
 #include "GroupOwner.h"
 #include "GroupRegistry.h"
+#include "SingleSinkPoint.h"
 #include "SyncObject.h"
+#include "opccomn.h"
 #include "opcda.h"
 
 #include <string>
@@ -13,7 +15,12 @@ class CAsyncIOMgr;
 class COPCGroup;
 class CUpdateScanMgr;
 
-class COPCServer : public CComObjectRoot, public IOPCServer, private CGroupOwner {
+class COPCServer : public CComObjectRoot,
+                   public IOPCServer,
+                   public IOPCCommon,
+                   public IConnectionPointContainer,
+                   private CGroupOwner,
+                   private ISinkSlot {
 public:
     // A server object bound to outer (aggregated) or plain; no references yet.
     static COPCServer *Create(IUnknown *outer);
@@ -33,12 +40,30 @@ public:
     STDMETHODIMP RemoveGroup(OPCHANDLE hServerGroup, BOOL bForce) override;
     STDMETHODIMP CreateGroupEnumerator(OPCENUMSCOPE dwScope, REFIID riid, LPUNKNOWN *ppUnk) override;
 
+    // IOPCCommon
+    STDMETHODIMP SetLocaleID(LCID dwLcid) override;
+    STDMETHODIMP GetLocaleID(LCID *pdwLcid) override;
+    STDMETHODIMP QueryAvailableLocaleIDs(DWORD *pdwCount, LCID **pdwLcid) override;
+    STDMETHODIMP GetErrorString(HRESULT dwError, LPWSTR *ppString) override;
+    STDMETHODIMP SetClientName(LPCWSTR szName) override;
+
+    // IConnectionPointContainer: one point, for IOPCShutdown.
+    STDMETHODIMP EnumConnectionPoints(IEnumConnectionPoints **ppEnum) override;
+    STDMETHODIMP FindConnectionPoint(REFIID riid, IConnectionPoint **ppCP) override;
+
 protected:
     void *FindInterface(REFIID riid) override;
     HRESULT CreateOnQuery(REFIID riid, void **ppv) override;
     void FinalRelease() override;
 
 private:
+    // ISinkSlot: the one IOPCShutdown sink; the server never calls it.
+    const IID &SinkIid() const override { return IID_IOPCShutdown; }
+    HRESULT FillSlot(const ComPtr<IUnknown> &sink, DWORD *cookie) override;
+    HRESULT EmptySlot(DWORD cookie) override;
+    ComPtr<IUnknown> SlotSink(DWORD *cookie) override;
+    static constexpr DWORD kShutdownCookie = 0x5D;
+
     // CGroupOwner
     IOPCServer *OwnerServer() override { return this; }
     CGroupRegistry &Registry() override { return m_registry; }
@@ -67,7 +92,9 @@ private:
     FILETIME m_lastUpdateTime = {};
     DWORD m_groupCount = 0;
     CGroupRegistry m_registry;
-    LCID m_locale = LOCALE_SYSTEM_DEFAULT;
+    volatile LCID m_locale = LOCALE_SYSTEM_DEFAULT;
+    CCriticalSection m_sinkLock; // the framework lock of the shutdown slot
+    ComPtr<IUnknown> m_shutdownSink;
     std::wstring m_clientName;
     bool m_counted = false; // counted among the server objects of the process
     // Calls from groups into this object; innermost lock.

@@ -164,4 +164,12 @@ TEST_F(GroupsE2E, BadInputAcrossTheWireGetsTheDocumentedCodes)
         S_OK);
     unk.Reset();
     EXPECT_EQ(Names(server.Get()), std::vector<std::wstring>{huge});
+
+    // Error texts come from the server executable's message table.
+    LPWSTR text = nullptr;
+    ASSERT_EQ(server->GetErrorString(OPC_S_INUSE, 0x409, &text), S_OK);
+    EXPECT_STREQ(text,
+                 L"The operation cannot be completed because the \r\nobject still has references that exist.\r\n");
+    CoTaskMemFree(text);
+    EXPECT_EQ(server->GetErrorString(static_cast<HRESULT>(0xC004FFFF), 0x409, &text), E_FAIL);
 }
