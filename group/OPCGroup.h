@@ -147,6 +147,18 @@ public:
     HRESULT WritePass(DWORD count, const OPCHANDLE *handles, const VARIANT *values, HRESULT *errors,
                       OPCHANDLE *clientHandles = nullptr);
 
+    // The one-off device read of the item properties, in a temporary group
+    // made for it: the item is made, read from the device (waiting for a
+    // first value) and left for the group's destruction.
+    struct PropertyRead {
+        CVariant value;
+        WORD quality = 0;
+        FILETIME time = {};
+        VARTYPE canonical = VT_EMPTY;
+        DWORD rights = 0;
+    };
+    HRESULT ReadForProperties(const wchar_t *itemId, PropertyRead &out);
+
     // Scanner entries and transactions that refer to the group.
     LONG AddPendingWork();
     LONG ReleasePendingWork();

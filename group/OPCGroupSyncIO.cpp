@@ -101,3 +101,23 @@ STDMETHODIMP COPCGroup::Write(DWORD dwCount, OPCHANDLE *phServer, VARIANT *pItem
         return overall;
     });
 }
+
+HRESULT COPCGroup::ReadForProperties(const wchar_t *itemId, PropertyRead &out)
+{
+    CSingleLock lock(&m_lock);
+    OPCITEMDEF def = {};
+    def.szItemID = const_cast<wchar_t *>(itemId);
+    def.hClient = 100;
+    OPCITEMRESULT result = {};
+    std::unique_ptr<COPCItem> item(new (std::nothrow) COPCItem());
+    if (!item || FAILED(item->Init(this, def, result)))
+        return E_FAIL;
+    COPCItem *raw = item.get();
+    if (!m_items.emplace(raw->ServerHandle(), std::move(item)).second)
+        return E_FAIL;
+    OPCHANDLE client;
+    HRESULT hr = raw->Read(OPC_DS_DEVICE, &client, out.value.Get(), &out.quality, &out.time);
+    out.rights = raw->AccessRights();
+    out.canonical = result.vtCanonicalDataType;
+    return hr;
+}

@@ -41,6 +41,8 @@ void *COPCServer::FindInterface(REFIID riid)
         return static_cast<IOPCServer *>(this);
     if (IsEqualIID(riid, IID_IOPCCommon))
         return static_cast<IOPCCommon *>(this);
+    if (IsEqualIID(riid, IID_IOPCItemProperties))
+        return static_cast<IOPCItemProperties *>(this);
     if (IsEqualIID(riid, IID_IConnectionPointContainer))
         return static_cast<IConnectionPointContainer *>(this);
     return nullptr;

@@ -4,6 +4,7 @@
 #include "ComObject.h"
 #include "GroupOwner.h"
 #include "GroupRegistry.h"
+#include "OPCGroup.h"
 #include "SingleSinkPoint.h"
 #include "SyncObject.h"
 #include "opccomn.h"
@@ -12,12 +13,12 @@
 #include <string>
 
 class CAsyncIOMgr;
-class COPCGroup;
 class CUpdateScanMgr;
 
 class COPCServer : public CComObjectRoot,
                    public IOPCServer,
                    public IOPCCommon,
+                   public IOPCItemProperties,
                    public IConnectionPointContainer,
                    private CGroupOwner,
                    private ISinkSlot {
@@ -47,6 +48,14 @@ public:
     STDMETHODIMP GetErrorString(HRESULT dwError, LPWSTR *ppString) override;
     STDMETHODIMP SetClientName(LPCWSTR szName) override;
 
+    // IOPCItemProperties
+    STDMETHODIMP QueryAvailableProperties(LPWSTR szItemID, DWORD *pdwCount, DWORD **ppPropertyIDs,
+                                          LPWSTR **ppDescriptions, VARTYPE **ppvtDataTypes) override;
+    STDMETHODIMP GetItemProperties(LPWSTR szItemID, DWORD dwCount, DWORD *pdwPropertyIDs, VARIANT **ppvData,
+                                   HRESULT **ppErrors) override;
+    STDMETHODIMP LookupItemIDs(LPWSTR szItemID, DWORD dwCount, DWORD *pdwPropertyIDs, LPWSTR **ppszNewItemIDs,
+                               HRESULT **ppErrors) override;
+
     // IConnectionPointContainer: one point, for IOPCShutdown.
     STDMETHODIMP EnumConnectionPoints(IEnumConnectionPoints **ppEnum) override;
     STDMETHODIMP FindConnectionPoint(REFIID riid, IConnectionPoint **ppCP) override;
@@ -57,6 +66,8 @@ protected:
     void FinalRelease() override;
 
 private:
+    HRESULT PropertyDeviceRead(const wchar_t *itemId, COPCGroup::PropertyRead &out);
+
     // ISinkSlot: the one IOPCShutdown sink; the server never calls it.
     const IID &SinkIid() const override { return IID_IOPCShutdown; }
     HRESULT FillSlot(const ComPtr<IUnknown> &sink, DWORD *cookie) override;
