@@ -20,13 +20,13 @@ HRESULT CRead2Transaction::Execute()
     return m_group->ExecuteRead2(m_request, m_handles);
 }
 
-CWrite2Transaction::~CWrite2Transaction()
+CWriteValues::~CWriteValues()
 {
     for (VARIANT &v : m_values)
         VariantClear(&v);
 }
 
-HRESULT CWrite2Transaction::Add(OPCHANDLE handle, const VARIANT &value)
+HRESULT CWriteValues::Add(OPCHANDLE handle, const VARIANT &value)
 {
     m_values.emplace_back();
     VariantInit(&m_values.back());
@@ -52,25 +52,6 @@ HRESULT CRefresh2Transaction::Execute()
 HRESULT CReadTransaction::Execute()
 {
     return m_group->ExecuteRead(m_request, m_id, m_source, m_handles);
-}
-
-CWriteTransaction::~CWriteTransaction()
-{
-    for (VARIANT &v : m_values)
-        VariantClear(&v);
-}
-
-HRESULT CWriteTransaction::Add(OPCHANDLE handle, const VARIANT &value)
-{
-    m_values.emplace_back();
-    VariantInit(&m_values.back());
-    HRESULT hr = VariantCopy(&m_values.back(), const_cast<VARIANT *>(&value));
-    if (FAILED(hr)) {
-        m_values.pop_back();
-        return hr;
-    }
-    m_handles.push_back(handle);
-    return S_OK;
 }
 
 HRESULT CWriteTransaction::Execute()

@@ -28,6 +28,21 @@ protected:
     DWORD m_request; // 2.0: the client's transaction id; 1.0: the advise connection
 };
 
+// Owned copies of the handles and values of a write request.
+class CWriteValues {
+public:
+    CWriteValues() = default;
+    ~CWriteValues();
+    CWriteValues(const CWriteValues &) = delete;
+    CWriteValues &operator=(const CWriteValues &) = delete;
+    // Copies one value (VariantCopy); its failure is returned.
+    HRESULT Add(OPCHANDLE handle, const VARIANT &value);
+
+protected:
+    std::vector<OPCHANDLE> m_handles;
+    std::vector<VARIANT> m_values;
+};
+
 // Version 2.0 requests (IOPCAsyncIO2); completions go to IOPCDataCallback.
 class CAsync2Transaction : public CTransaction {
 protected:
@@ -46,17 +61,10 @@ private:
     std::vector<OPCHANDLE> m_handles;
 };
 
-class CWrite2Transaction : public CAsync2Transaction {
+class CWrite2Transaction : public CAsync2Transaction, public CWriteValues {
 public:
     CWrite2Transaction(DWORD id, COPCGroup *group, DWORD clientId) : CAsync2Transaction(id, group, clientId) {}
-    ~CWrite2Transaction() override;
-    // Copies one value (VariantCopy); its failure is returned.
-    HRESULT Add(OPCHANDLE handle, const VARIANT &value);
     HRESULT Execute() override;
-
-private:
-    std::vector<OPCHANDLE> m_handles;
-    std::vector<VARIANT> m_values;
 };
 
 class CRefresh2Transaction : public CAsync2Transaction {
@@ -91,16 +99,10 @@ private:
     std::vector<OPCHANDLE> m_handles;
 };
 
-class CWriteTransaction : public CAsyncTransaction {
+class CWriteTransaction : public CAsyncTransaction, public CWriteValues {
 public:
     CWriteTransaction(DWORD id, COPCGroup *group, DWORD connection) : CAsyncTransaction(id, group, connection) {}
-    ~CWriteTransaction() override;
-    HRESULT Add(OPCHANDLE handle, const VARIANT &value);
     HRESULT Execute() override;
-
-private:
-    std::vector<OPCHANDLE> m_handles;
-    std::vector<VARIANT> m_values;
 };
 
 class CRefreshTransaction : public CAsyncTransaction {

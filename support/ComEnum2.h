@@ -11,22 +11,6 @@
 
 #include <vector>
 
-struct EnumCopyUnknown {
-    using Item = IUnknown *;
-    static bool Copy(Item &to, Item from)
-    {
-        to = from;
-        if (from)
-            from->AddRef();
-        return true;
-    }
-    static void Destroy(Item item)
-    {
-        if (item)
-            item->Release();
-    }
-};
-
 // Interface pointers of type I (AddRef'd copies).
 template <class I> struct EnumCopyInterface {
     using Item = I *;
@@ -43,6 +27,8 @@ template <class I> struct EnumCopyInterface {
             item->Release();
     }
 };
+
+using EnumCopyUnknown = EnumCopyInterface<IUnknown>;
 
 struct EnumCopyConnection {
     using Item = CONNECTDATA;
