@@ -78,7 +78,7 @@ int PrintGroups(IOPCServer *server)
     return 0;
 }
 
-struct GroupSpec {
+struct NewGroup {
     const wchar_t *name;
     DWORD rate;
     BOOL active;
@@ -96,16 +96,16 @@ int main()
         if (FAILED(hr)) {
             rc = Fail("creating Tarnwell.SkylarcOPCServer", hr);
         } else {
-            const GroupSpec specs[] = {{L"Fast", 100, TRUE}, {L"Slow", 5000, FALSE}, {L"", 1, TRUE}};
-            for (const GroupSpec &spec : specs) {
+            const NewGroup groups[] = {{L"Fast", 100, TRUE}, {L"Slow", 5000, FALSE}, {L"", 1, TRUE}};
+            for (const NewGroup &wanted : groups) {
                 OPCHANDLE handle = 0;
                 DWORD revised = 0;
                 ComPtr<IUnknown> group;
-                hr = server->AddGroup(spec.name, spec.active, spec.rate, 0, nullptr, nullptr, 0, &handle, &revised,
-                                      IID_IOPCGroupStateMgt, group.Out());
-                printf("AddGroup %-8ls -> 0x%08lX, handle %lu, rate %lu ms\n", *spec.name ? spec.name : L"(generated)",
-                       static_cast<unsigned long>(hr), static_cast<unsigned long>(handle),
-                       static_cast<unsigned long>(revised));
+                hr = server->AddGroup(wanted.name, wanted.active, wanted.rate, 0, nullptr, nullptr, 0, &handle,
+                                      &revised, IID_IOPCGroupStateMgt, group.Out());
+                printf("AddGroup %-8ls -> 0x%08lX, handle %lu, rate %lu ms\n",
+                       *wanted.name ? wanted.name : L"(generated)", static_cast<unsigned long>(hr),
+                       static_cast<unsigned long>(handle), static_cast<unsigned long>(revised));
             }
             rc = PrintStatus(server.Get());
             if (rc == 0)
