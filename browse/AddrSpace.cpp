@@ -1,5 +1,6 @@
 #include "AddrSpace.h"
 
+#include "CodePage.h"
 #include "OpcErrors.h"
 #include "Trace.h"
 #include "ValueConversion.h"
@@ -41,15 +42,6 @@ struct NoCaseStringLess {
     }
 };
 
-std::wstring FromCodePage(const std::string &text)
-{
-    int n = MultiByteToWideChar(CP_ACP, 0, text.c_str(), -1, nullptr, 0);
-    std::wstring out(n > 0 ? n - 1 : 0, L'\0');
-    if (n > 1)
-        MultiByteToWideChar(CP_ACP, 0, text.c_str(), -1, out.data(), n);
-    return out;
-}
-
 // The host name in 8-bit text. Through ICU's default converter when ICU is
 // there; without ICU the system code page does it (with "?" for what it
 // lacks), so that the server still builds its address space.
@@ -62,11 +54,7 @@ std::string HostNameAnsi()
     try {
         return tw::hmx::osdep::WideToAnsi(name.c_str(), "").get();
     } catch (const tw::hmx::exception::Exception &) {
-        int n = WideCharToMultiByte(CP_ACP, 0, name.c_str(), -1, nullptr, 0, "?", nullptr);
-        std::string out(n > 0 ? n - 1 : 0, '\0');
-        if (n > 1)
-            WideCharToMultiByte(CP_ACP, 0, name.c_str(), -1, out.data(), n, "?", nullptr);
-        return out;
+        return ToCodePage(name, "?");
     }
 }
 

@@ -1,5 +1,6 @@
 #include "OPCCadroBrowser.h"
 
+#include "OPCCadroClient.h"
 #include "SyncObject.h"
 #include "Trace.h"
 
@@ -36,13 +37,10 @@ HRESULT OPCCadroBrowser::Open(const wchar_t *url)
     // No session (the factory failed): nothing can be browsed.
     if (!m_browser || !url)
         return E_FAIL;
-    if (wcsncmp(url, L"\\\\.\\", 4) != 0 && wcscmp(url, L"\\\\.") != 0)
-        return m_browser->Open(url);
-    BSTR host = nullptr;
-    GetHostMachineName(&host);
-    std::wstring expanded = L"\\\\" + std::wstring(host ? host : L"") + (url + 3);
-    SysFreeString(host);
-    return m_browser->Open(expanded.c_str());
+    wchar_t *expanded = ExpandLocalMachine(url, true);
+    HRESULT hr = m_browser->Open(expanded ? expanded : url);
+    cdd_free(expanded);
+    return hr;
 }
 
 HRESULT OPCCadroBrowser::Next(uint32_t fieldMask, BrowseRecord *record)

@@ -1,6 +1,6 @@
 #include "PatternMatch.h"
 
-#include <windows.h>
+#include "CodePage.h"
 
 namespace {
 enum class Step { Match, NoMatch, Malformed };
@@ -98,17 +98,6 @@ bool MatchPattern(const std::string &name, const std::string &pattern)
         ++p;
     return p == pattern.size();
 }
-
-namespace {
-std::string ToCodePage(const std::wstring &text)
-{
-    int n = WideCharToMultiByte(CP_ACP, 0, text.c_str(), -1, nullptr, 0, nullptr, nullptr);
-    std::string out(n > 0 ? n - 1 : 0, '\0');
-    if (n > 1)
-        WideCharToMultiByte(CP_ACP, 0, text.c_str(), -1, out.data(), n, nullptr, nullptr);
-    return out;
-}
-} // namespace
 
 bool MatchPattern(const std::wstring &name, const std::wstring &pattern)
 {

@@ -128,7 +128,7 @@ bool Network::ParseUrl(const std::wstring &url, Path &path)
     return true;
 }
 
-std::shared_ptr<Member> Network::FindMember(const std::wstring &url)
+Object *Network::FindMemberSlot(const std::wstring &url, std::vector<std::shared_ptr<Member>>::iterator &at)
 {
     Path path;
     if (!ParseUrl(url, path) || !path.process || path.objects.empty())
@@ -136,11 +136,16 @@ std::shared_ptr<Member> Network::FindMember(const std::wstring &url)
     Object *object = FindObject(*path.process, path.objects, path.objects.size());
     if (!object)
         return nullptr;
-    const std::wstring &id = path.hasMember ? path.member : std::wstring();
-    for (auto &m : object->members)
-        if (m->idPart == id)
-            return m;
-    return nullptr;
+    // An object's own URL names its "(implicit)" member, whose part is empty.
+    const std::wstring id = path.hasMember ? path.member : std::wstring();
+    at = std::find_if(object->members.begin(), object->members.end(), [&](auto &m) { return m->idPart == id; });
+    return at == object->members.end() ? nullptr : object;
+}
+
+std::shared_ptr<Member> Network::FindMember(const std::wstring &url)
+{
+    std::vector<std::shared_ptr<Member>>::iterator at;
+    return FindMemberSlot(url, at) ? *at : nullptr;
 }
 
 bool Network::List(const std::wstring &url, std::vector<BrowseEntry> &out)
@@ -228,18 +233,12 @@ bool Network::AddMember(const std::wstring &objectUrl, std::shared_ptr<Member> m
 
 std::shared_ptr<Member> Network::RemoveMember(const std::wstring &url)
 {
-    Path path;
-    if (!ParseUrl(url, path) || !path.process || path.objects.empty())
-        return nullptr;
-    Object *object = FindObject(*path.process, path.objects, path.objects.size());
+    std::vector<std::shared_ptr<Member>>::iterator at;
+    Object *object = FindMemberSlot(url, at);
     if (!object)
         return nullptr;
-    const std::wstring id = path.hasMember ? path.member : std::wstring();
-    auto it = std::find_if(object->members.begin(), object->members.end(), [&](auto &m) { return m->idPart == id; });
-    if (it == object->members.end())
-        return nullptr;
-    std::shared_ptr<Member> removed = *it;
-    object->members.erase(it);
+    std::shared_ptr<Member> removed = *at;
+    object->members.erase(at);
     return removed;
 }
 

@@ -128,6 +128,8 @@ private:
     };
     bool ParseUrl(const std::wstring &url, Path &path);
     Object *FindObject(Process &process, const std::vector<std::wstring> &names, size_t count);
+    // The object holding the member a URL names, with the member's position.
+    Object *FindMemberSlot(const std::wstring &url, std::vector<std::shared_ptr<Member>>::iterator &at);
 
     std::wstring m_host;
     std::vector<std::unique_ptr<Machine>> m_machines;

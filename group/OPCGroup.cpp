@@ -75,12 +75,6 @@ std::wstring COPCGroup::Name()
     return m_name;
 }
 
-bool COPCGroup::IsActive()
-{
-    CSingleLock lock(&m_lock);
-    return m_active != FALSE;
-}
-
 void COPCGroup::UpdateIdle()
 {
     // Idle: no scan or transaction queued or running, but for the ones that
@@ -135,7 +129,6 @@ void COPCGroup::BeginRemoval()
 
 void COPCGroup::Destroy()
 {
-    ComPtr<IOPCDataCallback> sink; // released after the lock
     CSingleLock lock(&m_lock);
     if (m_destroyed)
         return;
@@ -147,7 +140,9 @@ void COPCGroup::Destroy()
     if (!m_idle.Reset())
         INTERNAL_ASSERT_FAILED("CloseHandle for the group's idle event");
     m_owner = nullptr;
-    sink = std::move(m_callback);
+    lock.Unlock();
+    // The clients' sinks are released without the group lock.
+    m_callback.Clear();
     m_dataAdvise.RemoveAll();
     m_dataTimeAdvise.RemoveAll();
     m_writeAdvise.RemoveAll();

@@ -29,8 +29,7 @@ class COPCGroup : public CComObjectRoot,
                   public IOPCAsyncIO2,
                   public IDataObject,
                   public IConnectionPointContainer,
-                  private CItemOwner,
-                  private ISinkSlot {
+                  private CItemOwner {
 public:
     // A group with a fresh server handle and no references; null when out of
     // memory or when no identifier is left.
@@ -130,7 +129,6 @@ public:
     void SetOwner(CGroupOwner *owner);
     OPCHANDLE ServerHandle() const { return m_serverHandle; }
     std::wstring Name();
-    bool IsActive();
 
     // The read and write passes of synchronous I/O, also run by the
     // asynchronous transactions. Per item: client handle, value, quality,
@@ -176,22 +174,31 @@ protected:
     void FinalRelease() override;
 
 private:
-    // ISinkSlot: the one IOPCDataCallback sink.
-    const IID &SinkIid() const override { return IID_IOPCDataCallback; }
-    HRESULT FillSlot(const ComPtr<IUnknown> &sink, DWORD *cookie) override;
-    HRESULT EmptySlot(DWORD cookie) override;
-    ComPtr<IUnknown> SlotSink(DWORD *cookie) override;
-
     // CItemOwner
     CSyncObject &GroupLock() override { return m_lock; }
     ActiveItemList &ActiveItems() override { return m_activeItems; }
     bool GroupActive() const override { return m_active != FALSE; }
 
     COPCItem *FindItem(OPCHANDLE handle);
+    // The indices of the handles that name items; OPC_E_INVALIDHANDLE for the others.
+    std::vector<DWORD> ValidHandles(DWORD count, const OPCHANDLE *handles, HRESULT *errors);
     // IOPCDataCallback calls in flight: removal does not wait for them, so
     // that a client may remove the group from inside its own callback.
     void BeginCallback();
     void EndCallback();
+    struct CallbackInFlight {
+        explicit CallbackInFlight(COPCGroup &g) : group(g) { group.BeginCallback(); }
+        ~CallbackInFlight() { group.EndCallback(); }
+        COPCGroup &group;
+    };
+    // Reads the handles and sends the results through one of the two
+    // callbacks that carry values; the lock (held on entry) is released for
+    // the call.
+    using ReadCallback = HRESULT (STDMETHODCALLTYPE IOPCDataCallback::*)(DWORD, OPCHANDLE, HRESULT, HRESULT, DWORD,
+                                                                         OPCHANDLE *, VARIANT *, WORD *, FILETIME *,
+                                                                         HRESULT *);
+    HRESULT SendReadResults(CSingleLock &lock, DWORD clientId, OPCDATASOURCE source,
+                            const std::vector<OPCHANDLE> &handles, ReadCallback callback);
     void UpdateIdle();
     // Reads the active items (list order) for a refresh.
     std::vector<OPCHANDLE> ActiveHandles();
@@ -219,7 +226,7 @@ private:
     CGroupOwner *m_owner = nullptr;
     std::map<OPCHANDLE, std::unique_ptr<COPCItem>> m_items;
     ActiveItemList m_activeItems;
-    ComPtr<IOPCDataCallback> m_callback;
+    CSinkSlot m_callback{IID_IOPCDataCallback, kCallbackCookie}; // the one IOPCDataCallback sink
     CAdvisoryConnectionMgr m_dataAdvise;
     CAdvisoryConnectionMgr m_dataTimeAdvise;
     CAdvisoryConnectionMgr m_writeAdvise;

@@ -51,60 +51,18 @@ struct Delivery {
     }
 };
 
-// Runs a callback counted as in flight, so that a removal made from inside
-// it does not wait for it.
-class CallbackScope {
-public:
-    explicit CallbackScope(COPCGroup &group, void (COPCGroup::*begin)(), void (COPCGroup::*end)())
-        : m_group(group), m_end(end)
-    {
-        (group.*begin)();
-    }
-    ~CallbackScope() { (m_group.*m_end)(); }
-
-private:
-    COPCGroup &m_group;
-    void (COPCGroup::*m_end)();
-};
 } // namespace
 
 // ---- Connection point ------------------------------------------------
 
-HRESULT COPCGroup::FillSlot(const ComPtr<IUnknown> &sink, DWORD *cookie)
-{
-    CSingleLock lock(&m_lock);
-    if (m_callback)
-        return CONNECT_E_ADVISELIMIT;
-    m_callback = ComPtr<IOPCDataCallback>(static_cast<IOPCDataCallback *>(sink.Get()));
-    *cookie = kCallbackCookie;
-    return S_OK;
-}
-
-HRESULT COPCGroup::EmptySlot(DWORD cookie)
-{
-    ComPtr<IOPCDataCallback> released; // released after the lock
-    CSingleLock lock(&m_lock);
-    if (cookie != kCallbackCookie || !m_callback)
-        return CONNECT_E_NOCONNECTION;
-    released = std::move(m_callback);
-    return S_OK;
-}
-
-ComPtr<IUnknown> COPCGroup::SlotSink(DWORD *cookie)
-{
-    CSingleLock lock(&m_lock);
-    *cookie = kCallbackCookie;
-    return ComPtr<IUnknown>(m_callback.Get());
-}
-
 STDMETHODIMP COPCGroup::FindConnectionPoint(REFIID riid, IConnectionPoint **ppCP)
 {
-    return FindSingleSinkPoint(this, InnerUnknown(), riid, ppCP);
+    return FindSingleSinkPoint(&m_callback, InnerUnknown(), riid, ppCP);
 }
 
 STDMETHODIMP COPCGroup::EnumConnectionPoints(IEnumConnectionPoints **ppEnum)
 {
-    return EnumSingleSinkPoint(this, InnerUnknown(), ppEnum);
+    return EnumSingleSinkPoint(&m_callback, InnerUnknown(), ppEnum);
 }
 
 // ---- IOPCAsyncIO2 ----------------------------------------------------
@@ -139,7 +97,7 @@ template <class Check> HRESULT COPCGroup::CheckItems(DWORD count, const OPCHANDL
     *ppErrors = nullptr;
     if (!IsReadableArray(handles, count))
         return E_INVALIDARG;
-    if (!m_callback)
+    if (!m_callback.IsFilled())
         return CONNECT_E_NOCONNECTION;
     if (!errors.Allocate(count))
         return E_OUTOFMEMORY;
@@ -198,11 +156,9 @@ STDMETHODIMP COPCGroup::Write(DWORD dwCount, OPCHANDLE *phServer, VARIANT *pItem
         if (!passed.empty()) {
             DWORD id = CIdMgr::Instance().GetId();
             auto t = std::make_unique<CWrite2Transaction>(id, this, dwTransactionID);
-            for (DWORD i : passed) {
-                hr = t->Add(phServer[i], pItemValues[i]);
-                if (FAILED(hr))
-                    return hr; // the error array is freed with its holder
-            }
+            hr = t->Add(phServer, pItemValues, passed);
+            if (FAILED(hr))
+                return hr; // the error array is freed with its holder
             hr = QueueTransaction(std::move(t));
             if (FAILED(hr))
                 return hr;
@@ -222,7 +178,7 @@ STDMETHODIMP COPCGroup::Refresh2(OPCDATASOURCE dwSource, DWORD dwTransactionID, 
         if (!IsWritableOut(pdwCancelID))
             return E_INVALIDARG;
         *pdwCancelID = 0;
-        if (!m_callback)
+        if (!m_callback.IsFilled())
             return CONNECT_E_NOCONNECTION;
         if (dwSource != OPC_DS_CACHE && dwSource != OPC_DS_DEVICE)
             return E_INVALIDARG;
@@ -257,7 +213,7 @@ STDMETHODIMP COPCGroup::SetEnable(BOOL bEnable)
     CSingleLock lock(&m_lock);
     if (m_removing)
         return E_FAIL;
-    if (!m_callback)
+    if (!m_callback.IsFilled())
         return CONNECT_E_NOCONNECTION;
     m_enable = bEnable;
     return S_OK;
@@ -269,27 +225,33 @@ STDMETHODIMP COPCGroup::GetEnable(BOOL *pbEnable)
     if (!IsWritableOut(pbEnable) || m_removing)
         return E_FAIL;
     *pbEnable = m_enable;
-    return m_callback ? S_OK : CONNECT_E_NOCONNECTION;
+    return m_callback.IsFilled() ? S_OK : CONNECT_E_NOCONNECTION;
 }
 
 // ---- Transactions ----------------------------------------------------
 
-HRESULT COPCGroup::ExecuteRead2(DWORD clientId, const std::vector<OPCHANDLE> &handles)
+HRESULT COPCGroup::SendReadResults(CSingleLock &lock, DWORD clientId, OPCDATASOURCE source,
+                                   const std::vector<OPCHANDLE> &handles, ReadCallback callback)
 {
-    CSingleLock lock(&m_lock);
     std::vector<ReadResult> results;
-    HRESULT overall = ReadPass(OPC_DS_DEVICE, static_cast<DWORD>(handles.size()), handles.data(), results);
+    HRESULT overall = ReadPass(source, static_cast<DWORD>(handles.size()), handles.data(), results);
     Delivery d(results.size());
     d.From(results);
-    ComPtr<IOPCDataCallback> sink = m_callback;
+    ComPtr<IOPCDataCallback> sink = m_callback.Sink<IOPCDataCallback>();
     if (!sink)
         return E_FAIL;
     OPCHANDLE hGroup = m_clientHandle;
-    CallbackScope scope(*this, &COPCGroup::BeginCallback, &COPCGroup::EndCallback);
+    CallbackInFlight inFlight(*this);
     lock.Unlock();
     DWORD n = static_cast<DWORD>(results.size());
-    return sink->OnReadComplete(clientId, hGroup, d.MasterQuality(n), overall, n, d.clients.data(), d.values.data(),
-                                d.qualities.data(), d.times.data(), d.errors.data());
+    return (sink.Get()->*callback)(clientId, hGroup, d.MasterQuality(n), overall, n, d.clients.data(), d.values.data(),
+                                   d.qualities.data(), d.times.data(), d.errors.data());
+}
+
+HRESULT COPCGroup::ExecuteRead2(DWORD clientId, const std::vector<OPCHANDLE> &handles)
+{
+    CSingleLock lock(&m_lock);
+    return SendReadResults(lock, clientId, OPC_DS_DEVICE, handles, &IOPCDataCallback::OnReadComplete);
 }
 
 HRESULT COPCGroup::ExecuteWrite2(DWORD clientId, const std::vector<OPCHANDLE> &handles,
@@ -300,11 +262,11 @@ HRESULT COPCGroup::ExecuteWrite2(DWORD clientId, const std::vector<OPCHANDLE> &h
     std::vector<HRESULT> errors(n);
     std::vector<OPCHANDLE> clients(n, 0xFFFFFFFF);
     HRESULT overall = WritePass(n, handles.data(), values.data(), errors.data(), clients.data());
-    ComPtr<IOPCDataCallback> sink = m_callback;
+    ComPtr<IOPCDataCallback> sink = m_callback.Sink<IOPCDataCallback>();
     if (!sink)
         return E_FAIL;
     OPCHANDLE hGroup = m_clientHandle;
-    CallbackScope scope(*this, &COPCGroup::BeginCallback, &COPCGroup::EndCallback);
+    CallbackInFlight inFlight(*this);
     lock.Unlock();
     return sink->OnWriteComplete(clientId, hGroup, overall, n, clients.data(), errors.data());
 }
@@ -314,20 +276,7 @@ HRESULT COPCGroup::ExecuteRefresh2(DWORD clientId, OPCDATASOURCE source)
     CSingleLock lock(&m_lock);
     if (!m_active)
         return S_OK; // made inactive meanwhile: nothing is sent
-    std::vector<OPCHANDLE> handles = ActiveHandles();
-    std::vector<ReadResult> results;
-    HRESULT overall = ReadPass(source, static_cast<DWORD>(handles.size()), handles.data(), results);
-    Delivery d(results.size());
-    d.From(results);
-    ComPtr<IOPCDataCallback> sink = m_callback;
-    if (!sink)
-        return E_FAIL;
-    OPCHANDLE hGroup = m_clientHandle;
-    CallbackScope scope(*this, &COPCGroup::BeginCallback, &COPCGroup::EndCallback);
-    lock.Unlock();
-    DWORD n = static_cast<DWORD>(results.size());
-    return sink->OnDataChange(clientId, hGroup, d.MasterQuality(n), overall, n, d.clients.data(), d.values.data(),
-                              d.qualities.data(), d.times.data(), d.errors.data());
+    return SendReadResults(lock, clientId, source, ActiveHandles(), &IOPCDataCallback::OnDataChange);
 }
 
 // ---- The update scan -------------------------------------------------
@@ -372,7 +321,7 @@ BOOL COPCGroup::Scan(LONGLONG &next)
         return TRUE; // nothing changed: nothing is sent
 
     HRESULT callbackResult = S_FALSE;
-    ComPtr<IOPCDataCallback> sink = m_enable ? m_callback : ComPtr<IOPCDataCallback>();
+    ComPtr<IOPCDataCallback> sink = m_enable ? m_callback.Sink<IOPCDataCallback>() : nullptr;
     if (sink) {
         HRESULT masterError = S_OK;
         for (size_t i = 0; i < n; ++i) {
@@ -382,7 +331,7 @@ BOOL COPCGroup::Scan(LONGLONG &next)
             }
         }
         OPCHANDLE hGroup = m_clientHandle;
-        CallbackScope scope(*this, &COPCGroup::BeginCallback, &COPCGroup::EndCallback);
+        CallbackInFlight inFlight(*this);
         lock.Unlock();
         callbackResult =
             sink->OnDataChange(0, hGroup, d.MasterQuality(n), masterError, static_cast<DWORD>(n), d.clients.data(),

@@ -136,6 +136,18 @@ HRESULT COPCGroup::ExecuteRefresh(DWORD connection, DWORD id, OPCDATASOURCE sour
 
 // ---- IOPCAsyncIO -----------------------------------------------------
 
+std::vector<DWORD> COPCGroup::ValidHandles(DWORD count, const OPCHANDLE *handles, HRESULT *errors)
+{
+    // Version 1.0 tests only that the items exist; rights show in completions.
+    std::vector<DWORD> valid;
+    for (DWORD i = 0; i < count; ++i) {
+        errors[i] = FindItem(handles[i]) ? S_OK : OPC_E_INVALIDHANDLE;
+        if (errors[i] == S_OK)
+            valid.push_back(i);
+    }
+    return valid;
+}
+
 STDMETHODIMP COPCGroup::Read(DWORD dwConnection, OPCDATASOURCE dwSource, DWORD dwCount, OPCHANDLE *phServer,
                              DWORD *pTransactionID, HRESULT **ppErrors)
 {
@@ -156,11 +168,8 @@ STDMETHODIMP COPCGroup::Read(DWORD dwConnection, OPCDATASOURCE dwSource, DWORD d
         TaskMem<HRESULT> errors;
         if (!errors.Allocate(dwCount))
             return E_OUTOFMEMORY;
-        bool allValid = true;
-        for (DWORD i = 0; i < dwCount; ++i) {
-            errors[i] = FindItem(phServer[i]) ? S_OK : OPC_E_INVALIDHANDLE;
-            allValid &= errors[i] == S_OK;
-        }
+        std::vector<DWORD> valid = ValidHandles(dwCount, phServer, errors.Get());
+        bool allValid = valid.size() == dwCount;
         if (allValid) {
             DWORD id = CIdMgr::Instance().GetId();
             HRESULT hr = QueueTransaction(std::make_unique<CReadTransaction>(
@@ -192,20 +201,14 @@ STDMETHODIMP COPCGroup::Write(DWORD dwConnection, DWORD dwCount, OPCHANDLE *phSe
         TaskMem<HRESULT> errors;
         if (!errors.Allocate(dwCount))
             return E_OUTOFMEMORY;
-        bool allValid = true;
-        for (DWORD i = 0; i < dwCount; ++i) {
-            errors[i] = FindItem(phServer[i]) ? S_OK : OPC_E_INVALIDHANDLE;
-            allValid &= errors[i] == S_OK;
-        }
+        std::vector<DWORD> valid = ValidHandles(dwCount, phServer, errors.Get());
+        bool allValid = valid.size() == dwCount;
         if (allValid) {
             DWORD id = CIdMgr::Instance().GetId();
             auto t = std::make_unique<CWriteTransaction>(id, this, dwConnection);
-            for (DWORD i = 0; i < dwCount; ++i) {
-                HRESULT hr = t->Add(phServer[i], pItemValues[i]);
-                if (FAILED(hr))
-                    return hr;
-            }
-            HRESULT hr = QueueTransaction(std::move(t));
+            HRESULT hr = t->Add(phServer, pItemValues, valid);
+            if (SUCCEEDED(hr))
+                hr = QueueTransaction(std::move(t));
             if (FAILED(hr))
                 return hr;
             *pTransactionID = id;

@@ -26,16 +26,20 @@ CWriteValues::~CWriteValues()
         VariantClear(&v);
 }
 
-HRESULT CWriteValues::Add(OPCHANDLE handle, const VARIANT &value)
+HRESULT CWriteValues::Add(const OPCHANDLE *handles, const VARIANT *values, const std::vector<DWORD> &which)
 {
-    m_values.emplace_back();
-    VariantInit(&m_values.back());
-    HRESULT hr = VariantCopy(&m_values.back(), const_cast<VARIANT *>(&value));
-    if (FAILED(hr)) {
-        m_values.pop_back();
-        return hr;
+    m_handles.reserve(which.size());
+    m_values.reserve(which.size());
+    for (DWORD i : which) {
+        m_values.emplace_back();
+        VariantInit(&m_values.back());
+        HRESULT hr = VariantCopy(&m_values.back(), const_cast<VARIANT *>(&values[i]));
+        if (FAILED(hr)) {
+            m_values.pop_back();
+            return hr;
+        }
+        m_handles.push_back(handles[i]);
     }
-    m_handles.push_back(handle);
     return S_OK;
 }
 

@@ -35,8 +35,9 @@ public:
     ~CWriteValues();
     CWriteValues(const CWriteValues &) = delete;
     CWriteValues &operator=(const CWriteValues &) = delete;
-    // Copies one value (VariantCopy); its failure is returned.
-    HRESULT Add(OPCHANDLE handle, const VARIANT &value);
+    // Copies the handles and values at the indices which (VariantCopy); the
+    // first failure is returned.
+    HRESULT Add(const OPCHANDLE *handles, const VARIANT *values, const std::vector<DWORD> &which);
 
 protected:
     std::vector<OPCHANDLE> m_handles;

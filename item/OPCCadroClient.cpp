@@ -39,9 +39,9 @@ void OPCCadroClient::Shutdown()
     }
 }
 
-wchar_t *ExpandLocalMachine(const wchar_t *url)
+wchar_t *ExpandLocalMachine(const wchar_t *url, bool bareDot)
 {
-    if (wcsncmp(url, L"\\\\.\\", 4) != 0)
+    if (wcsncmp(url, L"\\\\.\\", 4) != 0 && !(bareDot && wcscmp(url, L"\\\\.") == 0))
         return nullptr;
     BSTR host = nullptr;
     GetHostMachineName(&host);

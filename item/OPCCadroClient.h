@@ -36,7 +36,8 @@ private:
     CadroRealTime *m_realTime = nullptr;
 };
 
-// Expands a leading "\\.\" into "\\<host>\"; other identifiers are unchanged.
-// Storage of the expansion comes from cdd_malloc (freed by the caller with
-// cdd_free); null when nothing is expanded.
-wchar_t *ExpandLocalMachine(const wchar_t *url);
+// Expands a leading "\\.\" into "\\<host>\" (and, with bareDot, "\\." alone
+// into "\\<host>"); other identifiers are unchanged. Storage of the expansion
+// comes from cdd_malloc (freed by the caller with cdd_free); null when
+// nothing is expanded.
+wchar_t *ExpandLocalMachine(const wchar_t *url, bool bareDot = false);

@@ -245,21 +245,18 @@ HRESULT COPCItem::CheckChanged(double, OPCHANDLE *client, VARIANT *value, WORD *
     CSingleLock lock(&m_lock);
     *client = m_clientHandle;
     *changed = false;
-    bool readable = (m_accessRights & OPC_READABLE) != 0;
-    CVariant copy;
-    if (readable)
-        CopyVariant(copy.Get(), m_deviceValue.Value());
     *quality = m_deviceQuality;
     *time = m_deviceTime;
-    if (!readable)
+    if (!(m_accessRights & OPC_READABLE))
         return OPC_E_BADRIGHTS;
     // Time stamps are not compared; the deadband has no effect without
-    // engineering units.
+    // engineering units. The value is copied only when it is reported: the
+    // scan asks every active item at every period.
     if (m_deviceQuality == m_lastQuality && VariantEquals(m_deviceValue.Value(), m_lastValue.Value()))
         return S_OK;
     *changed = true;
     CopyDeviceToLastReported();
-    MoveVariant(value, copy.Get());
+    CopyVariant(value, m_deviceValue.Value());
     return ToRequestedType(value);
 }
 

@@ -1,5 +1,7 @@
 #include "ValueConversion.h"
 
+#include "CodePage.h"
+
 #include <cstring>
 #include <string>
 
@@ -74,11 +76,7 @@ bool NarrowChars(IUnknown *text, std::wstring &out)
     ICadroNarrowText *narrow = nullptr;
     if (FAILED(text->QueryInterface(__uuidof(ICadroNarrowText), reinterpret_cast<void **>(&narrow))))
         return false;
-    const char *chars = narrow->Chars();
-    int n = MultiByteToWideChar(CP_ACP, 0, chars, -1, nullptr, 0);
-    out.assign(n > 0 ? n - 1 : 0, L'\0');
-    if (n > 1)
-        MultiByteToWideChar(CP_ACP, 0, chars, -1, out.data(), n);
+    out = FromCodePage(narrow->Chars());
     narrow->Release();
     return true;
 }

@@ -1,6 +1,7 @@
 #include "OPCServer.h"
 
 #include "AsyncIOMgr.h"
+#include "CodePage.h"
 #include "ComEnum2.h"
 #include "ComPtr.h"
 #include "ComUtil.h"
@@ -103,6 +104,7 @@ void COPCServer::FinalRelease()
     }
     if (m_counted)
         ServerServices::ServerReleased();
+    m_shutdownSink.Clear(); // a sink still advised goes with the server (no lock held)
     CSingleLock registryLock(&m_registry.Lock());
     // No client can reach the object any more: every group goes, by force.
     for (OPCHANDLE handle : m_registry.Handles())
@@ -115,7 +117,6 @@ void COPCServer::FinalRelease()
         CAsyncIOMgr::ReleaseInstance();
         m_asyncMgr = nullptr;
     }
-    m_shutdownSink.Reset(); // a sink still advised goes with the server
 }
 
 STDMETHODIMP COPCServer::AddGroup(LPCWSTR szName, BOOL bActive, DWORD dwRequestedUpdateRate, OPCHANDLE hClientGroup,
@@ -214,17 +215,10 @@ STDMETHODIMP COPCServer::GetErrorString(HRESULT dwError, LCID dwLocale, LPWSTR *
                            reinterpret_cast<char *>(&text), 256, nullptr);
         if (n == 0 || !text)
             return E_FAIL;
-        int wide = MultiByteToWideChar(CP_ACP, 0, text, -1, nullptr, 0);
-        auto *out = static_cast<wchar_t *>(CoTaskMemAlloc((wide > 0 ? wide : 1) * sizeof(wchar_t)));
-        if (!out) {
-            LocalFree(text);
-            return E_OUTOFMEMORY;
-        }
-        out[0] = L'\0';
-        MultiByteToWideChar(CP_ACP, 0, text, -1, out, wide);
+        std::wstring wide = FromCodePage(text);
         LocalFree(text);
-        *ppString = out;
-        return S_OK;
+        *ppString = TaskStrDup(wide.c_str());
+        return *ppString ? S_OK : E_OUTOFMEMORY;
     });
 }
 
@@ -282,41 +276,14 @@ STDMETHODIMP COPCServer::SetClientName(LPCWSTR szName)
     });
 }
 
-HRESULT COPCServer::FillSlot(const ComPtr<IUnknown> &sink, DWORD *cookie)
-{
-    CSingleLock lock(&m_sinkLock);
-    if (m_shutdownSink)
-        return CONNECT_E_ADVISELIMIT;
-    m_shutdownSink = sink;
-    *cookie = kShutdownCookie;
-    return S_OK;
-}
-
-HRESULT COPCServer::EmptySlot(DWORD cookie)
-{
-    ComPtr<IUnknown> released; // released after the lock
-    CSingleLock lock(&m_sinkLock);
-    if (cookie != kShutdownCookie || !m_shutdownSink)
-        return CONNECT_E_NOCONNECTION;
-    released = std::move(m_shutdownSink);
-    return S_OK;
-}
-
-ComPtr<IUnknown> COPCServer::SlotSink(DWORD *cookie)
-{
-    CSingleLock lock(&m_sinkLock);
-    *cookie = kShutdownCookie;
-    return m_shutdownSink;
-}
-
 STDMETHODIMP COPCServer::FindConnectionPoint(REFIID riid, IConnectionPoint **ppCP)
 {
-    return FindSingleSinkPoint(this, InnerUnknown(), riid, ppCP);
+    return FindSingleSinkPoint(&m_shutdownSink, InnerUnknown(), riid, ppCP);
 }
 
 STDMETHODIMP COPCServer::EnumConnectionPoints(IEnumConnectionPoints **ppEnum)
 {
-    return EnumSingleSinkPoint(this, InnerUnknown(), ppEnum);
+    return EnumSingleSinkPoint(&m_shutdownSink, InnerUnknown(), ppEnum);
 }
 
 STDMETHODIMP COPCServer::GetGroupByName(LPCWSTR szName, REFIID riid, LPUNKNOWN *ppUnk)

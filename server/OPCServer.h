@@ -20,8 +20,7 @@ class COPCServer : public CComObjectRoot,
                    public IOPCCommon,
                    public IOPCItemProperties,
                    public IConnectionPointContainer,
-                   private CGroupOwner,
-                   private ISinkSlot {
+                   private CGroupOwner {
 public:
     // A server object bound to outer (aggregated) or plain; no references yet.
     static COPCServer *Create(IUnknown *outer);
@@ -68,11 +67,6 @@ protected:
 private:
     HRESULT PropertyDeviceRead(const wchar_t *itemId, COPCGroup::PropertyRead &out);
 
-    // ISinkSlot: the one IOPCShutdown sink; the server never calls it.
-    const IID &SinkIid() const override { return IID_IOPCShutdown; }
-    HRESULT FillSlot(const ComPtr<IUnknown> &sink, DWORD *cookie) override;
-    HRESULT EmptySlot(DWORD cookie) override;
-    ComPtr<IUnknown> SlotSink(DWORD *cookie) override;
     static constexpr DWORD kShutdownCookie = 0x5D;
 
     // CGroupOwner
@@ -104,8 +98,8 @@ private:
     DWORD m_groupCount = 0;
     CGroupRegistry m_registry;
     volatile LCID m_locale = LOCALE_SYSTEM_DEFAULT;
-    CCriticalSection m_sinkLock; // the framework lock of the shutdown slot
-    ComPtr<IUnknown> m_shutdownSink;
+    // The one IOPCShutdown sink; the server never calls it.
+    CSinkSlot m_shutdownSink{IID_IOPCShutdown, kShutdownCookie};
     std::wstring m_clientName;
     bool m_counted = false; // counted among the server objects of the process
     // Calls from groups into this object; innermost lock.

@@ -59,9 +59,6 @@ struct EnumCopyString {
 template <class Interface, class Policy> class CComEnum2 : public CComObjectRoot, public Interface {
 public:
     using Item = typename Policy::Item;
-    static constexpr unsigned kOwnsArray = 1;
-    static constexpr unsigned kReleasesItems = 2;
-
     // An enumerator that owns elements; with releaseItems it releases (or
     // frees) them when it is destroyed.
     static HRESULT Create(std::vector<Item> elements, bool releaseItems, REFIID riid, void **ppv)
@@ -74,7 +71,7 @@ public:
         }
         e->m_own = std::move(elements);
         e->m_items = &e->m_own;
-        e->m_flags = kOwnsArray | (releaseItems ? kReleasesItems : 0);
+        e->m_releasesItems = releaseItems;
         return CreateComObject(e, riid, ppv);
     }
 
@@ -148,7 +145,7 @@ protected:
     }
     void FinalRelease() override
     {
-        if (m_flags & kReleasesItems)
+        if (m_releasesItems)
             DestroyAll(m_own);
         m_own.clear();
     }
@@ -165,7 +162,7 @@ private:
     const std::vector<Item> *m_items = &m_own;
     ComPtr<IUnknown> m_owner; // null for the enumerator that owns the array
     size_t m_index = 0;
-    unsigned m_flags = 0;
+    bool m_releasesItems = false; // the owner releases (or frees) its elements
     CCriticalSection m_lock;
 };
 

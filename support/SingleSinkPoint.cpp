@@ -2,6 +2,46 @@
 
 #include "ComEnum2.h"
 
+HRESULT CSinkSlot::FillSlot(const ComPtr<IUnknown> &sink, DWORD *cookie)
+{
+    CSingleLock lock(&m_lock);
+    if (m_sink)
+        return CONNECT_E_ADVISELIMIT;
+    m_sink = sink;
+    *cookie = m_cookie;
+    return S_OK;
+}
+
+HRESULT CSinkSlot::EmptySlot(DWORD cookie)
+{
+    ComPtr<IUnknown> released; // released after the lock
+    CSingleLock lock(&m_lock);
+    if (cookie != m_cookie || !m_sink)
+        return CONNECT_E_NOCONNECTION;
+    released = std::move(m_sink);
+    return S_OK;
+}
+
+ComPtr<IUnknown> CSinkSlot::SlotSink(DWORD *cookie)
+{
+    CSingleLock lock(&m_lock);
+    *cookie = m_cookie;
+    return m_sink;
+}
+
+bool CSinkSlot::IsFilled()
+{
+    CSingleLock lock(&m_lock);
+    return m_sink.Get() != nullptr;
+}
+
+void CSinkSlot::Clear()
+{
+    ComPtr<IUnknown> released;
+    CSingleLock lock(&m_lock);
+    released = std::move(m_sink);
+}
+
 HRESULT CSingleSinkPoint::Create(ISinkSlot *slot, IUnknown *container, REFIID riid, void **ppv)
 {
     auto *point = NewComObject<CSingleSinkPoint>();

@@ -4,6 +4,7 @@
 // Made on request; it keeps its container alive.
 #include "ComObject.h"
 #include "ComPtr.h"
+#include "SyncObject.h"
 
 #include <ocidl.h>
 #include <olectl.h>
@@ -21,6 +22,35 @@ public:
 
 protected:
     ~ISinkSlot() = default;
+};
+
+// The slot itself: the sink, its fixed cookie, and a lock of its own
+// (innermost) under which Advise and Unadvise change it.
+class CSinkSlot : public ISinkSlot {
+public:
+    CSinkSlot(const IID &iid, DWORD cookie) : m_iid(iid), m_cookie(cookie) {}
+    const IID &SinkIid() const override { return m_iid; }
+    HRESULT FillSlot(const ComPtr<IUnknown> &sink, DWORD *cookie) override;
+    HRESULT EmptySlot(DWORD cookie) override;
+    ComPtr<IUnknown> SlotSink(DWORD *cookie) override;
+
+    // The sink as its interface (the slot holds it queried for SinkIid), with
+    // a reference of the caller's own: a concurrent Unadvise cannot free it.
+    template <class I> ComPtr<I> Sink()
+    {
+        DWORD cookie;
+        ComPtr<IUnknown> sink = SlotSink(&cookie);
+        return ComPtr<I>(static_cast<I *>(sink.Get()));
+    }
+    bool IsFilled();
+    // Releases the sink, after the slot's lock.
+    void Clear();
+
+private:
+    const IID &m_iid;
+    const DWORD m_cookie;
+    CCriticalSection m_lock;
+    ComPtr<IUnknown> m_sink;
 };
 
 class CSingleSinkPoint : public CComObjectRoot, public IConnectionPoint {
