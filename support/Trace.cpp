@@ -21,7 +21,11 @@ bool TraceToStderr()
 
 void Emit(const char *text)
 {
-    OutputDebugStringA(text);
+    // OutputDebugString costs a round trip through the system on every call
+    // (tens of microseconds under Wine) and status traces come per item: the
+    // text goes to a debugger only when one is attached.
+    if (IsDebuggerPresent())
+        OutputDebugStringA(text);
     if (TraceToStderr())
         fputs(text, stderr);
 }

@@ -1,7 +1,7 @@
 #pragma once
 // Diagnostics. Trace texts and internal assertion failures go to the debugger
-// output (OutputDebugString), which shows nothing in normal operation; setting
-// the environment variable SKYLARC_TRACE to 1 also copies them to stderr.
+// output (OutputDebugString) while a debugger is attached; setting the
+// environment variable SKYLARC_TRACE to 1 also copies them to stderr.
 #include <cstdarg>
 
 void Trace(const char *format, ...) __attribute__((format(printf, 1, 2)));

@@ -1,0 +1,161 @@
+// The baseline for the delivery benchmark: a minimal COM server that does
+// nothing but send precomputed OnDataChange calls of N items, every 10 ms or
+// back to back when a call takes longer, to the one sink advised on it.
+//
+// Usage: baseline_server N CLIENT_PID. It writes its IConnectionPoint,
+// marshalled for another process on this machine, as one line of hex on
+// stdout, and exits once the client has released it or has ended.
+#include "ComObject.h"
+#include "ComPtr.h"
+#include "Handle.h"
+#include "OpcErrors.h"
+#include "opcda.h"
+
+#include <atomic>
+#include <cstdio>
+#include <cstdlib>
+#include <ocidl.h>
+#include <olectl.h>
+#include <thread>
+#include <vector>
+
+namespace {
+const DWORD kRateMs = 10;
+
+class BaselineSource : public CComObjectRoot, public IConnectionPoint {
+public:
+    BaselineSource(DWORD items, HANDLE released)
+        : m_released(released), m_handles(items), m_values(items), m_qualities(items, OPC_QUALITY_GOOD), m_times(items),
+          m_errors(items, S_OK)
+    {
+        FILETIME now;
+        GetSystemTimeAsFileTime(&now);
+        for (DWORD i = 0; i < items; ++i) {
+            m_handles[i] = i;
+            V_VT(&m_values[i]) = VT_R8;
+            V_R8(&m_values[i]) = i;
+            m_times[i] = now;
+        }
+    }
+    ~BaselineSource() override { Stop(); }
+    DECLARE_COM_UNKNOWN()
+
+    STDMETHODIMP GetConnectionInterface(IID *iid) override
+    {
+        if (!iid)
+            return E_POINTER;
+        *iid = IID_IOPCDataCallback;
+        return S_OK;
+    }
+    STDMETHODIMP GetConnectionPointContainer(IConnectionPointContainer **) override { return E_NOTIMPL; }
+    STDMETHODIMP Advise(IUnknown *sink, DWORD *cookie) override
+    {
+        if (!sink || !cookie)
+            return E_POINTER;
+        if (m_sender.joinable())
+            return CONNECT_E_ADVISELIMIT;
+        ComPtr<IOPCDataCallback> callback;
+        if (FAILED(sink->QueryInterface(IID_IOPCDataCallback, reinterpret_cast<void **>(callback.Out()))))
+            return CONNECT_E_CANNOTCONNECT;
+        m_stop = false;
+        m_sender = std::thread([this, callback] { Send(callback.Get()); });
+        *cookie = 1;
+        return S_OK;
+    }
+    STDMETHODIMP Unadvise(DWORD cookie) override
+    {
+        if (cookie != 1 || !m_sender.joinable())
+            return CONNECT_E_NOCONNECTION;
+        Stop();
+        return S_OK;
+    }
+    STDMETHODIMP EnumConnections(IEnumConnections **) override { return E_NOTIMPL; }
+
+private:
+    void *FindInterface(REFIID riid) override
+    {
+        return IsEqualIID(riid, IID_IConnectionPoint) ? static_cast<IConnectionPoint *>(this) : nullptr;
+    }
+    void FinalRelease() override
+    {
+        Stop();
+        SetEvent(m_released);
+    }
+
+    void Send(IOPCDataCallback *sink)
+    {
+        CoInitializeEx(nullptr, COINIT_MULTITHREADED);
+        const DWORD n = static_cast<DWORD>(m_handles.size());
+        ULONGLONG due = GetTickCount64();
+        while (!m_stop) {
+            sink->OnDataChange(0, 1, S_OK, S_OK, n, m_handles.data(), m_values.data(), m_qualities.data(),
+                               m_times.data(), m_errors.data());
+            due += kRateMs;
+            ULONGLONG now = GetTickCount64();
+            if (due > now)
+                Sleep(static_cast<DWORD>(due - now));
+            else
+                due = now; // late: the next call goes at once
+        }
+        CoUninitialize();
+    }
+    void Stop()
+    {
+        m_stop = true;
+        if (m_sender.joinable())
+            m_sender.join();
+    }
+
+    HANDLE m_released;
+    std::vector<OPCHANDLE> m_handles;
+    std::vector<VARIANT> m_values;
+    std::vector<WORD> m_qualities;
+    std::vector<FILETIME> m_times;
+    std::vector<HRESULT> m_errors;
+    std::atomic<bool> m_stop{false};
+    std::thread m_sender;
+};
+
+bool WriteMarshalled(IUnknown *object)
+{
+    ComPtr<IStream> stream;
+    if (FAILED(CreateStreamOnHGlobal(nullptr, TRUE, stream.Out())) ||
+        FAILED(CoMarshalInterface(stream.Get(), IID_IConnectionPoint, object, MSHCTX_LOCAL, nullptr, MSHLFLAGS_NORMAL)))
+        return false;
+    HGLOBAL memory = nullptr;
+    GetHGlobalFromStream(stream.Get(), &memory);
+    const auto *bytes = static_cast<const unsigned char *>(GlobalLock(memory));
+    for (SIZE_T i = 0, size = GlobalSize(memory); i < size; ++i)
+        printf("%02x", bytes[i]);
+    printf("\n");
+    fflush(stdout);
+    GlobalUnlock(memory);
+    return true;
+}
+} // namespace
+
+int main(int argc, char **argv)
+{
+    DWORD items = argc > 2 ? strtoul(argv[1], nullptr, 10) : 0;
+    UniqueHandle client(OpenProcess(SYNCHRONIZE, FALSE, argc > 2 ? strtoul(argv[2], nullptr, 10) : 0));
+    if (items == 0 || items > 1000000 || !client) {
+        fprintf(stderr, "usage: baseline_server N CLIENT_PID (1 to 1000000 items per call)\n");
+        return 2;
+    }
+    CoInitializeEx(nullptr, COINIT_MULTITHREADED);
+    UniqueHandle released(CreateEventW(nullptr, TRUE, FALSE, nullptr));
+    int status = 1;
+    {
+        ComPtr<IConnectionPoint> source;
+        CreateComObject(NewComObject<BaselineSource>(items, released.Get()), IID_IConnectionPoint,
+                        reinterpret_cast<void **>(source.Out()));
+        if (source && WriteMarshalled(source.Get()))
+            status = 0;
+    }
+    // The client's proxy now holds the only reference.
+    HANDLE ends[] = {released.Get(), client.Get()};
+    if (status == 0)
+        WaitForMultipleObjects(2, ends, FALSE, INFINITE);
+    CoUninitialize();
+    return status;
+}
