@@ -3,6 +3,7 @@
 // canonical type and VARIANTs in the client's requested type. Every VARIANT
 // conversion is VariantChangeType with flags 0 and no locale.
 #include "CadroNetwork.h"
+#include "Variant.h"
 
 #include <oleauto.h>
 
@@ -25,28 +26,6 @@ public:
 
 private:
     CadroValue m_value;
-};
-
-// Owns a VARIANT; cleared on destruction.
-class CVariant {
-public:
-    CVariant() { VariantInit(&m_v); }
-    ~CVariant() { VariantClear(&m_v); }
-    CVariant(const CVariant &) = delete;
-    CVariant &operator=(const CVariant &) = delete;
-
-    VARIANT *Get() { return &m_v; }
-    const VARIANT &Value() const { return m_v; }
-    // Hands the value over and leaves this VT_EMPTY.
-    VARIANT Detach()
-    {
-        VARIANT v = m_v;
-        VariantInit(&m_v);
-        return v;
-    }
-
-private:
-    VARIANT m_v;
 };
 
 VARTYPE NetworkTypeToVarType(uint16_t networkType);

@@ -22,10 +22,26 @@ long RunAndCapture(const std::wstring &commandLine, std::string &output, DWORD t
     UniqueHandle process(pi.hProcess), thread(pi.hThread);
     writer.Reset();
     output.clear();
+    // Reads while the program runs; one that outlives the time limit is ended.
+    DWORD start = GetTickCount();
     char buffer[4096];
-    DWORD got = 0;
-    while (ReadFile(readEnd, buffer, sizeof buffer, &got, nullptr) && got)
-        output.append(buffer, got);
+    for (;;) {
+        DWORD available = 0, got = 0;
+        bool open = PeekNamedPipe(readEnd, nullptr, 0, nullptr, &available, nullptr) != FALSE;
+        if (open && available > 0) {
+            if (ReadFile(readEnd, buffer, sizeof buffer, &got, nullptr) && got)
+                output.append(buffer, got);
+            continue;
+        }
+        bool ended = WaitForSingleObject(process.Get(), open ? 20 : 0) == WAIT_OBJECT_0;
+        if (!open || (ended && (!PeekNamedPipe(readEnd, nullptr, 0, nullptr, &available, nullptr) || !available)))
+            break;
+        if (GetTickCount() - start > timeoutMs) {
+            TerminateProcess(process.Get(), 1);
+            WaitForSingleObject(process.Get(), 5000);
+            return -1;
+        }
+    }
     if (WaitForSingleObject(process.Get(), timeoutMs) != WAIT_OBJECT_0)
         return -1;
     DWORD code = 0;

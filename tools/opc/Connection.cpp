@@ -1,0 +1,119 @@
+#include "Connection.h"
+
+#include "Format.h"
+#include "TaskMem.h"
+#include "opccomn.h"
+
+const wchar_t Connection::kDefaultServer[] = L"Tarnwell.SkylarcOPCServer";
+
+int Connection::Open(const std::wstring &name, Output &out)
+{
+    CLSID clsid;
+    HRESULT hr = name.size() > 0 && name[0] == L'{' ? CLSIDFromString(name.c_str(), &clsid)
+                                                    : CLSIDFromProgID(name.c_str(), &clsid);
+    if (FAILED(hr)) {
+        out.Error(L"no OPC server is registered as \"" + name + L"\"");
+        return kExitNoServer;
+    }
+    hr = CoCreateInstance(clsid, nullptr, CLSCTX_LOCAL_SERVER, IID_IOPCServer,
+                          reinterpret_cast<void **>(m_server.Out()));
+    if (FAILED(hr)) {
+        out.Error(L"cannot reach the OPC server \"" + name + L"\": " + SystemErrorText(hr) + L" (" + HexCode(hr) +
+                  L")");
+        return kExitNoServer;
+    }
+    ComPtr<IOPCCommon> common;
+    if (SUCCEEDED(m_server.As(common)))
+        common->SetClientName(L"opc");
+    return kExitOk;
+}
+
+std::wstring SystemErrorText(HRESULT code)
+{
+    wchar_t *text = nullptr;
+    DWORD n =
+        FormatMessageW(FORMAT_MESSAGE_ALLOCATE_BUFFER | FORMAT_MESSAGE_FROM_SYSTEM | FORMAT_MESSAGE_IGNORE_INSERTS,
+                       nullptr, static_cast<DWORD>(code), 0, reinterpret_cast<wchar_t *>(&text), 0, nullptr);
+    std::wstring result = n && text ? text : L"";
+    LocalFree(text);
+    while (!result.empty() &&
+           (result.back() == L'\n' || result.back() == L'\r' || result.back() == L' ' || result.back() == L'.'))
+        result.pop_back();
+    return result.empty() ? L"unknown error" : result;
+}
+
+std::wstring Connection::Describe(HRESULT code) const
+{
+    std::wstring text;
+    LPWSTR raw = nullptr;
+    if (m_server && SUCCEEDED(m_server->GetErrorString(code, LOCALE_SYSTEM_DEFAULT, &raw)) && raw) {
+        TaskMem<wchar_t> owned(raw);
+        text = raw;
+        while (!text.empty() && (text.back() == L'\n' || text.back() == L'\r' || text.back() == L' '))
+            text.pop_back();
+    }
+    if (text.empty())
+        text = SystemErrorText(code);
+    return text + L" (" + HexCode(code) + L")";
+}
+
+ItemGroup::~ItemGroup()
+{
+    if (!m_items)
+        return;
+    m_items.Reset();
+    m_server->RemoveGroup(m_handle, FALSE);
+}
+
+HRESULT ItemGroup::Create(IOPCServer *server, DWORD rate, bool active, float deadband, DWORD *revisedRate)
+{
+    DWORD revised = 0;
+    HRESULT hr = server->AddGroup(L"", active ? TRUE : FALSE, rate, 0, nullptr, &deadband, 0, &m_handle, &revised,
+                                  IID_IOPCItemMgt, reinterpret_cast<IUnknown **>(m_items.Out()));
+    if (SUCCEEDED(hr))
+        m_server = server;
+    if (revisedRate)
+        *revisedRate = revised;
+    return hr;
+}
+
+HRESULT ItemGroup::Add(const std::vector<std::wstring> &ids, VARTYPE requested, std::vector<Item> &items)
+{
+    std::vector<OPCITEMDEF> defs(ids.size());
+    for (size_t i = 0; i < ids.size(); ++i) {
+        defs[i] = {};
+        defs[i].szAccessPath = const_cast<wchar_t *>(L"");
+        defs[i].szItemID = const_cast<wchar_t *>(ids[i].c_str());
+        defs[i].bActive = TRUE;
+        defs[i].hClient = static_cast<OPCHANDLE>(i);
+        defs[i].vtRequestedDataType = requested;
+    }
+    OPCITEMRESULT *rawResults = nullptr;
+    HRESULT *rawErrors = nullptr;
+    HRESULT hr = m_items->AddItems(static_cast<DWORD>(defs.size()), defs.data(), &rawResults, &rawErrors);
+    TaskMem<OPCITEMRESULT> results(rawResults);
+    TaskMem<HRESULT> errors(rawErrors);
+    items.assign(ids.size(), Item());
+    for (size_t i = 0; i < ids.size(); ++i) {
+        items[i].id = ids[i];
+        items[i].error = errors ? errors[i] : hr;
+        if (results) {
+            CoTaskMemFree(results[i].pBlob);
+            if (SUCCEEDED(items[i].error)) {
+                items[i].server = results[i].hServer;
+                items[i].canonical = results[i].vtCanonicalDataType;
+                items[i].access = results[i].dwAccessRights;
+            }
+        }
+    }
+    return hr;
+}
+
+void ItemGroup::Valid(const std::vector<Item> &items, std::vector<OPCHANDLE> &servers, std::vector<size_t> &which)
+{
+    for (size_t i = 0; i < items.size(); ++i)
+        if (SUCCEEDED(items[i].error)) {
+            servers.push_back(items[i].server);
+            which.push_back(i);
+        }
+}

@@ -1,0 +1,60 @@
+#pragma once
+// The server opc talks to, and the group it adds its items to.
+#include "ComPtr.h"
+#include "Output.h"
+#include "opcda.h"
+
+#include <string>
+#include <vector>
+
+// Exit codes of opc.
+enum ExitCode { kExitOk = 0, kExitFailed = 1, kExitUsage = 2, kExitNoServer = 3 };
+
+// The server named by a ProgID or a {CLSID}, created out of process.
+class Connection {
+public:
+    static const wchar_t kDefaultServer[];
+
+    // kExitOk, or kExitNoServer with the reason written to out.
+    int Open(const std::wstring &name, Output &out);
+    IOPCServer *Server() const { return m_server.Get(); }
+
+    // "<the server's text for code> (0x...)", the system's text when the
+    // server has none.
+    std::wstring Describe(HRESULT code) const;
+
+private:
+    ComPtr<IOPCServer> m_server;
+};
+
+// The system's text for an error code, or empty.
+std::wstring SystemErrorText(HRESULT code);
+
+// A private group of the server, removed again when this goes.
+class ItemGroup {
+public:
+    struct Item {
+        std::wstring id;
+        OPCHANDLE server = 0;
+        VARTYPE canonical = VT_EMPTY;
+        DWORD access = 0;
+        HRESULT error = S_OK;
+    };
+
+    ItemGroup() = default;
+    ItemGroup(const ItemGroup &) = delete;
+    ItemGroup &operator=(const ItemGroup &) = delete;
+    ~ItemGroup();
+
+    HRESULT Create(IOPCServer *server, DWORD rate, bool active, float deadband, DWORD *revisedRate = nullptr);
+    // Adds every identifier, active, with client handles 0..n-1.
+    HRESULT Add(const std::vector<std::wstring> &ids, VARTYPE requested, std::vector<Item> &items);
+    template <class I> HRESULT As(ComPtr<I> &out) const { return m_items.As(out); }
+    // The handles of the items that were added, and their client handles.
+    static void Valid(const std::vector<Item> &items, std::vector<OPCHANDLE> &servers, std::vector<size_t> &which);
+
+private:
+    IOPCServer *m_server = nullptr;
+    OPCHANDLE m_handle = 0;
+    ComPtr<IOPCItemMgt> m_items;
+};

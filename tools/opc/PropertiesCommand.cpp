@@ -1,0 +1,80 @@
+// opc properties: every property the server has for an item, with its value.
+#include "Commands.h"
+#include "Format.h"
+#include "ItemLine.h"
+#include "TaskMem.h"
+#include "Variant.h"
+
+namespace {
+// One item's properties; false when the server knows none.
+bool PrintProperties(IOPCItemProperties *properties, const std::wstring &id, Output &out, const Connection &server)
+{
+    DWORD count = 0;
+    DWORD *rawIds = nullptr;
+    LPWSTR *rawDescriptions = nullptr;
+    VARTYPE *rawTypes = nullptr;
+    HRESULT hr = properties->QueryAvailableProperties(const_cast<wchar_t *>(id.c_str()), &count, &rawIds,
+                                                      &rawDescriptions, &rawTypes);
+    TaskMem<DWORD> ids(rawIds);
+    TaskMem<LPWSTR> descriptions(rawDescriptions);
+    TaskMem<VARTYPE> types(rawTypes);
+    std::vector<TaskMem<wchar_t>> texts;
+    for (DWORD i = 0; descriptions && i < count; ++i)
+        texts.emplace_back(descriptions[i]);
+    if (FAILED(hr)) {
+        ReportItemError(out, server, L"properties", id, hr);
+        return false;
+    }
+    VARIANT *rawValues = nullptr;
+    HRESULT *rawErrors = nullptr;
+    hr = properties->GetItemProperties(const_cast<wchar_t *>(id.c_str()), count, ids.Get(), &rawValues, &rawErrors);
+    TaskMem<VARIANT> values(rawValues);
+    TaskMem<HRESULT> errors(rawErrors);
+    std::vector<CVariant> owned(values ? count : 0);
+    for (DWORD i = 0; values && i < count; ++i)
+        *owned[i].Get() = values[i];
+    if (!out.Json())
+        out.Line(id);
+    for (DWORD i = 0; i < count; ++i) {
+        HRESULT error = FAILED(hr) ? hr : errors ? errors[i] : E_FAIL;
+        std::wstring description = texts[i].Get() ? texts[i].Get() : L"";
+        std::wstring value =
+            SUCCEEDED(error) && values ? (out.Json() ? ValueJson(owned[i].Value()) : ValueText(owned[i].Value())) : L"";
+        if (out.Json()) {
+            std::vector<std::pair<std::wstring, std::wstring>> fields = {{L"item", JsonString(id)},
+                                                                         {L"id", std::to_wstring(ids[i])},
+                                                                         {L"description", JsonString(description)},
+                                                                         {L"type", JsonString(TypeName(types[i]))}};
+            if (SUCCEEDED(error))
+                fields.push_back({L"value", value});
+            else
+                fields.push_back({L"error", JsonString(HexCode(error))});
+            out.Line(Output::Object(fields));
+            continue;
+        }
+        wchar_t head[160];
+        swprintf(head, 160, L"  %5lu  %-36ls %-9ls ", static_cast<unsigned long>(ids[i]), description.c_str(),
+                 TypeName(types[i]).c_str());
+        out.Line(head + (SUCCEEDED(error) ? value : L"(" + server.Describe(error) + L")"));
+    }
+    return true;
+}
+} // namespace
+
+int ShowProperties(const Arguments &args, Output &out, Connection &server)
+{
+    if (args.Positional().empty()) {
+        out.Error(L"properties needs at least one item (see opc properties --help)");
+        return kExitUsage;
+    }
+    ComPtr<IOPCItemProperties> properties;
+    if (FAILED(ComPtr<IOPCServer>(server.Server()).As(properties))) {
+        out.Error(L"properties: the server offers no item properties");
+        return kExitFailed;
+    }
+    bool failed = false;
+    for (const std::wstring &id : args.Positional())
+        if (!PrintProperties(properties.Get(), id, out, server))
+            failed = true;
+    return failed ? kExitFailed : kExitOk;
+}
