@@ -111,14 +111,14 @@ struct Delivery {
     bool stayedActive = true;
 };
 
-// Counts what the sink receives for a few seconds, after a warm-up.
+// Counts what the sink receives for five seconds, after a warm-up.
 Delivery Measure(CountingSink *sink, HANDLE serverProcess)
 {
     Sleep(500);
     unsigned long long before = sink->items;
     double cpuBefore = CpuSeconds(serverProcess);
     auto start = Clock::now();
-    Sleep(3000);
+    Sleep(5000);
     Delivery d;
     double seconds = std::chrono::duration<double>(Clock::now() - start).count();
     unsigned long long delivered = sink->items - before;

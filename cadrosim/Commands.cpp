@@ -137,7 +137,7 @@ std::wstring Engine::Publish(const std::vector<std::wstring> &args)
             return Error(L"bad option '" + args[i] + L"'");
     }
     Shard &shard = *member->shard;
-    std::lock_guard<std::mutex> l(shard.lock);
+    std::lock_guard<SlimMutex> l(shard.lock);
     member->value = value;
     member->hasValue = true;
     member->good = good;
@@ -157,7 +157,7 @@ std::wstring Engine::AddMemberCommand(const std::vector<std::wstring> &args)
     if (!ParseMemberSpec(args, 1, *member, error))
         return Error(error);
     {
-        std::lock_guard<std::mutex> l(m_networkLock);
+        std::lock_guard<SlimMutex> l(m_networkLock);
         member->shard = m_shards[NextShard()].get();
         if (!m_network->AddMember(args[0], member, error))
             return Error(error);
@@ -172,14 +172,14 @@ std::wstring Engine::RemoveMemberCommand(const std::vector<std::wstring> &args)
         return Error(L"usage: remove-member <url>");
     std::shared_ptr<Member> member;
     {
-        std::lock_guard<std::mutex> l(m_networkLock);
+        std::lock_guard<SlimMutex> l(m_networkLock);
         member = m_network->RemoveMember(args[0]);
     }
     if (!member)
         return Error(L"unknown data member " + args[0]);
     {
         // Its subscribers hear that the item is gone and get nothing more.
-        std::lock_guard<std::mutex> l(member->shard->lock);
+        std::lock_guard<SlimMutex> l(member->shard->lock);
         member->removed = true;
         for (Subscription *s : member->subscriptions) {
             s->active = false;
@@ -196,7 +196,7 @@ std::wstring Engine::SetConnected(const std::vector<std::wstring> &args, bool co
         return Error(L"usage: disconnect|reconnect <machine>");
     std::vector<std::shared_ptr<Member>> members;
     {
-        std::lock_guard<std::mutex> l(m_networkLock);
+        std::lock_guard<SlimMutex> l(m_networkLock);
         Machine *machine = m_network->FindMachine(args[0]);
         if (!machine)
             return Error(L"unknown machine " + args[0]);
@@ -210,7 +210,7 @@ std::wstring Engine::SetConnected(const std::vector<std::wstring> &args, bool co
     }
     for (auto &member : members) {
         Shard &shard = *member->shard;
-        std::lock_guard<std::mutex> l(shard.lock);
+        std::lock_guard<SlimMutex> l(shard.lock);
         for (Subscription *s : member->subscriptions) {
             if (!connected) {
                 s->active = false;
@@ -234,7 +234,7 @@ std::wstring Engine::SetStalled(const std::vector<std::wstring> &args, bool stal
     auto member = FindMember(args[0]);
     if (!member)
         return Error(L"unknown data member " + args[0]);
-    std::lock_guard<std::mutex> l(member->shard->lock);
+    std::lock_guard<SlimMutex> l(member->shard->lock);
     member->stalled = stalled;
     return L"ok\n";
 }
@@ -243,9 +243,9 @@ std::wstring Engine::ListSubscriptions()
 {
     std::wostringstream out;
     out << L"ok\n";
-    std::lock_guard<std::mutex> l(m_networkLock);
+    std::lock_guard<SlimMutex> l(m_networkLock);
     m_network->ForEachMember([&](Machine &machine, std::shared_ptr<Member> &member) {
-        std::lock_guard<std::mutex> sl(member->shard->lock);
+        std::lock_guard<SlimMutex> sl(member->shard->lock);
         if (member->subscriptions.empty())
             return;
         out << L"\\\\" << machine.name << L" " << member->name << L" subscriptions=" << member->subscriptions.size()
@@ -262,7 +262,7 @@ std::wstring Engine::Show(const std::vector<std::wstring> &args)
     auto member = FindMember(args[0]);
     if (!member)
         return Error(L"unknown data member " + args[0]);
-    std::lock_guard<std::mutex> l(member->shard->lock);
+    std::lock_guard<SlimMutex> l(member->shard->lock);
     std::wostringstream out;
     out << L"ok\n"
         << L"name " << member->name << L"\ntype " << TypeName(member->type) << L"\naccess "
@@ -303,7 +303,7 @@ std::wstring Engine::Status()
     out << L"ok\nhost " << m_host << L"\nnetwork " << m_networkSource << L"\n";
     if (!m_loadError.empty())
         out << L"load error " << m_loadError << L"\n";
-    std::lock_guard<std::mutex> l(m_networkLock);
+    std::lock_guard<SlimMutex> l(m_networkLock);
     for (auto &m : m_network->Machines())
         out << L"machine " << m->name << (m->connected ? L" connected" : L" disconnected") << L"\n";
     out << L"subscriptions " << m_subscriptionCount.load() << L"\n";

@@ -123,7 +123,7 @@ bool Engine::Load(const std::wstring &description, std::wstring &error)
     if (!ParseNetworkDescription(description, m_host, *network, error))
         return false;
     {
-        std::lock_guard<std::mutex> l(m_networkLock);
+        std::lock_guard<SlimMutex> l(m_networkLock);
         // Subscriptions may still hold members of the old network, which
         // point at its machines: it is retired, never destroyed.
         if (m_network)
@@ -152,14 +152,14 @@ double Engine::ElapsedMs() const
 
 void Engine::AddUse()
 {
-    std::lock_guard<std::mutex> l(m_useLock);
+    std::lock_guard<SlimMutex> l(m_useLock);
     if (m_uses++ == 0)
         StartThreads();
 }
 
 void Engine::ReleaseUse()
 {
-    std::lock_guard<std::mutex> l(m_useLock);
+    std::lock_guard<SlimMutex> l(m_useLock);
     if (--m_uses == 0)
         StopThreads();
 }
@@ -180,7 +180,7 @@ void Engine::StopThreads()
 
 std::shared_ptr<Member> Engine::FindMember(const std::wstring &url, Machine **machine)
 {
-    std::lock_guard<std::mutex> l(m_networkLock);
+    std::lock_guard<SlimMutex> l(m_networkLock);
     auto member = m_network->FindMember(url);
     if (member && machine)
         *machine = member->machine;
@@ -205,7 +205,7 @@ HRESULT Engine::Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeReceiv
         return E_OUTOFMEMORY;
     Shard &shard = *member->shard;
     {
-        std::lock_guard<std::mutex> l(shard.lock);
+        std::lock_guard<SlimMutex> l(shard.lock);
         member->subscriptions.push_back(sub);
         shard.Post(sub, EventKind::Status, kCadroStatusConnecting);
         if (member->machine->connected) {
@@ -224,7 +224,7 @@ void Engine::Unsubscribe(Subscription *sub)
 {
     --m_subscriptionCount;
     Shard &shard = *sub->member->shard;
-    std::unique_lock<std::mutex> l(shard.lock);
+    std::unique_lock<SlimMutex> l(shard.lock);
     if (!shard.Detach(sub, l)) {
         shard.Bury(sub);
         return;
@@ -246,7 +246,7 @@ HRESULT Engine::Write(Subscription *sub, const CadroValue *value)
     if (!FromCadroValue(*value, m.type, converted))
         return DISP_E_TYPEMISMATCH;
     Shard &shard = *m.shard;
-    std::lock_guard<std::mutex> l(shard.lock);
+    std::lock_guard<SlimMutex> l(shard.lock);
     m.value = converted;
     m.hasValue = true;
     m.good = true;
@@ -270,7 +270,7 @@ HRESULT Engine::Read(Subscription *sub, uint32_t *flags, CadroValue *value, int3
     Member &m = *sub->member;
     if (!m.machine->connected)
         return kNotConnected;
-    std::lock_guard<std::mutex> l(m.shard->lock);
+    std::lock_guard<SlimMutex> l(m.shard->lock);
     if (!m.hasValue || m.removed) {
         GetSystemTimeAsFileTime(time); // no value yet: the time of the query
         return S_OK;
@@ -285,20 +285,20 @@ HRESULT Engine::Read(Subscription *sub, uint32_t *flags, CadroValue *value, int3
 
 bool Engine::List(const std::wstring &url, std::vector<BrowseEntry> &out)
 {
-    std::lock_guard<std::mutex> l(m_networkLock);
+    std::lock_guard<SlimMutex> l(m_networkLock);
     return m_network->List(url, out);
 }
 
 void Engine::AddBrowserReceiver(ICadroBrowserReceiver *receiver)
 {
-    std::lock_guard<std::mutex> l(m_receiversLock);
+    std::lock_guard<SlimMutex> l(m_receiversLock);
     receiver->AddRef();
     m_browserReceivers.push_back(receiver);
 }
 
 void Engine::RemoveBrowserReceiver(ICadroBrowserReceiver *receiver)
 {
-    std::lock_guard<std::mutex> l(m_receiversLock);
+    std::lock_guard<SlimMutex> l(m_receiversLock);
     auto it = std::find(m_browserReceivers.begin(), m_browserReceivers.end(), receiver);
     if (it != m_browserReceivers.end()) {
         m_browserReceivers.erase(it);
@@ -310,7 +310,7 @@ void Engine::NotifyTopologyChanged()
 {
     std::vector<ICadroBrowserReceiver *> receivers;
     {
-        std::lock_guard<std::mutex> l(m_receiversLock);
+        std::lock_guard<SlimMutex> l(m_receiversLock);
         receivers = m_browserReceivers;
         for (auto *r : receivers)
             r->AddRef();

@@ -3,11 +3,11 @@
 // the subscriptions and the control commands. Every library object of CDREALT
 // and CDBROW is backed by it.
 #include "Network.h"
+#include "SlimSync.h"
 #include "Unknown.h"
 
 #include <atomic>
 #include <chrono>
-#include <condition_variable>
 #include <deque>
 #include <functional>
 #include <memory>
@@ -55,13 +55,13 @@ public:
     // Safe from the shard's own thread (it is then left to finish alone).
     void Stop();
 
-    std::mutex lock;
+    SlimMutex lock;
     // Under lock: queue an event / put a member on the heap.
     void Post(Subscription *sub, EventKind kind, uint32_t status = 0);
     void Schedule(const std::shared_ptr<Member> &member);
     // Under lock (held by l): ends the subscription's deliveries; false when
     // the caller is inside this shard's callbacks and must not wait.
-    bool Detach(Subscription *sub, std::unique_lock<std::mutex> &l);
+    bool Detach(Subscription *sub, std::unique_lock<SlimMutex> &l);
     void Bury(Subscription *sub) { m_graveyard.push_back(sub); }
     bool OnShardThread() const { return GetCurrentThreadId() == m_threadId; }
 
@@ -74,14 +74,14 @@ private:
     };
 
     void Run(unsigned generation);
-    void Tick(std::unique_lock<std::mutex> &l, const std::shared_ptr<Member> &member, Clock::time_point at);
-    void Dispatch(std::unique_lock<std::mutex> &l, Event e);
+    void Tick(std::unique_lock<SlimMutex> &l, const std::shared_ptr<Member> &member, Clock::time_point at);
+    void Dispatch(std::unique_lock<SlimMutex> &l, Event e);
     // Runs callbacks with the lock released, then wakes waiting releases.
-    template <class F> void Deliver(std::unique_lock<std::mutex> &l, F callbacks);
+    template <class F> void Deliver(std::unique_lock<SlimMutex> &l, F callbacks);
 
     Engine &m_engine;
-    std::condition_variable m_wake;
-    std::condition_variable m_batchDone;
+    SlimCondition m_wake;
+    SlimCondition m_batchDone;
     std::deque<Event> m_events;
     std::priority_queue<Due, std::vector<Due>, std::greater<Due>> m_heap;
     std::vector<Subscription *> m_graveyard;
@@ -148,17 +148,17 @@ private:
     friend class ControlPipe;
 
     std::wstring m_host;
-    std::mutex m_networkLock; // the topology; outside any shard lock
+    SlimMutex m_networkLock; // the topology; outside any shard lock
     std::unique_ptr<Network> m_network;
     std::vector<std::unique_ptr<Network>> m_retired;
     std::wstring m_networkSource;
     std::wstring m_loadError;
     std::vector<std::unique_ptr<Shard>> m_shards;
     std::atomic<unsigned> m_nextShard{0};
-    std::mutex m_useLock;
+    SlimMutex m_useLock;
     long m_uses = 0;
     std::unique_ptr<class ControlPipe> m_pipe;
-    std::mutex m_receiversLock;
+    SlimMutex m_receiversLock;
     std::vector<ICadroBrowserReceiver *> m_browserReceivers;
     std::chrono::steady_clock::time_point m_epoch;
     std::mt19937 m_random;

@@ -24,7 +24,7 @@ void Split(const FILETIME &ft, uint32_t &low, uint32_t &high)
 
 void Shard::Start()
 {
-    std::lock_guard<std::mutex> l(lock);
+    std::lock_guard<SlimMutex> l(lock);
     unsigned generation = ++m_generation;
     m_thread = std::thread([this, generation] { Run(generation); });
 }
@@ -33,7 +33,7 @@ void Shard::Stop()
 {
     std::thread thread;
     {
-        std::lock_guard<std::mutex> l(lock);
+        std::lock_guard<SlimMutex> l(lock);
         ++m_generation;
         thread = std::move(m_thread);
     }
@@ -61,7 +61,7 @@ void Shard::Schedule(const std::shared_ptr<Member> &member)
     m_wake.notify_one();
 }
 
-bool Shard::Detach(Subscription *sub, std::unique_lock<std::mutex> &l)
+bool Shard::Detach(Subscription *sub, std::unique_lock<SlimMutex> &l)
 {
     sub->dead = true;
     auto &subs = sub->member->subscriptions;
@@ -77,7 +77,7 @@ bool Shard::Detach(Subscription *sub, std::unique_lock<std::mutex> &l)
     return true;
 }
 
-template <class F> void Shard::Deliver(std::unique_lock<std::mutex> &l, F callbacks)
+template <class F> void Shard::Deliver(std::unique_lock<SlimMutex> &l, F callbacks)
 {
     uint64_t batch = ++m_batchesStarted;
     m_delivering = true;
@@ -102,7 +102,7 @@ template <class F> void Shard::Deliver(std::unique_lock<std::mutex> &l, F callba
 void Shard::Run(unsigned generation)
 {
     m_threadId = GetCurrentThreadId();
-    std::unique_lock<std::mutex> l(lock);
+    std::unique_lock<SlimMutex> l(lock);
     while (m_generation == generation) {
         if (!m_events.empty()) {
             Event e = m_events.front();
@@ -123,7 +123,7 @@ void Shard::Run(unsigned generation)
     }
 }
 
-void Shard::Tick(std::unique_lock<std::mutex> &l, const std::shared_ptr<Member> &member, Clock::time_point at)
+void Shard::Tick(std::unique_lock<SlimMutex> &l, const std::shared_ptr<Member> &member, Clock::time_point at)
 {
     Member &m = *member;
     if (m.removed || m.subscriptions.empty()) {
@@ -158,7 +158,7 @@ void Shard::Tick(std::unique_lock<std::mutex> &l, const std::shared_ptr<Member> 
     ClearCadroValue(value);
 }
 
-void Shard::Dispatch(std::unique_lock<std::mutex> &l, Event e)
+void Shard::Dispatch(std::unique_lock<SlimMutex> &l, Event e)
 {
     Subscription *sub = e.sub;
     Member &m = *sub->member;

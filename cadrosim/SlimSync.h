@@ -1,0 +1,57 @@
+#pragma once
+// A mutex and a condition variable on the system's slim reader/writer lock.
+// The standard ones of the MinGW threading library go through kernel objects,
+// and under Wine every wake is then a round trip through the Wine server:
+// tens of microseconds for each subscription the engine is told about.
+#include <windows.h>
+
+#include <chrono>
+#include <mutex>
+
+namespace cadrosim {
+
+class SlimMutex {
+public:
+    SlimMutex() = default;
+    SlimMutex(const SlimMutex &) = delete;
+    SlimMutex &operator=(const SlimMutex &) = delete;
+    void lock() { AcquireSRWLockExclusive(&m_lock); }
+    void unlock() { ReleaseSRWLockExclusive(&m_lock); }
+    bool try_lock() { return TryAcquireSRWLockExclusive(&m_lock) != FALSE; }
+    SRWLOCK *native() { return &m_lock; }
+
+private:
+    SRWLOCK m_lock = SRWLOCK_INIT;
+};
+
+class SlimCondition {
+public:
+    SlimCondition() = default;
+    SlimCondition(const SlimCondition &) = delete;
+    SlimCondition &operator=(const SlimCondition &) = delete;
+    void notify_one() { WakeConditionVariable(&m_condition); }
+    void notify_all() { WakeAllConditionVariable(&m_condition); }
+    void wait(std::unique_lock<SlimMutex> &l) { Sleep(l, INFINITE); }
+    template <class Predicate> void wait(std::unique_lock<SlimMutex> &l, Predicate ready)
+    {
+        while (!ready())
+            Sleep(l, INFINITE);
+    }
+    // Returns at the time or earlier (callers check their condition again).
+    template <class Clock, class Duration>
+    void wait_until(std::unique_lock<SlimMutex> &l, const std::chrono::time_point<Clock, Duration> &at)
+    {
+        auto left = std::chrono::ceil<std::chrono::milliseconds>(at - Clock::now()).count();
+        if (left > 0)
+            Sleep(l, left >= INFINITE ? INFINITE - 1 : static_cast<DWORD>(left));
+    }
+
+private:
+    void Sleep(std::unique_lock<SlimMutex> &l, DWORD ms)
+    {
+        SleepConditionVariableSRW(&m_condition, l.mutex()->native(), ms, 0);
+    }
+    CONDITION_VARIABLE m_condition = CONDITION_VARIABLE_INIT;
+};
+
+} // namespace cadrosim
