@@ -106,6 +106,8 @@ TEST_F(OpcToolE2E, BrowseReadWriteAndProperties)
     EXPECT_EQ(properties.code, 0);
     EXPECT_TRUE(Has(properties.output, "Item Canonical Data Type")) << properties.output;
     EXPECT_TRUE(Has(properties.output, "Boiler temperature")) << properties.output;
+    EXPECT_TRUE(Has(properties.output, "(double)")) << properties.output; // the canonical type by name
+    EXPECT_EQ(Opc(R"(properties \\.\proc1\Nothing.here)").code, 1);
 }
 
 TEST_F(OpcToolE2E, SubscribesThroughBothInterfaces)

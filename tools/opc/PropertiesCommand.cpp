@@ -6,7 +6,22 @@
 #include "Variant.h"
 
 namespace {
-// One item's properties; false when the server knows none.
+// Properties whose numbers people read as names: the canonical data type
+// (1) and the access rights (5).
+std::wstring Explained(DWORD id, const VARIANT &value)
+{
+    CVariant number;
+    if (FAILED(VariantChangeType(number.Get(), const_cast<VARIANT *>(&value), 0, VT_I4)))
+        return L"";
+    LONG n = V_I4(number.Get());
+    if (id == 1)
+        return L" (" + TypeName(static_cast<VARTYPE>(n)) + L")";
+    if (id == 5)
+        return n == 3 ? L" (read, write)" : n == 1 ? L" (read)" : n == 2 ? L" (write)" : L"";
+    return L"";
+}
+
+// One item's properties; false when the server has none, or could read none.
 bool PrintProperties(IOPCItemProperties *properties, const std::wstring &id, Output &out, const Connection &server)
 {
     DWORD count = 0;
@@ -35,8 +50,11 @@ bool PrintProperties(IOPCItemProperties *properties, const std::wstring &id, Out
         *owned[i].Get() = values[i];
     if (!out.Json())
         out.Line(id);
+    DWORD readable = 0;
     for (DWORD i = 0; i < count; ++i) {
         HRESULT error = FAILED(hr) ? hr : errors ? errors[i] : E_FAIL;
+        if (SUCCEEDED(error))
+            ++readable;
         std::wstring description = texts[i].Get() ? texts[i].Get() : L"";
         std::wstring value =
             SUCCEEDED(error) && values ? (out.Json() ? ValueJson(owned[i].Value()) : ValueText(owned[i].Value())) : L"";
@@ -55,9 +73,10 @@ bool PrintProperties(IOPCItemProperties *properties, const std::wstring &id, Out
         wchar_t head[160];
         swprintf(head, 160, L"  %5lu  %-36ls %-9ls ", static_cast<unsigned long>(ids[i]), description.c_str(),
                  TypeName(types[i]).c_str());
-        out.Line(head + (SUCCEEDED(error) ? value : L"(" + server.Describe(error) + L")"));
+        out.Line(head + (SUCCEEDED(error) ? value + Explained(ids[i], owned[i].Value())
+                                          : L"(" + server.Describe(error) + L")"));
     }
-    return true;
+    return count == 0 || readable > 0;
 }
 } // namespace
 
