@@ -15,6 +15,7 @@
 #include "opcda.h"
 
 #include <atomic>
+#include <functional>
 #include <map>
 #include <memory>
 #include <ocidl.h>
@@ -144,6 +145,15 @@ public:
     HRESULT ReadPass(OPCDATASOURCE source, DWORD count, const OPCHANDLE *handles, std::vector<ReadResult> &results);
     HRESULT WritePass(DWORD count, const OPCHANDLE *handles, const VARIANT *values, HRESULT *errors,
                       OPCHANDLE *clientHandles = nullptr);
+    // The write pass of the asynchronous writes, into columns for their completions.
+    struct WriteResults {
+        explicit WriteResults(size_t n) : errors(n), clients(n, 0xFFFFFFFF) {}
+        std::vector<HRESULT> errors;
+        std::vector<OPCHANDLE> clients;
+        HRESULT overall = S_OK;
+        DWORD Count() const { return static_cast<DWORD>(errors.size()); }
+    };
+    void WritePass(const std::vector<OPCHANDLE> &handles, const std::vector<VARIANT> &values, WriteResults &out);
 
     // The one-off device read of the item properties, in a temporary group
     // made for it: the item is made, read from the device (waiting for a
@@ -180,8 +190,6 @@ private:
     bool GroupActive() const override { return m_active != FALSE; }
 
     COPCItem *FindItem(OPCHANDLE handle);
-    // The indices of the handles that name items; OPC_E_INVALIDHANDLE for the others.
-    std::vector<DWORD> ValidHandles(DWORD count, const OPCHANDLE *handles, HRESULT *errors);
     // IOPCDataCallback calls in flight: removal does not wait for them, so
     // that a client may remove the group from inside its own callback.
     void BeginCallback();
@@ -203,10 +211,29 @@ private:
     // Reads the active items (list order) for a refresh.
     std::vector<OPCHANDLE> ActiveHandles();
     HRESULT QueueTransaction(std::unique_ptr<class CTransaction> t);
-    // Checks shared by the asynchronous Read and Write.
-    template <class Check> HRESULT CheckItems(DWORD count, const OPCHANDLE *handles, DWORD *cancelId,
-                                              HRESULT **ppErrors, TaskMem<HRESULT> &errors, std::vector<DWORD> &passed,
-                                              Check check);
+    // The asynchronous Read and Write of both versions: the checks in the
+    // order of their error codes, the per-item errors, and a transaction of
+    // the items that passed. Version 2.0 checks the access rights per item
+    // and queues what passed; version 1.0 checks only that the items exist
+    // (rights show in the completion) and queues only when all do.
+    struct RequestChecks {
+        bool argumentsValid = true; // the request's other array or its data source
+        HRESULT connection = S_OK;  // the connection the completion goes through
+        DWORD rights = 0;           // needed per item
+        bool allOrNothing = false;
+    };
+    using MakeTransaction =
+        std::function<HRESULT(DWORD id, const std::vector<DWORD> &passed, std::unique_ptr<class CTransaction> &made)>;
+    HRESULT QueueRequest(DWORD count, const OPCHANDLE *handles, const RequestChecks &checks, DWORD *pId,
+                         HRESULT **ppErrors, const MakeTransaction &make);
+    // Refresh and Refresh2: the same checks, on the active items.
+    using MakeRefresh = std::function<std::unique_ptr<class CTransaction>(DWORD id)>;
+    HRESULT QueueRefresh(OPCDATASOURCE source, HRESULT connection, DWORD *pId, const MakeRefresh &make);
+    // S_OK, or CONNECT_E_NOCONNECTION without an IOPCDataCallback sink.
+    HRESULT CallbackConnection();
+    // S_OK, or OLE_E_NOCONNECTION when the DA 1.0 advise connection is not one
+    // of the data formats (or, for a write, of the write-complete format).
+    HRESULT AdviseConnection(DWORD connection, bool write);
     // The common frame of the per-item operations on existing items.
     template <class PerItem>
     HRESULT ForEachHandle(DWORD count, const OPCHANDLE *handles, HRESULT **ppErrors, PerItem perItem);

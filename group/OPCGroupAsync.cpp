@@ -3,6 +3,7 @@
 #include "AsyncIOMgr.h"
 #include "ComEnum2.h"
 #include "ComUtil.h"
+#include "Delivery.h"
 #include "IdMgr.h"
 #include "OPCGroup.h"
 #include "OpcErrors.h"
@@ -11,47 +12,6 @@
 #include "UpdateScanMgr.h"
 
 #include <olectl.h>
-
-namespace {
-// Arrays of one delivery, filled from the read pass or the change check.
-struct Delivery {
-    std::vector<OPCHANDLE> clients;
-    std::vector<VARIANT> values;
-    std::vector<WORD> qualities;
-    std::vector<FILETIME> times;
-    std::vector<HRESULT> errors;
-
-    explicit Delivery(size_t n) : clients(n), values(n), qualities(n), times(n), errors(n)
-    {
-        for (VARIANT &v : values)
-            VariantInit(&v);
-    }
-    ~Delivery()
-    {
-        for (VARIANT &v : values)
-            VariantClear(&v);
-    }
-    void From(const std::vector<COPCGroup::ReadResult> &results)
-    {
-        for (size_t i = 0; i < results.size(); ++i) {
-            clients[i] = results[i].client;
-            values[i] = results[i].value; // moved in; cleared with the delivery
-            qualities[i] = results[i].quality;
-            times[i] = results[i].time;
-            errors[i] = results[i].error;
-        }
-    }
-    // S_OK when every quality is exactly good.
-    HRESULT MasterQuality(size_t n) const
-    {
-        for (size_t i = 0; i < n; ++i)
-            if (qualities[i] != OPC_QUALITY_GOOD)
-                return S_FALSE;
-        return S_OK;
-    }
-};
-
-} // namespace
 
 // ---- Connection point ------------------------------------------------
 
@@ -85,29 +45,68 @@ std::vector<OPCHANDLE> COPCGroup::ActiveHandles()
     return handles;
 }
 
-template <class Check> HRESULT COPCGroup::CheckItems(DWORD count, const OPCHANDLE *handles, DWORD *cancelId,
-                                                     HRESULT **ppErrors, TaskMem<HRESULT> &errors,
-                                                     std::vector<DWORD> &passed, Check check)
+HRESULT COPCGroup::QueueRequest(DWORD count, const OPCHANDLE *handles, const RequestChecks &checks, DWORD *pId,
+                                HRESULT **ppErrors, const MakeTransaction &make)
 {
     if (m_removing)
         return E_FAIL;
-    if (!IsWritableOut(cancelId) || !IsWritableOut(ppErrors))
+    if (!IsWritableOut(pId) || !IsWritableOut(ppErrors))
         return E_INVALIDARG;
-    *cancelId = 0;
+    *pId = 0;
     *ppErrors = nullptr;
-    if (!IsReadableArray(handles, count))
+    if (!checks.argumentsValid || !IsReadableArray(handles, count))
         return E_INVALIDARG;
-    if (!m_callback.IsFilled())
-        return CONNECT_E_NOCONNECTION;
+    if (FAILED(checks.connection))
+        return checks.connection;
+    TaskMem<HRESULT> errors;
     if (!errors.Allocate(count))
         return E_OUTOFMEMORY;
+    std::vector<DWORD> passed;
     for (DWORD i = 0; i < count; ++i) {
         COPCItem *item = FindItem(handles[i]);
-        errors[i] = !item ? OPC_E_INVALIDHANDLE : !check(*item) ? OPC_E_BADRIGHTS : S_OK;
+        errors[i] = !item                                                     ? OPC_E_INVALIDHANDLE
+                    : (item->AccessRights() & checks.rights) != checks.rights ? OPC_E_BADRIGHTS
+                                                                              : S_OK;
         if (errors[i] == S_OK)
             passed.push_back(i);
     }
-    return S_OK;
+    if (checks.allOrNothing ? passed.size() == count : !passed.empty()) {
+        DWORD id = CIdMgr::Instance().GetId();
+        std::unique_ptr<CTransaction> t;
+        HRESULT hr = make(id, passed, t);
+        if (SUCCEEDED(hr))
+            hr = QueueTransaction(std::move(t));
+        if (FAILED(hr))
+            return hr; // the error array is freed with its holder
+        *pId = id;
+    }
+    *ppErrors = errors.Detach();
+    return passed.size() == count ? S_OK : S_FALSE;
+}
+
+HRESULT COPCGroup::QueueRefresh(OPCDATASOURCE source, HRESULT connection, DWORD *pId, const MakeRefresh &make)
+{
+    if (m_removing)
+        return E_FAIL;
+    if (!IsWritableOut(pId))
+        return E_INVALIDARG;
+    *pId = 0;
+    if (FAILED(connection))
+        return connection;
+    if (source != OPC_DS_CACHE && source != OPC_DS_DEVICE)
+        return E_INVALIDARG;
+    if (!m_active || m_activeItems.empty())
+        return E_FAIL;
+    DWORD id = CIdMgr::Instance().GetId();
+    HRESULT hr = QueueTransaction(make(id));
+    if (SUCCEEDED(hr))
+        *pId = id;
+    return hr;
+}
+
+HRESULT COPCGroup::CallbackConnection()
+{
+    return m_callback.IsFilled() ? S_OK : CONNECT_E_NOCONNECTION;
 }
 
 STDMETHODIMP COPCGroup::Read(DWORD dwCount, OPCHANDLE *phServer, DWORD dwTransactionID, DWORD *pdwCancelID,
@@ -115,24 +114,18 @@ STDMETHODIMP COPCGroup::Read(DWORD dwCount, OPCHANDLE *phServer, DWORD dwTransac
 {
     return ComBoundary([&]() -> HRESULT {
         CSingleLock lock(&m_lock);
-        TaskMem<HRESULT> errors;
-        std::vector<DWORD> passed;
-        HRESULT hr = CheckItems(dwCount, phServer, pdwCancelID, ppErrors, errors, passed,
-                                [](COPCItem &item) { return (item.AccessRights() & OPC_READABLE) != 0; });
-        if (FAILED(hr))
-            return hr;
-        if (!passed.empty()) {
-            std::vector<OPCHANDLE> handles;
-            for (DWORD i : passed)
-                handles.push_back(phServer[i]);
-            DWORD id = CIdMgr::Instance().GetId();
-            hr = QueueTransaction(std::make_unique<CRead2Transaction>(id, this, dwTransactionID, std::move(handles)));
-            if (FAILED(hr))
-                return hr;
-            *pdwCancelID = id;
-        }
-        *ppErrors = errors.Detach();
-        return passed.size() == dwCount ? S_OK : S_FALSE;
+        RequestChecks checks;
+        checks.connection = CallbackConnection();
+        checks.rights = OPC_READABLE;
+        return QueueRequest(dwCount, phServer, checks, pdwCancelID, ppErrors,
+                            [&](DWORD id, const std::vector<DWORD> &passed, std::unique_ptr<CTransaction> &made) {
+                                std::vector<OPCHANDLE> handles;
+                                for (DWORD i : passed)
+                                    handles.push_back(phServer[i]);
+                                made =
+                                    std::make_unique<CRead2Transaction>(id, this, dwTransactionID, std::move(handles));
+                                return S_OK;
+                            });
     });
 }
 
@@ -141,31 +134,17 @@ STDMETHODIMP COPCGroup::Write(DWORD dwCount, OPCHANDLE *phServer, VARIANT *pItem
 {
     return ComBoundary([&]() -> HRESULT {
         CSingleLock lock(&m_lock);
-        if (!m_removing && IsWritableOut(pdwCancelID) && IsWritableOut(ppErrors) &&
-            !IsReadableArray(pItemValues, dwCount)) {
-            *pdwCancelID = 0;
-            *ppErrors = nullptr;
-            return E_INVALIDARG;
-        }
-        TaskMem<HRESULT> errors;
-        std::vector<DWORD> passed;
-        HRESULT hr = CheckItems(dwCount, phServer, pdwCancelID, ppErrors, errors, passed,
-                                [](COPCItem &item) { return (item.AccessRights() & OPC_WRITEABLE) != 0; });
-        if (FAILED(hr))
-            return hr;
-        if (!passed.empty()) {
-            DWORD id = CIdMgr::Instance().GetId();
-            auto t = std::make_unique<CWrite2Transaction>(id, this, dwTransactionID);
-            hr = t->Add(phServer, pItemValues, passed);
-            if (FAILED(hr))
-                return hr; // the error array is freed with its holder
-            hr = QueueTransaction(std::move(t));
-            if (FAILED(hr))
-                return hr;
-            *pdwCancelID = id;
-        }
-        *ppErrors = errors.Detach();
-        return passed.size() == dwCount ? S_OK : S_FALSE;
+        RequestChecks checks;
+        checks.argumentsValid = IsReadableArray(pItemValues, dwCount);
+        checks.connection = CallbackConnection();
+        checks.rights = OPC_WRITEABLE;
+        return QueueRequest(dwCount, phServer, checks, pdwCancelID, ppErrors,
+                            [&](DWORD id, const std::vector<DWORD> &passed, std::unique_ptr<CTransaction> &made) {
+                                auto t = std::make_unique<CWrite2Transaction>(id, this, dwTransactionID);
+                                HRESULT hr = t->Add(phServer, pItemValues, passed);
+                                made = std::move(t);
+                                return hr;
+                            });
     });
 }
 
@@ -173,22 +152,9 @@ STDMETHODIMP COPCGroup::Refresh2(OPCDATASOURCE dwSource, DWORD dwTransactionID, 
 {
     return ComBoundary([&]() -> HRESULT {
         CSingleLock lock(&m_lock);
-        if (m_removing)
-            return E_FAIL;
-        if (!IsWritableOut(pdwCancelID))
-            return E_INVALIDARG;
-        *pdwCancelID = 0;
-        if (!m_callback.IsFilled())
-            return CONNECT_E_NOCONNECTION;
-        if (dwSource != OPC_DS_CACHE && dwSource != OPC_DS_DEVICE)
-            return E_INVALIDARG;
-        if (!m_active || m_activeItems.empty())
-            return E_FAIL;
-        DWORD id = CIdMgr::Instance().GetId();
-        HRESULT hr = QueueTransaction(std::make_unique<CRefresh2Transaction>(id, this, dwTransactionID, dwSource));
-        if (SUCCEEDED(hr))
-            *pdwCancelID = id;
-        return hr;
+        return QueueRefresh(dwSource, CallbackConnection(), pdwCancelID, [&](DWORD id) {
+            return std::make_unique<CRefresh2Transaction>(id, this, dwTransactionID, dwSource);
+        });
     });
 }
 
@@ -235,17 +201,15 @@ HRESULT COPCGroup::SendReadResults(CSingleLock &lock, DWORD clientId, OPCDATASOU
 {
     std::vector<ReadResult> results;
     HRESULT overall = ReadPass(source, static_cast<DWORD>(handles.size()), handles.data(), results);
-    Delivery d(results.size());
-    d.From(results);
+    Delivery d(results);
     ComPtr<IOPCDataCallback> sink = m_callback.Sink<IOPCDataCallback>();
     if (!sink)
         return E_FAIL;
     OPCHANDLE hGroup = m_clientHandle;
     CallbackInFlight inFlight(*this);
     lock.Unlock();
-    DWORD n = static_cast<DWORD>(results.size());
-    return (sink.Get()->*callback)(clientId, hGroup, d.MasterQuality(n), overall, n, d.clients.data(), d.values.data(),
-                                   d.qualities.data(), d.times.data(), d.errors.data());
+    return (sink.Get()->*callback)(clientId, hGroup, d.MasterQuality(d.Count()), overall, d.Count(), d.clients.data(),
+                                   d.values.data(), d.qualities.data(), d.times.data(), d.errors.data());
 }
 
 HRESULT COPCGroup::ExecuteRead2(DWORD clientId, const std::vector<OPCHANDLE> &handles)
@@ -258,17 +222,15 @@ HRESULT COPCGroup::ExecuteWrite2(DWORD clientId, const std::vector<OPCHANDLE> &h
                                  const std::vector<VARIANT> &values)
 {
     CSingleLock lock(&m_lock);
-    DWORD n = static_cast<DWORD>(handles.size());
-    std::vector<HRESULT> errors(n);
-    std::vector<OPCHANDLE> clients(n, 0xFFFFFFFF);
-    HRESULT overall = WritePass(n, handles.data(), values.data(), errors.data(), clients.data());
+    WriteResults w(handles.size());
+    WritePass(handles, values, w);
     ComPtr<IOPCDataCallback> sink = m_callback.Sink<IOPCDataCallback>();
     if (!sink)
         return E_FAIL;
     OPCHANDLE hGroup = m_clientHandle;
     CallbackInFlight inFlight(*this);
     lock.Unlock();
-    return sink->OnWriteComplete(clientId, hGroup, overall, n, clients.data(), errors.data());
+    return sink->OnWriteComplete(clientId, hGroup, w.overall, w.Count(), w.clients.data(), w.errors.data());
 }
 
 HRESULT COPCGroup::ExecuteRefresh2(DWORD clientId, OPCDATASOURCE source)

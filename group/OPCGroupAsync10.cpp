@@ -2,6 +2,7 @@
 // advise connections of the three stream formats, and their senders.
 #include "AsyncIOMgr.h"
 #include "ComUtil.h"
+#include "Delivery.h"
 #include "IdMgr.h"
 #include "OPCGroup.h"
 #include "OpcErrors.h"
@@ -82,48 +83,23 @@ HRESULT COPCGroup::SendWriteComplete(DWORD connection, DWORD id, HRESULT overall
 
 // ---- Transaction work ------------------------------------------------
 
-namespace {
-struct Columns {
-    std::vector<OPCHANDLE> clients;
-    std::vector<VARIANT> values;
-    std::vector<WORD> qualities;
-    std::vector<FILETIME> times;
-    explicit Columns(const std::vector<COPCGroup::ReadResult> &r)
-    {
-        for (const auto &x : r) {
-            clients.push_back(x.client);
-            values.push_back(x.value); // moved in
-            qualities.push_back(x.quality);
-            times.push_back(x.time);
-        }
-    }
-    ~Columns()
-    {
-        for (VARIANT &v : values)
-            VariantClear(&v);
-    }
-};
-} // namespace
-
 HRESULT COPCGroup::ExecuteRead(DWORD connection, DWORD id, OPCDATASOURCE source, const std::vector<OPCHANDLE> &handles)
 {
     CSingleLock lock(&m_lock);
     std::vector<ReadResult> results;
     HRESULT overall = ReadPass(source, static_cast<DWORD>(handles.size()), handles.data(), results);
-    Columns c(results);
-    return SendReadComplete(connection, id, overall, static_cast<DWORD>(results.size()), c.clients.data(),
-                            c.values.data(), c.qualities.data(), c.times.data());
+    Delivery d(results);
+    return SendReadComplete(connection, id, overall, d.Count(), d.clients.data(), d.values.data(), d.qualities.data(),
+                            d.times.data());
 }
 
 HRESULT COPCGroup::ExecuteWrite(DWORD connection, DWORD id, const std::vector<OPCHANDLE> &handles,
                                 const std::vector<VARIANT> &values)
 {
     CSingleLock lock(&m_lock);
-    DWORD n = static_cast<DWORD>(handles.size());
-    std::vector<HRESULT> errors(n);
-    std::vector<OPCHANDLE> clients(n, 0xFFFFFFFF);
-    HRESULT overall = WritePass(n, handles.data(), values.data(), errors.data(), clients.data());
-    return SendWriteComplete(connection, id, overall, n, clients.data(), errors.data());
+    WriteResults w(handles.size());
+    WritePass(handles, values, w);
+    return SendWriteComplete(connection, id, w.overall, w.Count(), w.clients.data(), w.errors.data());
 }
 
 HRESULT COPCGroup::ExecuteRefresh(DWORD connection, DWORD id, OPCDATASOURCE source)
@@ -136,16 +112,11 @@ HRESULT COPCGroup::ExecuteRefresh(DWORD connection, DWORD id, OPCDATASOURCE sour
 
 // ---- IOPCAsyncIO -----------------------------------------------------
 
-std::vector<DWORD> COPCGroup::ValidHandles(DWORD count, const OPCHANDLE *handles, HRESULT *errors)
+HRESULT COPCGroup::AdviseConnection(DWORD connection, bool write)
 {
-    // Version 1.0 tests only that the items exist; rights show in completions.
-    std::vector<DWORD> valid;
-    for (DWORD i = 0; i < count; ++i) {
-        errors[i] = FindItem(handles[i]) ? S_OK : OPC_E_INVALIDHANDLE;
-        if (errors[i] == S_OK)
-            valid.push_back(i);
-    }
-    return valid;
+    if (write)
+        return m_writeAdvise.Contains(connection) ? S_OK : OLE_E_NOCONNECTION;
+    return m_dataTimeAdvise.Contains(connection) || m_dataAdvise.Contains(connection) ? S_OK : OLE_E_NOCONNECTION;
 }
 
 STDMETHODIMP COPCGroup::Read(DWORD dwConnection, OPCDATASOURCE dwSource, DWORD dwCount, OPCHANDLE *phServer,
@@ -153,33 +124,17 @@ STDMETHODIMP COPCGroup::Read(DWORD dwConnection, OPCDATASOURCE dwSource, DWORD d
 {
     return ComBoundary([&]() -> HRESULT {
         CSingleLock lock(&m_lock);
-        if (m_removing)
-            return E_FAIL;
-        if (!IsWritableOut(pTransactionID) || !IsWritableOut(ppErrors))
-            return E_INVALIDARG;
-        *pTransactionID = 0;
-        *ppErrors = nullptr;
-        if (dwSource != OPC_DS_CACHE && dwSource != OPC_DS_DEVICE)
-            return E_INVALIDARG;
-        if (!IsReadableArray(phServer, dwCount))
-            return E_INVALIDARG;
-        if (!m_dataTimeAdvise.Contains(dwConnection) && !m_dataAdvise.Contains(dwConnection))
-            return OLE_E_NOCONNECTION;
-        TaskMem<HRESULT> errors;
-        if (!errors.Allocate(dwCount))
-            return E_OUTOFMEMORY;
-        std::vector<DWORD> valid = ValidHandles(dwCount, phServer, errors.Get());
-        bool allValid = valid.size() == dwCount;
-        if (allValid) {
-            DWORD id = CIdMgr::Instance().GetId();
-            HRESULT hr = QueueTransaction(std::make_unique<CReadTransaction>(
-                id, this, dwConnection, dwSource, std::vector<OPCHANDLE>(phServer, phServer + dwCount)));
-            if (FAILED(hr))
-                return hr;
-            *pTransactionID = id;
-        }
-        *ppErrors = errors.Detach();
-        return allValid ? S_OK : S_FALSE;
+        RequestChecks checks;
+        checks.argumentsValid = dwSource == OPC_DS_CACHE || dwSource == OPC_DS_DEVICE;
+        checks.connection = AdviseConnection(dwConnection, false);
+        checks.allOrNothing = true;
+        return QueueRequest(dwCount, phServer, checks, pTransactionID, ppErrors,
+                            [&](DWORD id, const std::vector<DWORD> &, std::unique_ptr<CTransaction> &made) {
+                                made = std::make_unique<CReadTransaction>(
+                                    id, this, dwConnection, dwSource,
+                                    std::vector<OPCHANDLE>(phServer, phServer + dwCount));
+                                return S_OK;
+                            });
     });
 }
 
@@ -188,33 +143,17 @@ STDMETHODIMP COPCGroup::Write(DWORD dwConnection, DWORD dwCount, OPCHANDLE *phSe
 {
     return ComBoundary([&]() -> HRESULT {
         CSingleLock lock(&m_lock);
-        if (m_removing)
-            return E_FAIL;
-        if (!IsWritableOut(pTransactionID) || !IsWritableOut(ppErrors))
-            return E_INVALIDARG;
-        *pTransactionID = 0;
-        *ppErrors = nullptr;
-        if (!IsReadableArray(pItemValues, dwCount) || !IsReadableArray(phServer, dwCount))
-            return E_INVALIDARG;
-        if (!m_writeAdvise.Contains(dwConnection))
-            return OLE_E_NOCONNECTION;
-        TaskMem<HRESULT> errors;
-        if (!errors.Allocate(dwCount))
-            return E_OUTOFMEMORY;
-        std::vector<DWORD> valid = ValidHandles(dwCount, phServer, errors.Get());
-        bool allValid = valid.size() == dwCount;
-        if (allValid) {
-            DWORD id = CIdMgr::Instance().GetId();
-            auto t = std::make_unique<CWriteTransaction>(id, this, dwConnection);
-            HRESULT hr = t->Add(phServer, pItemValues, valid);
-            if (SUCCEEDED(hr))
-                hr = QueueTransaction(std::move(t));
-            if (FAILED(hr))
-                return hr;
-            *pTransactionID = id;
-        }
-        *ppErrors = errors.Detach();
-        return allValid ? S_OK : S_FALSE;
+        RequestChecks checks;
+        checks.argumentsValid = IsReadableArray(pItemValues, dwCount);
+        checks.connection = AdviseConnection(dwConnection, true);
+        checks.allOrNothing = true;
+        return QueueRequest(dwCount, phServer, checks, pTransactionID, ppErrors,
+                            [&](DWORD id, const std::vector<DWORD> &passed, std::unique_ptr<CTransaction> &made) {
+                                auto t = std::make_unique<CWriteTransaction>(id, this, dwConnection);
+                                HRESULT hr = t->Add(phServer, pItemValues, passed);
+                                made = std::move(t);
+                                return hr;
+                            });
     });
 }
 
@@ -222,22 +161,9 @@ STDMETHODIMP COPCGroup::Refresh(DWORD dwConnection, OPCDATASOURCE dwSource, DWOR
 {
     return ComBoundary([&]() -> HRESULT {
         CSingleLock lock(&m_lock);
-        if (m_removing)
-            return E_FAIL;
-        if (!IsWritableOut(pTransactionID))
-            return E_INVALIDARG;
-        *pTransactionID = 0;
-        if (!m_dataTimeAdvise.Contains(dwConnection) && !m_dataAdvise.Contains(dwConnection))
-            return OLE_E_NOCONNECTION;
-        if (dwSource != OPC_DS_CACHE && dwSource != OPC_DS_DEVICE)
-            return E_INVALIDARG;
-        if (!m_active || m_activeItems.empty())
-            return E_FAIL;
-        DWORD id = CIdMgr::Instance().GetId();
-        HRESULT hr = QueueTransaction(std::make_unique<CRefreshTransaction>(id, this, dwConnection, dwSource));
-        if (SUCCEEDED(hr))
-            *pTransactionID = id;
-        return hr;
+        return QueueRefresh(dwSource, AdviseConnection(dwConnection, false), pTransactionID, [&](DWORD id) {
+            return std::make_unique<CRefreshTransaction>(id, this, dwConnection, dwSource);
+        });
     });
 }
 

@@ -49,6 +49,11 @@ HRESULT COPCGroup::WritePass(DWORD count, const OPCHANDLE *handles, const VARIAN
     return anyFailed ? S_FALSE : S_OK;
 }
 
+void COPCGroup::WritePass(const std::vector<OPCHANDLE> &handles, const std::vector<VARIANT> &values, WriteResults &out)
+{
+    out.overall = WritePass(out.Count(), handles.data(), values.data(), out.errors.data(), out.clients.data());
+}
+
 STDMETHODIMP COPCGroup::Read(OPCDATASOURCE dwSource, DWORD dwCount, OPCHANDLE *phServer, OPCITEMSTATE **ppItemValues,
                              HRESULT **ppErrors)
 {

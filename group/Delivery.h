@@ -1,0 +1,49 @@
+#pragma once
+// The column arrays of one callback or stream, filled from a read pass or
+// the scan's change check. The values are owned and cleared with it.
+#include "OPCGroup.h"
+#include "OpcErrors.h"
+
+#include <vector>
+
+struct Delivery {
+    std::vector<OPCHANDLE> clients;
+    std::vector<VARIANT> values;
+    std::vector<WORD> qualities;
+    std::vector<FILETIME> times;
+    std::vector<HRESULT> errors;
+
+    explicit Delivery(size_t n) : clients(n), values(n), qualities(n), times(n), errors(n)
+    {
+        for (VARIANT &v : values)
+            VariantInit(&v);
+    }
+    // The values of the results are moved in.
+    explicit Delivery(const std::vector<COPCGroup::ReadResult> &results) : Delivery(results.size())
+    {
+        for (size_t i = 0; i < results.size(); ++i) {
+            clients[i] = results[i].client;
+            values[i] = results[i].value;
+            qualities[i] = results[i].quality;
+            times[i] = results[i].time;
+            errors[i] = results[i].error;
+        }
+    }
+    ~Delivery()
+    {
+        for (VARIANT &v : values)
+            VariantClear(&v);
+    }
+    Delivery(const Delivery &) = delete;
+    Delivery &operator=(const Delivery &) = delete;
+
+    DWORD Count() const { return static_cast<DWORD>(clients.size()); }
+    // S_OK when the first n qualities are all exactly good.
+    HRESULT MasterQuality(size_t n) const
+    {
+        for (size_t i = 0; i < n; ++i)
+            if (qualities[i] != OPC_QUALITY_GOOD)
+                return S_FALSE;
+        return S_OK;
+    }
+};
