@@ -1,9 +1,15 @@
-// Subscriptions: the scan cost per unchanged active item, the latency from a
+// Subscriptions: the scan cost per unchanged and per changed active item,
+// the processor time of the network's updates to items, the latency from a
 // publish on the network to the client's OnDataChange at a 10 ms update rate,
 // and items delivered per second through OnDataChange when every item changes
 // every scan, with the server's processor time per item: in process, and
-// through COM side by side with a baseline server that only sends
-// precomputed calls (baseline_server.cpp).
+// through COM in turns with a baseline server that only sends precomputed
+// calls (baseline_server.cpp).
+//
+// Usage: subscription_bench            everything
+//        subscription_bench -i         only the in-process figures
+//        subscription_bench N [N ...]  only the comparison through COM, for
+//                                      these item counts in turn
 #include "CadroSim.h"
 #include "ClassFactory.h"
 #include "ComPtr.h"
@@ -21,6 +27,7 @@
 #include <vector>
 
 namespace {
+bool inProcessOnly = false;
 using Clock = std::chrono::steady_clock;
 const CLSID kServer = {0x5b1e7a20, 0x4c3d, 0x11d3, {0x9a, 0x44, 0x00, 0xa0, 0xc9, 0xe2, 0xb7, 0xf1}};
 
@@ -106,104 +113,161 @@ double CpuSeconds(HANDLE process)
 }
 
 struct Delivery {
-    double itemsPerSecond = 0;
-    double cpuMicrosPerItem = 0;
+    unsigned long long items = 0;
+    double seconds = 0;
+    double cpuSeconds = 0;
     bool stayedActive = true;
+    double ItemsPerSecond() const { return seconds > 0 ? items / seconds : 0; }
+    double CpuMicrosPerItem() const { return items ? cpuSeconds * 1e6 / items : 0; }
 };
 
-// Counts what the sink receives for five seconds, after a warm-up.
-Delivery Measure(CountingSink *sink, HANDLE serverProcess)
+// Adds to d what the sink receives in one window, after a warm-up, and the
+// processor time the sending process uses meanwhile.
+void MeasureWindow(CountingSink *sink, HANDLE process, DWORD warmUpMs, DWORD windowMs, Delivery &d)
 {
-    Sleep(500);
+    Sleep(warmUpMs);
     unsigned long long before = sink->items;
-    double cpuBefore = CpuSeconds(serverProcess);
+    double cpuBefore = CpuSeconds(process);
     auto start = Clock::now();
-    Sleep(5000);
-    Delivery d;
-    double seconds = std::chrono::duration<double>(Clock::now() - start).count();
-    unsigned long long delivered = sink->items - before;
-    d.itemsPerSecond = delivered / seconds;
-    if (delivered)
-        d.cpuMicrosPerItem = (CpuSeconds(serverProcess) - cpuBefore) * 1e6 / delivered;
-    return d;
+    Sleep(windowMs);
+    d.items += sink->items - before;
+    d.seconds += std::chrono::duration<double>(Clock::now() - start).count();
+    d.cpuSeconds += CpuSeconds(process) - cpuBefore;
 }
 
-// Our server: one active group of n items that all change every 10 ms scan
-// ("fast" counts every 10 ms).
-Delivery OurServer(IOPCServer *server, DWORD n, HANDLE serverProcess)
-{
-    ComPtr<CountingSink> sink = CountingSink::Create();
-    Group g = MakeGroup(server, 10, L"\\\\.\\proc1\\Counters.fast", n, sink.Get());
-    Delivery d = Measure(sink.Get(), serverProcess);
-    ComPtr<IOPCGroupStateMgt> gs;
-    g.items.As(gs);
-    DWORD rate, lcid;
-    BOOL active = FALSE;
-    LPWSTR name = nullptr;
-    LONG bias;
-    FLOAT deadband;
-    OPCHANDLE client, handle;
-    gs->GetState(&rate, &active, &name, &bias, &deadband, &lcid, &client, &handle);
-    CoTaskMemFree(name);
-    d.stayedActive = active != FALSE;
-    g.point->Unadvise(g.cookie);
-    g = Group();
-    gs.Reset();
-    server->RemoveGroup(handle, TRUE);
-    return d;
-}
-
-// The baseline: a process of its own that sends precomputed OnDataChange
-// calls of n items at the same rate (see baseline_server.cpp).
-Delivery Baseline(DWORD n)
-{
-    wchar_t exe[MAX_PATH];
-    GetModuleFileNameW(nullptr, exe, MAX_PATH);
-    std::wstring path(exe);
-    path = path.substr(0, path.find_last_of(L"\\/") + 1) + L"baseline_server.exe";
-    std::wstring command = L"\"" + path + L"\" " + std::to_wstring(n) + L" " + std::to_wstring(GetCurrentProcessId());
-
-    SECURITY_ATTRIBUTES inherit = {sizeof(inherit), nullptr, TRUE};
-    HANDLE readEnd = nullptr, writeEnd = nullptr;
-    CreatePipe(&readEnd, &writeEnd, &inherit, 0);
-    UniqueHandle reader(readEnd), writer(writeEnd);
-    SetHandleInformation(readEnd, HANDLE_FLAG_INHERIT, 0);
-    STARTUPINFOW si = {};
-    si.cb = sizeof(si);
-    si.dwFlags = STARTF_USESTDHANDLES;
-    si.hStdOutput = writeEnd;
-    si.hStdError = GetStdHandle(STD_ERROR_HANDLE);
-    PROCESS_INFORMATION pi = {};
-    if (!CreateProcessW(nullptr, &command[0], nullptr, nullptr, TRUE, 0, nullptr, nullptr, &si, &pi))
-        return {};
-    UniqueHandle process(pi.hProcess), thread(pi.hThread);
-    writer.Reset();
-
-    std::string hex;
-    char c;
-    DWORD got;
-    while (ReadFile(reader.Get(), &c, 1, &got, nullptr) && got == 1 && c != '\n')
-        hex += c;
-    Delivery d;
-    HGLOBAL memory = GlobalAlloc(GMEM_MOVEABLE, hex.size() / 2 + 1);
-    auto *bytes = static_cast<unsigned char *>(GlobalLock(memory));
-    for (size_t i = 0; i + 1 < hex.size(); i += 2)
-        bytes[i / 2] = static_cast<unsigned char>(std::stoul(hex.substr(i, 2), nullptr, 16));
-    GlobalUnlock(memory);
-    ComPtr<IStream> stream;
-    ComPtr<IConnectionPoint> point;
-    if (SUCCEEDED(CreateStreamOnHGlobal(memory, TRUE, stream.Out())) &&
-        SUCCEEDED(CoUnmarshalInterface(stream.Get(), IID_IConnectionPoint, reinterpret_cast<void **>(point.Out())))) {
-        ComPtr<CountingSink> sink = CountingSink::Create();
-        DWORD cookie = 0;
-        point->Advise(static_cast<IOPCDataCallback *>(sink.Get()), &cookie);
-        d = Measure(sink.Get(), process.Get());
-        point->Unadvise(cookie);
+// Our side: an active group of n items that all change every 10 ms scan
+// ("fast" counts every 10 ms). The network updates its items as long as it
+// exists, so it exists only while it is measured.
+class OurGroup {
+public:
+    OurGroup(IOPCServer *server, DWORD n) : m_server(server), m_sink(CountingSink::Create())
+    {
+        m_group = MakeGroup(server, 10, L"\\\\.\\proc1\\Counters.fast", n, m_sink.Get());
+        m_group.items.As(m_state);
     }
-    point.Reset();
-    WaitForSingleObject(process.Get(), 10000);
+    ~OurGroup()
+    {
+        m_group.point->Unadvise(m_group.cookie);
+        OPCHANDLE handle = m_group.handle;
+        m_state.Reset();
+        m_group = Group();
+        m_server->RemoveGroup(handle, TRUE);
+    }
+    OurGroup(const OurGroup &) = delete;
+    OurGroup &operator=(const OurGroup &) = delete;
+
+    // False when failed deliveries made the server deactivate the group.
+    bool Active()
+    {
+        DWORD rate, lcid;
+        BOOL active = FALSE;
+        LPWSTR name = nullptr;
+        LONG bias;
+        FLOAT deadband;
+        OPCHANDLE client, handle;
+        m_state->GetState(&rate, &active, &name, &bias, &deadband, &lcid, &client, &handle);
+        CoTaskMemFree(name);
+        return active != FALSE;
+    }
+    CountingSink *Sink() { return m_sink.Get(); }
+
+private:
+    IOPCServer *m_server;
+    ComPtr<CountingSink> m_sink;
+    Group m_group;
+    ComPtr<IOPCGroupStateMgt> m_state;
+};
+
+Delivery InProcess(IOPCServer *server, DWORD n)
+{
+    OurGroup group(server, n);
+    Delivery d;
+    MeasureWindow(group.Sink(), GetCurrentProcess(), 500, 5000, d);
+    d.stayedActive = group.Active();
     return d;
 }
+
+// The baseline side: a process of its own that sends precomputed
+// OnDataChange calls of n items at the same rate while a sink is advised on
+// it (see baseline_server.cpp).
+class BaselineServer {
+public:
+    explicit BaselineServer(DWORD n) : m_sink(CountingSink::Create())
+    {
+        wchar_t exe[MAX_PATH];
+        GetModuleFileNameW(nullptr, exe, MAX_PATH);
+        std::wstring path(exe);
+        path = path.substr(0, path.find_last_of(L"\\/") + 1) + L"baseline_server.exe";
+        std::wstring command =
+            L"\"" + path + L"\" " + std::to_wstring(n) + L" " + std::to_wstring(GetCurrentProcessId());
+
+        SECURITY_ATTRIBUTES inherit = {sizeof(inherit), nullptr, TRUE};
+        HANDLE readEnd = nullptr, writeEnd = nullptr;
+        if (!CreatePipe(&readEnd, &writeEnd, &inherit, 0))
+            return;
+        UniqueHandle reader(readEnd), writer(writeEnd);
+        SetHandleInformation(readEnd, HANDLE_FLAG_INHERIT, 0);
+        STARTUPINFOW si = {};
+        si.cb = sizeof(si);
+        si.dwFlags = STARTF_USESTDHANDLES;
+        si.hStdOutput = writeEnd;
+        si.hStdError = GetStdHandle(STD_ERROR_HANDLE);
+        PROCESS_INFORMATION pi = {};
+        if (!CreateProcessW(nullptr, &command[0], nullptr, nullptr, TRUE, 0, nullptr, nullptr, &si, &pi))
+            return;
+        m_process.Reset(pi.hProcess);
+        UniqueHandle thread(pi.hThread);
+        writer.Reset();
+        Unmarshal(ReadLine(reader.Get()));
+    }
+    ~BaselineServer()
+    {
+        m_point.Reset(); // the baseline ends once it is released
+        if (m_process)
+            WaitForSingleObject(m_process.Get(), 10000);
+    }
+    BaselineServer(const BaselineServer &) = delete;
+    BaselineServer &operator=(const BaselineServer &) = delete;
+
+    bool Ready() const { return m_point.Get() != nullptr; }
+    void Start() { m_point->Advise(static_cast<IOPCDataCallback *>(m_sink.Get()), &m_cookie); }
+    void Stop() { m_point->Unadvise(m_cookie); }
+    HANDLE Process() const { return m_process.Get(); }
+    CountingSink *Sink() { return m_sink.Get(); }
+
+private:
+    static std::string ReadLine(HANDLE pipe)
+    {
+        std::string line;
+        char c;
+        DWORD got;
+        while (ReadFile(pipe, &c, 1, &got, nullptr) && got == 1 && c != '\n')
+            line += c;
+        return line;
+    }
+    // The connection point, marshalled by the baseline as hex.
+    void Unmarshal(const std::string &hex)
+    {
+        HGLOBAL memory = GlobalAlloc(GMEM_MOVEABLE, hex.size() / 2 + 1);
+        if (!memory)
+            return;
+        auto *bytes = static_cast<unsigned char *>(GlobalLock(memory));
+        for (size_t i = 0; i + 1 < hex.size(); i += 2)
+            bytes[i / 2] = static_cast<unsigned char>(std::stoul(hex.substr(i, 2), nullptr, 16));
+        GlobalUnlock(memory);
+        ComPtr<IStream> stream;
+        if (FAILED(CreateStreamOnHGlobal(memory, TRUE, stream.Out()))) {
+            GlobalFree(memory);
+            return;
+        }
+        CoUnmarshalInterface(stream.Get(), IID_IConnectionPoint, reinterpret_cast<void **>(m_point.Out()));
+    }
+
+    UniqueHandle m_process;
+    ComPtr<IConnectionPoint> m_point;
+    ComPtr<CountingSink> m_sink;
+    DWORD m_cookie = 0;
+};
 
 // The process of the local server this program is connected to.
 UniqueHandle FindServerProcess()
@@ -220,13 +284,62 @@ UniqueHandle FindServerProcess()
 void PrintDelivery(const char *what, DWORD n, const Delivery &d)
 {
     printf("  %-22s N=%-6lu %10.0f items/s  %7.3f us server CPU per item%s\n", what, static_cast<unsigned long>(n),
-           d.itemsPerSecond, d.cpuMicrosPerItem, d.stayedActive ? "" : "  (group deactivated: deliveries failed)");
+           d.ItemsPerSecond(), d.CpuMicrosPerItem(), d.stayedActive ? "" : "  (group deactivated: deliveries failed)");
+}
+
+// Delivery through COM, ours beside the baseline, for each item count. The
+// two take turns in short windows, so that a machine whose speed drifts
+// (other programs, a virtual machine's neighbours) weighs on both alike.
+void CompareThroughCom(const std::vector<DWORD> &counts)
+{
+    const int kRounds = 4;
+    const DWORD kWarmUpMs = 500, kWindowMs = 1500;
+    ComPtr<IOPCServer> remote;
+    if (FAILED(CoCreateInstance(kServer, nullptr, CLSCTX_LOCAL_SERVER, IID_IOPCServer,
+                                reinterpret_cast<void **>(remote.Out())))) {
+        printf("out of process: the server is not registered\n");
+        return;
+    }
+    UniqueHandle serverProcess = FindServerProcess();
+    for (DWORD items : counts) {
+        BaselineServer baseline(items);
+        if (!baseline.Ready()) {
+            printf("  the baseline server did not start\n");
+            return;
+        }
+        Delivery base, our;
+        for (int round = 0; round < kRounds; ++round) {
+            baseline.Start();
+            MeasureWindow(baseline.Sink(), baseline.Process(), kWarmUpMs, kWindowMs, base);
+            baseline.Stop();
+            OurGroup ours(remote.Get(), items);
+            MeasureWindow(ours.Sink(), serverProcess.Get(), kWarmUpMs, kWindowMs, our);
+            our.stayedActive = our.stayedActive && ours.Active();
+        }
+        PrintDelivery("baseline COM server", items, base);
+        PrintDelivery("our server", items, our);
+        if (base.ItemsPerSecond() > 0)
+            printf("  %-22s N=%-6lu %9.0f %%\n", "ours / baseline", static_cast<unsigned long>(items),
+                   100 * our.ItemsPerSecond() / base.ItemsPerSecond());
+    }
 }
 } // namespace
 
-int main()
+// With item counts as arguments only the comparison through COM runs, for
+// those counts in turn (repeat a count to see how much it varies).
+int wmain(int argc, wchar_t **argv)
 {
     CoInitializeEx(nullptr, COINIT_MULTITHREADED);
+    if (argc > 1 && wcscmp(argv[1], L"-i") == 0)
+        inProcessOnly = true;
+    else if (argc > 1) {
+        std::vector<DWORD> counts;
+        for (int i = 1; i < argc; ++i)
+            counts.push_back(wcstoul(argv[i], nullptr, 10));
+        CompareThroughCom(counts);
+        CoUninitialize();
+        return 0;
+    }
     {
         CServerClassFactory factory;
         ComPtr<IOPCServer> server;
@@ -253,6 +366,32 @@ int main()
         OPCHANDLE quietHandle = quiet.handle;
         quiet = Group();
         server->RemoveGroup(quietHandle, TRUE);
+
+        // Scan cost per changed item, the work a scan adds to each delivery:
+        // every item has changed since the last scan, and no sink is advised.
+        Group busy = MakeGroup(server.Get(), 3600000, L"\\\\.\\proc1\\Counters.fast", n, nullptr);
+        Sleep(300);
+        busy.items.As(state);
+        group = static_cast<COPCGroup *>(state.Get());
+        // What the network's updates cost the process meanwhile: the group is
+        // not scanned, every item gets a value every 10 ms.
+        double cpu0 = CpuSeconds(GetCurrentProcess());
+        Sleep(2000);
+        printf("network update of an item, processor time: %.1f ns (%lu items every 10 ms)\n",
+               (CpuSeconds(GetCurrentProcess()) - cpu0) * 1e9 / (200.0 * n), static_cast<unsigned long>(n));
+        double changedNs = 0;
+        for (int i = 0; i < 50; ++i) {
+            Sleep(15);
+            auto t0 = Clock::now();
+            group->Scan(next);
+            changedNs += std::chrono::duration<double, std::nano>(Clock::now() - t0).count();
+        }
+        printf("scan cost per changed active item: %.1f ns (%lu items, 50 scans)\n", changedNs / (50.0 * n),
+               static_cast<unsigned long>(n));
+        state.Reset();
+        OPCHANDLE busyHandle = busy.handle;
+        busy = Group();
+        server->RemoveGroup(busyHandle, TRUE);
 
         // Latency from a publish to OnDataChange at a 10 ms rate.
         ComPtr<CountingSink> sink = CountingSink::Create();
@@ -281,26 +420,10 @@ int main()
 
         printf("items delivered through OnDataChange, every item changing every 10 ms scan:\n");
         for (DWORD items : {100u, 1000u, 10000u})
-            PrintDelivery("in process", items, OurServer(server.Get(), items, GetCurrentProcess()));
+            PrintDelivery("in process", items, InProcess(server.Get(), items));
     }
-    {
-        ComPtr<IOPCServer> remote;
-        if (FAILED(CoCreateInstance(kServer, nullptr, CLSCTX_LOCAL_SERVER, IID_IOPCServer,
-                                    reinterpret_cast<void **>(remote.Out())))) {
-            printf("out of process: the server is not registered\n");
-        } else {
-            UniqueHandle serverProcess = FindServerProcess();
-            for (DWORD items : {100u, 1000u, 10000u}) {
-                Delivery base = Baseline(items);
-                Delivery ours = OurServer(remote.Get(), items, serverProcess.Get());
-                PrintDelivery("baseline COM server", items, base);
-                PrintDelivery("our server", items, ours);
-                if (base.itemsPerSecond > 0)
-                    printf("  %-22s N=%-6lu %9.0f %%\n", "ours / baseline", static_cast<unsigned long>(items),
-                           100 * ours.itemsPerSecond / base.itemsPerSecond);
-            }
-        }
-    }
+    if (!inProcessOnly)
+        CompareThroughCom({100, 1000, 10000});
     CoUninitialize();
     return 0;
 }

@@ -3,6 +3,7 @@
 // the scan's change check. The values are owned and cleared with it.
 #include "OPCGroup.h"
 #include "OpcErrors.h"
+#include "ValueConversion.h"
 
 #include <vector>
 
@@ -38,6 +39,28 @@ struct Delivery {
     Delivery &operator=(const Delivery &) = delete;
 
     DWORD Count() const { return static_cast<DWORD>(clients.size()); }
+    // Makes n rows for reuse; the values must be empty.
+    void Resize(size_t n)
+    {
+        size_t old = values.size();
+        clients.resize(n);
+        values.resize(n);
+        qualities.resize(n);
+        times.resize(n);
+        errors.resize(n);
+        for (size_t i = old; i < n; ++i)
+            VariantInit(&values[i]);
+    }
+    // Empties the values of the first n rows.
+    void ClearValues(size_t n)
+    {
+        for (size_t i = 0; i < n && i < values.size(); ++i) {
+            if (IsPlainVariant(values[i]))
+                V_VT(&values[i]) = VT_EMPTY; // owns nothing
+            else
+                VariantClear(&values[i]);
+        }
+    }
     // S_OK when the first n qualities are all exactly good.
     HRESULT MasterQuality(size_t n) const
     {

@@ -2,6 +2,7 @@
 
 #include "ComPtr.h"
 #include "ComUtil.h"
+#include "Delivery.h"
 #include "IdMgr.h"
 #include "OpcErrors.h"
 #include "TaskMem.h"
@@ -38,6 +39,8 @@ COPCGroup::COPCGroup() : m_idle(CreateEventW(nullptr, TRUE, TRUE, nullptr))
         INTERNAL_ASSERT_FAILED("CreateEvent for the group's idle event");
     m_serverHandle = CIdMgr::Instance().GetId();
 }
+
+COPCGroup::~COPCGroup() = default;
 
 void *COPCGroup::FindInterface(REFIID riid)
 {

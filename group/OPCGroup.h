@@ -22,6 +22,8 @@
 #include <string>
 #include <vector>
 
+struct Delivery;
+
 class COPCGroup : public CComObjectRoot,
                   public IOPCGroupStateMgt,
                   public IOPCSyncIO,
@@ -190,6 +192,7 @@ private:
     bool GroupActive() const override { return m_active != FALSE; }
 
     COPCItem *FindItem(OPCHANDLE handle);
+    class ScanColumns;
     // IOPCDataCallback calls in flight: removal does not wait for them, so
     // that a client may remove the group from inside its own callback.
     void BeginCallback();
@@ -245,7 +248,7 @@ private:
 
     template <class T, class... Args> friend T *NewComObject(Args &&...args);
     COPCGroup();
-    ~COPCGroup() override = default;
+    ~COPCGroup() override;
 
     CCriticalSection m_lock; // guards every field below
     UniqueHandle m_idle;     // manual reset; signalled while no work is pending
@@ -258,6 +261,10 @@ private:
     CAdvisoryConnectionMgr m_dataTimeAdvise;
     CAdvisoryConnectionMgr m_writeAdvise;
     DWORD m_failedScans = 0;
+    // The scan's columns, kept between scans: a scan of many items then
+    // neither allocates nor touches fresh pages. Taken out for a scan, so
+    // that two scans of the group can never share them.
+    std::unique_ptr<Delivery> m_scanColumns;
     LONG m_callbacksInFlight = 0;
     bool m_removing = false;
     bool m_destroyed = false;

@@ -255,6 +255,37 @@ DWORD COPCGroup::IncrementFailedScans()
     return ++m_failedScans;
 }
 
+// Lends the group's kept columns to one scan (or makes new ones when
+// another scan has them) and takes them back, emptied, at its end.
+class COPCGroup::ScanColumns {
+public:
+    explicit ScanColumns(COPCGroup &group) : m_group(group), m_rows(std::move(group.m_scanColumns))
+    {
+        if (!m_rows)
+            m_rows = std::make_unique<Delivery>(0);
+    }
+    ~ScanColumns()
+    {
+        m_rows->ClearValues(m_used);
+        CSingleLock lock(&m_group.m_lock);
+        if (!m_group.m_scanColumns)
+            m_group.m_scanColumns = std::move(m_rows);
+    }
+    ScanColumns(const ScanColumns &) = delete;
+    ScanColumns &operator=(const ScanColumns &) = delete;
+    Delivery &Rows(size_t n)
+    {
+        m_rows->Resize(n);
+        return *m_rows;
+    }
+    void SetUsed(size_t n) { m_used = n; }
+
+private:
+    COPCGroup &m_group;
+    std::unique_ptr<Delivery> m_rows;
+    size_t m_used = 0;
+};
+
 void COPCGroup::ReleaseScanEntry()
 {
     ReleasePendingWork();
@@ -267,7 +298,8 @@ BOOL COPCGroup::Scan(LONGLONG &next)
     if (!m_active)
         return FALSE;
     next = CUpdateScanMgr::Now() + static_cast<LONGLONG>(m_updateRate) * CUpdateScanMgr::TicksPerMs();
-    Delivery d(m_activeItems.size());
+    ScanColumns columns(*this);
+    Delivery &d = columns.Rows(m_activeItems.size());
     size_t n = 0;
     for (COPCItem *item : m_activeItems) {
         bool changed = false;
@@ -276,11 +308,12 @@ BOOL COPCGroup::Scan(LONGLONG &next)
         d.errors[n] = hr;
         if (changed)
             ++n;
-        else
+        else if (V_VT(&d.values[n]) != VT_EMPTY)
             VariantClear(&d.values[n]);
     }
     if (n == 0)
         return TRUE; // nothing changed: nothing is sent
+    columns.SetUsed(n);
 
     HRESULT callbackResult = S_FALSE;
     ComPtr<IOPCDataCallback> sink = m_enable ? m_callback.Sink<IOPCDataCallback>() : nullptr;

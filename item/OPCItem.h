@@ -47,25 +47,28 @@ private:
     void CopyDeviceToLastReported();
 
     CCriticalSection m_lock;
-    CItemOwner *m_group = nullptr;
-    std::wstring m_accessPath;
-    std::wstring m_itemId;
-    BOOL m_active = FALSE;
-    ActiveItemList::iterator m_activePosition;
+    // What the network writes at every update and the scan reads at every
+    // period comes first, next to the lock, so that both touch few cache
+    // lines of items that are not in the cache any more.
+    CVariant m_deviceValue;
+    FILETIME m_deviceTime = {};
+    WORD m_deviceQuality = 0xC0;
+    WORD m_lastQuality = 0x00;
+    HRESULT m_lastReadResult = S_OK;
+    CManualResetEvent m_valueArrived; // created unsignalled
+    CVariant m_lastValue;
+    FILETIME m_lastTime = {};
     OPCHANDLE m_clientHandle = 0;
-    OPCHANDLE m_serverHandle = 0;
     DWORD m_accessRights = 3;
     VARTYPE m_requestedType = VT_EMPTY;
     VARTYPE m_canonicalType = VT_EMPTY;
-    CVariant m_lastValue;
-    WORD m_lastQuality = 0x00;
-    FILETIME m_lastTime = {};
-    HRESULT m_lastReadResult = S_OK;
+    BOOL m_active = FALSE;
+    CItemOwner *m_group = nullptr;
+    std::wstring m_accessPath;
+    std::wstring m_itemId;
+    ActiveItemList::iterator m_activePosition;
+    OPCHANDLE m_serverHandle = 0;
     CVariant m_lastWritten;
     HRESULT m_writeResult = S_OK;
-    CVariant m_deviceValue;
-    WORD m_deviceQuality = 0xC0;
-    FILETIME m_deviceTime = {};
-    CManualResetEvent m_valueArrived; // created unsignalled
     CadroDataItem *m_dataItem = nullptr;
 };

@@ -121,7 +121,8 @@ HRESULT CadroValueToVariant(const CadroValue &value, VARIANT *out)
         hr = E_FAIL;
         break;
     }
-    VariantClear(out);
+    if (!IsPlainVariant(*out))
+        VariantClear(out);
     *out = v;
     return hr;
 }
@@ -211,8 +212,39 @@ bool VariantEquals(const VARIANT &a, const VARIANT &b)
     }
 }
 
+bool IsPlainVariant(const VARIANT &value)
+{
+    switch (V_VT(&value)) {
+    case VT_EMPTY:
+    case VT_NULL:
+    case VT_I1:
+    case VT_I2:
+    case VT_I4:
+    case VT_I8:
+    case VT_UI1:
+    case VT_UI2:
+    case VT_UI4:
+    case VT_UI8:
+    case VT_INT:
+    case VT_UINT:
+    case VT_R4:
+    case VT_R8:
+    case VT_CY:
+    case VT_DATE:
+    case VT_BOOL:
+    case VT_ERROR:
+        return true;
+    default:
+        return false;
+    }
+}
+
 HRESULT CopyVariant(VARIANT *target, const VARIANT &source)
 {
+    if (IsPlainVariant(source) && IsPlainVariant(*target)) {
+        *target = source;
+        return S_OK;
+    }
     VariantClear(target);
     HRESULT hr = VariantCopy(target, const_cast<VARIANT *>(&source));
     if (FAILED(hr)) {

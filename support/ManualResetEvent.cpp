@@ -2,6 +2,8 @@
 
 void CManualResetEvent::Set()
 {
+    if (m_signalled.load(std::memory_order_acquire))
+        return; // a Reset racing with this Set may win: as if it came after
     CSingleLock lock(&m_lock);
     if (!m_signalled) {
         m_signalled = true;

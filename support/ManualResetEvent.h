@@ -5,6 +5,7 @@
 // create, set and close.
 #include "SyncObject.h"
 
+#include <atomic>
 #include <windows.h>
 
 class CManualResetEvent {
@@ -19,7 +20,9 @@ public:
     bool Wait(DWORD timeoutMs);
 
 private:
+    // Read without the lock by Set, which the network calls at every value:
+    // setting a set event changes nothing and needs no lock.
+    std::atomic<bool> m_signalled{false};
     CCriticalSection m_lock;
     CONDITION_VARIABLE m_changed;
-    bool m_signalled = false;
 };

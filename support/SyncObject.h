@@ -9,10 +9,14 @@ public:
     virtual BOOL Unlock() = 0;
 };
 
-// A recursive Win32 critical section; the timeout is ignored.
+// A recursive Win32 critical section; the timeout is ignored. It spins a
+// while before it sleeps: the item locks are held for a few instructions, and
+// the scan and the network's delivery thread walk the same items, so a lock
+// that slept at once would make them wait for each other item after item.
 class CCriticalSection : public CSyncObject {
 public:
-    CCriticalSection() { InitializeCriticalSection(&m_cs); }
+    CCriticalSection() { InitializeCriticalSectionAndSpinCount(&m_cs, kSpinCount); }
+    static constexpr DWORD kSpinCount = 4000;
     ~CCriticalSection() override { DeleteCriticalSection(&m_cs); }
     CCriticalSection(const CCriticalSection &) = delete;
     CCriticalSection &operator=(const CCriticalSection &) = delete;

@@ -133,4 +133,21 @@ TEST(ValueConversion, ClientConversionsReportOverflowAndMismatch)
     MoveVariant(moved.Get(), target.Get());
     EXPECT_EQ(V_VT(target.Get()), VT_EMPTY);
     EXPECT_EQ(V_R8(moved.Get()), 2.5);
+
+    // Copies between owning and plain values keep owning copies: text over
+    // a number is a copy of its own, and a number over text frees the text.
+    Var text(L"pump");
+    EXPECT_EQ(CopyVariant(moved.Get(), text.Value()), S_OK);
+    ASSERT_EQ(V_VT(moved.Get()), VT_BSTR);
+    EXPECT_NE(V_BSTR(moved.Get()), V_BSTR(text.Get()));
+    EXPECT_STREQ(V_BSTR(moved.Get()), L"pump");
+    EXPECT_EQ(CopyVariant(moved.Get(), Var(7.0).Value()), S_OK);
+    EXPECT_EQ(V_VT(moved.Get()), VT_R8);
+    EXPECT_TRUE(IsPlainVariant(moved.Value()));
+    EXPECT_FALSE(IsPlainVariant(text.Value()));
+    CadroValue number = {};
+    number.type = kCadroNumber;
+    number.number = 3;
+    EXPECT_EQ(CadroValueToVariant(number, text.Get()), S_OK); // the text is freed, not overwritten
+    EXPECT_EQ(V_R8(text.Get()), 3.0);
 }
