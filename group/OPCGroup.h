@@ -229,6 +229,19 @@ private:
         std::function<HRESULT(DWORD id, const std::vector<DWORD> &passed, std::unique_ptr<class CTransaction> &made)>;
     HRESULT QueueRequest(DWORD count, const OPCHANDLE *handles, const RequestChecks &checks, DWORD *pId,
                          HRESULT **ppErrors, const MakeTransaction &make);
+    // The transaction of a write of either version: the values of the items
+    // that passed, copied.
+    template <class Write>
+    MakeTransaction WriteTransaction(DWORD request, const OPCHANDLE *handles, const VARIANT *values)
+    {
+        return [this, request, handles, values](DWORD id, const std::vector<DWORD> &passed,
+                                                std::unique_ptr<class CTransaction> &made) {
+            auto t = std::make_unique<Write>(id, this, request);
+            HRESULT hr = t->Add(handles, values, passed);
+            made = std::move(t);
+            return hr;
+        };
+    }
     // Refresh and Refresh2: the same checks, on the active items.
     using MakeRefresh = std::function<std::unique_ptr<class CTransaction>(DWORD id)>;
     HRESULT QueueRefresh(OPCDATASOURCE source, HRESULT connection, DWORD *pId, const MakeRefresh &make);

@@ -139,12 +139,7 @@ STDMETHODIMP COPCGroup::Write(DWORD dwCount, OPCHANDLE *phServer, VARIANT *pItem
         checks.connection = CallbackConnection();
         checks.rights = OPC_WRITEABLE;
         return QueueRequest(dwCount, phServer, checks, pdwCancelID, ppErrors,
-                            [&](DWORD id, const std::vector<DWORD> &passed, std::unique_ptr<CTransaction> &made) {
-                                auto t = std::make_unique<CWrite2Transaction>(id, this, dwTransactionID);
-                                HRESULT hr = t->Add(phServer, pItemValues, passed);
-                                made = std::move(t);
-                                return hr;
-                            });
+                            WriteTransaction<CWrite2Transaction>(dwTransactionID, phServer, pItemValues));
     });
 }
 

@@ -148,12 +148,7 @@ STDMETHODIMP COPCGroup::Write(DWORD dwConnection, DWORD dwCount, OPCHANDLE *phSe
         checks.connection = AdviseConnection(dwConnection, true);
         checks.allOrNothing = true;
         return QueueRequest(dwCount, phServer, checks, pTransactionID, ppErrors,
-                            [&](DWORD id, const std::vector<DWORD> &passed, std::unique_ptr<CTransaction> &made) {
-                                auto t = std::make_unique<CWriteTransaction>(id, this, dwConnection);
-                                HRESULT hr = t->Add(phServer, pItemValues, passed);
-                                made = std::move(t);
-                                return hr;
-                            });
+                            WriteTransaction<CWriteTransaction>(dwConnection, phServer, pItemValues));
     });
 }
 

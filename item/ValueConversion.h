@@ -39,10 +39,8 @@ HRESULT VariantToCadroValue(const VARIANT &value, CCadroValue &out);
 HRESULT IsConvertible(VARTYPE canonical, VARTYPE requested);
 bool VariantEquals(const VARIANT &a, const VARIANT &b);
 
-// True for the types that own nothing (numbers, dates, booleans, codes):
-// copying or clearing them is a plain copy of the 16 bytes, which the scan
-// and the network's updates do for every item without calls into OLE
-// Automation.
+// A value that owns nothing: the scan and the network's updates copy and
+// clear these for every item without calls into OLE Automation.
 bool IsPlainVariant(const VARIANT &value);
 // The copy rule: clear the target, VariantCopy; a failed copy leaves VT_ERROR
 // holding the failure code.

@@ -1,5 +1,7 @@
 #include "DataStream.h"
 
+#include "Variant.h"
+
 #include <cstring>
 
 namespace {
@@ -18,34 +20,6 @@ WORD Word(const BYTE *p)
     return v;
 }
 
-bool IsPlainValue(VARTYPE type)
-{
-    switch (type) {
-    case VT_EMPTY:
-    case VT_NULL:
-    case VT_I1:
-    case VT_UI1:
-    case VT_I2:
-    case VT_UI2:
-    case VT_I4:
-    case VT_UI4:
-    case VT_INT:
-    case VT_UINT:
-    case VT_I8:
-    case VT_UI8:
-    case VT_R4:
-    case VT_R8:
-    case VT_CY:
-    case VT_DATE:
-    case VT_BOOL:
-    case VT_ERROR:
-    case VT_DECIMAL:
-        return true;
-    default:
-        return false;
-    }
-}
-
 // The value at offset, into out; strings follow their VARIANT as a byte
 // length, the characters and a terminator.
 bool ReadValue(const BYTE *bytes, size_t size, size_t offset, VARIANT &out)
@@ -56,7 +30,7 @@ bool ReadValue(const BYTE *bytes, size_t size, size_t offset, VARIANT &out)
     if (type != VT_BSTR) {
         // Only plain values are copied: pointers (arrays, references,
         // interfaces) mean nothing outside the sender's process.
-        if (IsPlainValue(type))
+        if (IsPlainType(type))
             memcpy(&out, bytes + offset, kValue);
         return true;
     }
