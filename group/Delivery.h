@@ -3,7 +3,7 @@
 // the scan's change check. The values are owned and cleared with it.
 #include "OPCGroup.h"
 #include "OpcErrors.h"
-#include "ValueConversion.h"
+#include "Variant.h"
 
 #include <vector>
 
@@ -19,8 +19,8 @@ struct Delivery {
         for (VARIANT &v : values)
             VariantInit(&v);
     }
-    // The values of the results are moved in.
-    explicit Delivery(const std::vector<COPCGroup::ReadResult> &results) : Delivery(results.size())
+    // Takes over the values of the results.
+    explicit Delivery(std::vector<COPCGroup::ReadResult> &&results) : Delivery(results.size())
     {
         for (size_t i = 0; i < results.size(); ++i) {
             clients[i] = results[i].client;
@@ -29,6 +29,7 @@ struct Delivery {
             times[i] = results[i].time;
             errors[i] = results[i].error;
         }
+        results.clear();
     }
     ~Delivery()
     {

@@ -64,9 +64,8 @@ HRESULT COPCGroup::QueueRequest(DWORD count, const OPCHANDLE *handles, const Req
     std::vector<DWORD> passed;
     for (DWORD i = 0; i < count; ++i) {
         COPCItem *item = FindItem(handles[i]);
-        errors[i] = !item                                                     ? OPC_E_INVALIDHANDLE
-                    : (item->AccessRights() & checks.rights) != checks.rights ? OPC_E_BADRIGHTS
-                                                                              : S_OK;
+        bool allowed = item && (checks.rights == 0 || (item->AccessRights() & checks.rights) == checks.rights);
+        errors[i] = !item ? OPC_E_INVALIDHANDLE : !allowed ? OPC_E_BADRIGHTS : S_OK;
         if (errors[i] == S_OK)
             passed.push_back(i);
     }
@@ -196,7 +195,7 @@ HRESULT COPCGroup::SendReadResults(CSingleLock &lock, DWORD clientId, OPCDATASOU
 {
     std::vector<ReadResult> results;
     HRESULT overall = ReadPass(source, static_cast<DWORD>(handles.size()), handles.data(), results);
-    Delivery d(results);
+    Delivery d(std::move(results));
     ComPtr<IOPCDataCallback> sink = m_callback.Sink<IOPCDataCallback>();
     if (!sink)
         return E_FAIL;
@@ -302,9 +301,7 @@ BOOL COPCGroup::Scan(LONGLONG &next)
             item->CheckChanged(m_deadbandFraction, &d.clients[n], &d.values[n], &d.qualities[n], &d.times[n], &changed);
         d.errors[n] = hr;
         if (changed)
-            ++n;
-        else if (V_VT(&d.values[n]) != VT_EMPTY)
-            VariantClear(&d.values[n]);
+            ++n; // an unchanged item leaves its row's value empty
     }
     if (n == 0)
         return TRUE; // nothing changed: nothing is sent

@@ -88,7 +88,7 @@ HRESULT COPCGroup::ExecuteRead(DWORD connection, DWORD id, OPCDATASOURCE source,
     CSingleLock lock(&m_lock);
     std::vector<ReadResult> results;
     HRESULT overall = ReadPass(source, static_cast<DWORD>(handles.size()), handles.data(), results);
-    Delivery d(results);
+    Delivery d(std::move(results));
     return SendReadComplete(connection, id, overall, d.Count(), d.clients.data(), d.values.data(), d.qualities.data(),
                             d.times.data());
 }

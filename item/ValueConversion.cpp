@@ -212,11 +212,6 @@ bool VariantEquals(const VARIANT &a, const VARIANT &b)
     }
 }
 
-bool IsPlainVariant(const VARIANT &value)
-{
-    return IsPlainType(V_VT(&value));
-}
-
 HRESULT CopyVariant(VARIANT *target, const VARIANT &source)
 {
     if (IsPlainVariant(source) && IsPlainVariant(*target)) {

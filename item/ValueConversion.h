@@ -39,9 +39,6 @@ HRESULT VariantToCadroValue(const VARIANT &value, CCadroValue &out);
 HRESULT IsConvertible(VARTYPE canonical, VARTYPE requested);
 bool VariantEquals(const VARIANT &a, const VARIANT &b);
 
-// A value that owns nothing: the scan and the network's updates copy and
-// clear these for every item without calls into OLE Automation.
-bool IsPlainVariant(const VARIANT &value);
 // The copy rule: clear the target, VariantCopy; a failed copy leaves VT_ERROR
 // holding the failure code.
 HRESULT CopyVariant(VARIANT *target, const VARIANT &source);

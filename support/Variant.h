@@ -55,3 +55,10 @@ inline bool IsPlainType(VARTYPE type)
         return false;
     }
 }
+
+// A value that owns nothing: the scan and the network's updates copy and
+// clear these for every item without calls into OLE Automation.
+inline bool IsPlainVariant(const VARIANT &value)
+{
+    return IsPlainType(V_VT(&value));
+}
