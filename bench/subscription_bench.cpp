@@ -13,6 +13,7 @@
 #include "CadroSim.h"
 #include "ClassFactory.h"
 #include "ComPtr.h"
+#include "GroupState.h"
 #include "Handle.h"
 #include "OPCGroup.h"
 #include "opcda.h"
@@ -157,18 +158,7 @@ public:
     OurGroup &operator=(const OurGroup &) = delete;
 
     // False when failed deliveries made the server deactivate the group.
-    bool Active()
-    {
-        DWORD rate, lcid;
-        BOOL active = FALSE;
-        LPWSTR name = nullptr;
-        LONG bias;
-        FLOAT deadband;
-        OPCHANDLE client, handle;
-        m_state->GetState(&rate, &active, &name, &bias, &deadband, &lcid, &client, &handle);
-        CoTaskMemFree(name);
-        return active != FALSE;
-    }
+    bool Active() { return StateOf(m_state.Get()).active != FALSE; }
     CountingSink *Sink() { return m_sink.Get(); }
 
 private:

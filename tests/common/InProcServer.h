@@ -3,6 +3,7 @@
 // server's own class object.
 #include "ClassFactory.h"
 #include "ComPtr.h"
+#include "GroupState.h"
 #include "TaskMem.h"
 #include "opcda.h"
 
@@ -32,30 +33,6 @@ inline AddedGroup AddGroup(IOPCServer *server, const wchar_t *name, DWORD rate =
     g.hr = server->AddGroup(name, active, rate, 42, bias, deadband, 0x409, &g.handle, &g.revisedRate,
                             IID_IOPCGroupStateMgt, reinterpret_cast<IUnknown **>(g.group.Out()));
     return g;
-}
-
-struct GroupState {
-    HRESULT hr = E_FAIL;
-    DWORD rate = 0;
-    BOOL active = FALSE;
-    std::wstring name;
-    LONG bias = 0;
-    FLOAT deadband = 0;
-    DWORD lcid = 0;
-    OPCHANDLE client = 0;
-    OPCHANDLE server = 0;
-};
-
-inline GroupState StateOf(IOPCGroupStateMgt *group)
-{
-    GroupState s;
-    LPWSTR name = nullptr;
-    s.hr = group->GetState(&s.rate, &s.active, &name, &s.bias, &s.deadband, &s.lcid, &s.client, &s.server);
-    if (name) {
-        s.name = name;
-        CoTaskMemFree(name);
-    }
-    return s;
 }
 
 inline DWORD GroupCount(IOPCServer *server)

@@ -1,6 +1,7 @@
 // DA 2.0 subscriptions across the process boundary: the sink lives in this
 // process, the server calls it back while cadroctl publishes values.
 #include "ComPtr.h"
+#include "GroupState.h"
 #include "OpcErrors.h"
 #include "ServerProcess.h"
 #include "TestSink.h"
@@ -157,15 +158,7 @@ TEST_F(SubscriptionE2E, CancelledReadsSendNothingAndFailingSinksDeactivateTheGro
     EXPECT_EQ(Publish(std::wstring(kTemperature) + L" 3"), 0);
     bool active = true;
     for (int i = 0; i < 100 && active; ++i, Sleep(50)) {
-        DWORD rate, lcid;
-        BOOL a;
-        LPWSTR name = nullptr;
-        LONG bias;
-        FLOAT deadband;
-        OPCHANDLE c, s;
-        state->GetState(&rate, &a, &name, &bias, &deadband, &lcid, &c, &s);
-        CoTaskMemFree(name);
-        active = a != FALSE;
+        active = StateOf(state.Get()).active != FALSE;
         if (active)
             Publish(std::wstring(kTemperature) + L" " + std::to_wstring(10 + i));
     }
