@@ -4,8 +4,10 @@
 // network reported.
 #include <oaidl.h>
 
+#include <cstdint>
 #include <memory>
 #include <string>
+#include <string_view>
 #include <vector>
 
 class CAddrNode;
@@ -15,7 +17,7 @@ class CAddrNode {
 public:
     virtual ~CAddrNode() = default;
 
-    bool IsBranch() const { return m_children != nullptr; }
+    bool IsBranch() const { return m_branch != nullptr; }
     bool IsRoot() const { return m_isRoot; }
     // Dropped from the tree by a refresh while something still held it.
     bool IsDetached() const { return m_detached; }
@@ -23,23 +25,41 @@ public:
     // the root. False when an ancestor has gone.
     bool ItemId(std::wstring &out) const;
     const std::wstring &DisplayName() const { return m_displayName; }
-    const std::wstring &IdPart() const { return m_idPart; }
-    const std::wstring &Separator() const { return m_separator; }
+    // A member's part is the display name up to its first "-" (or nothing,
+    // for "(implicit)"); only root children keep a text of their own.
+    std::wstring_view IdPart() const
+    {
+        return m_ownIdPart ? std::wstring_view(*m_ownIdPart)
+                           : std::wstring_view(m_displayName).substr(0, m_idPartLength);
+    }
+    std::wstring_view Separator() const { return std::wstring_view(&m_separator, m_separator ? 1 : 0); }
     VARTYPE DataType() const { return m_dataType; }
     DWORD AccessRights() const { return m_accessRights; }
     AddrNodePtr Parent() const { return m_parent.lock(); }
-    std::vector<AddrNodePtr> *Children() { return m_children.get(); }
+    std::vector<AddrNodePtr> *Children() { return m_branch ? &m_branch->children : nullptr; }
 
 private:
     friend class CAddrSpace;
 
+    // What only branches carry: the children in ascending order of part
+    // without regard to case, and the distinct lengths of their parts, which
+    // bound the probes of a lookup step.
+    struct Branch {
+        std::vector<AddrNodePtr> children;
+        std::vector<uint32_t> partLengths;
+    };
+
     std::weak_ptr<CAddrNode> m_parent;
-    std::unique_ptr<std::vector<AddrNodePtr>> m_children; // null for a leaf
+    std::unique_ptr<Branch> m_branch; // null for a leaf
+    std::wstring m_displayName;
+    std::unique_ptr<std::wstring> m_ownIdPart; // root children: the configured URL
+    uint64_t m_refreshPass = 0;                // the call pass that last read the children
+    HRESULT m_refreshResult = S_OK;            // and what that read gave
+    uint64_t m_seenMark = 0;                   // a refresh's mark on the children it was told about
+    uint32_t m_idPartLength = 0;
     DWORD m_accessRights = 3;
     VARTYPE m_dataType = VT_EMPTY;
-    std::wstring m_separator;
-    std::wstring m_displayName;
-    std::wstring m_idPart;
+    wchar_t m_separator = 0; // the network's kind character; 0 for none
     bool m_isRoot = false;
     bool m_detached = false;
 };

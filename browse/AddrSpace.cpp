@@ -1,5 +1,6 @@
 #include "AddrSpace.h"
 
+#include "CallPass.h"
 #include "CodePage.h"
 #include "OpcErrors.h"
 #include "Trace.h"
@@ -7,9 +8,10 @@
 #include "tw/hmx/exception/Exception.h"
 #include "tw/hmx/osdep/WideToAnsi.h"
 
+#include <algorithm>
 #include <cstring>
 #include <cwctype>
-#include <map>
+#include <iterator>
 #include <new>
 #include <vector>
 
@@ -27,20 +29,48 @@ wchar_t Fold(wchar_t c)
     return static_cast<wchar_t>(towupper(c));
 }
 
-struct NoCaseStringLess {
-    bool operator()(const std::wstring &a, const std::wstring &b) const
-    {
-        size_t n = a.size() < b.size() ? a.size() : b.size();
-        for (size_t i = 0; i < n; ++i) {
-            if (a[i] == b[i])
-                continue;
-            wchar_t x = Fold(a[i]), y = Fold(b[i]);
-            if (x != y)
-                return x < y;
-        }
-        return a.size() < b.size();
+int CompareNoCase(std::wstring_view a, std::wstring_view b)
+{
+    size_t n = a.size() < b.size() ? a.size() : b.size();
+    for (size_t i = 0; i < n; ++i) {
+        if (a[i] == b[i])
+            continue;
+        wchar_t x = Fold(a[i]), y = Fold(b[i]);
+        if (x != y)
+            return x < y ? -1 : 1;
     }
-};
+    return a.size() < b.size() ? -1 : a.size() > b.size() ? 1 : 0;
+}
+
+bool PartLess(const AddrNodePtr &a, const AddrNodePtr &b)
+{
+    return CompareNoCase(a->IdPart(), b->IdPart()) < 0;
+}
+
+// The child whose part equals part without regard to case (at most one: a
+// refresh keeps one of names that differ only in case); null when none.
+const AddrNodePtr *FindPart(const std::vector<AddrNodePtr> &children, std::wstring_view part)
+{
+    auto it = std::lower_bound(children.begin(), children.end(), part, [](const AddrNodePtr &c, std::wstring_view p) {
+        return CompareNoCase(c->IdPart(), p) < 0;
+    });
+    return it != children.end() && CompareNoCase((*it)->IdPart(), part) == 0 ? &*it : nullptr;
+}
+
+// A record's name as the tree shows it: "???" without one, and without the
+// two leading backslashes of a machine.
+std::wstring_view RecordName(const BrowseRecord &r)
+{
+    std::wstring_view name = !(r.mask & kBrowseName) ? L"???" : r.name ? r.name : L"";
+    if (name.size() >= 2 && name[0] == L'\\' && name[1] == L'\\')
+        name.remove_prefix(2);
+    return name;
+}
+
+bool IsMemberRecord(const BrowseRecord &r)
+{
+    return (r.mask & kBrowseKind) && r.kind == L'.';
+}
 
 // The host name in 8-bit text. Through ICU's default converter when ICU is
 // there; without ICU the system code page does it (with "?" for what it
@@ -83,20 +113,27 @@ HKEY OpenRootsKey(bool &created)
 
 bool CAddrNode::ItemId(std::wstring &out) const
 {
-    std::vector<const CAddrNode *> chain;
-    std::vector<AddrNodePtr> keep; // ancestors stay alive while the text is built
-    for (const CAddrNode *n = this; n && !n->m_isRoot;) {
-        chain.push_back(n);
+    // Twice up the parents: once for the length, once to fill from the end,
+    // so that the text is built in place.
+    size_t length = 0;
+    for (const CAddrNode *n = this; !n->m_isRoot;) {
+        length += n->IdPart().empty() ? 0 : n->Separator().size() + n->IdPart().size();
         AddrNodePtr parent = n->m_parent.lock();
         if (!parent)
             return false;
-        keep.push_back(parent);
-        n = parent.get();
+        n = parent.get(); // held by its own parent, under the tree's lock
     }
-    out.clear();
-    for (auto it = chain.rbegin(); it != chain.rend(); ++it)
-        if (!(*it)->m_idPart.empty())
-            out += (*it)->m_separator + (*it)->m_idPart;
+    out.assign(length, L'\0');
+    size_t end = length;
+    for (const CAddrNode *n = this; !n->m_isRoot; n = n->m_parent.lock().get()) {
+        std::wstring_view part = n->IdPart();
+        if (part.empty())
+            continue;
+        end -= part.size();
+        part.copy(&out[end], part.size());
+        end -= n->Separator().size();
+        n->Separator().copy(&out[end], n->Separator().size());
+    }
     return true;
 }
 
@@ -109,7 +146,7 @@ CAddrSpace::CAddrSpace() : m_root(std::make_shared<CAddrNode>())
 {
     m_root->m_isRoot = true;
     m_root->m_displayName = L"<<< ROOT >>>";
-    m_root->m_children = std::make_unique<std::vector<AddrNodePtr>>();
+    m_root->m_branch = std::make_unique<CAddrNode::Branch>();
 }
 
 void CAddrSpace::SetBrowserSource(BrowserSource source)
@@ -123,10 +160,10 @@ void CAddrSpace::AddRoot(const std::wstring &name, const std::wstring &url)
     auto node = std::make_shared<CAddrNode>();
     node->m_parent = m_root;
     node->m_displayName = name;
-    node->m_idPart = url;
+    node->m_ownIdPart = std::make_unique<std::wstring>(url);
     node->m_accessRights = 3;
-    node->m_children = std::make_unique<std::vector<AddrNodePtr>>();
-    m_root->m_children->push_back(node);
+    node->m_branch = std::make_unique<CAddrNode::Branch>();
+    m_root->m_branch->children.push_back(node);
 }
 
 void CAddrSpace::AddRoots(const std::string &text)
@@ -174,14 +211,12 @@ HRESULT CAddrSpace::Build()
     return S_OK;
 }
 
-std::wstring CAddrSpace::IdPartOf(const BrowseRecord &r)
+std::wstring_view CAddrSpace::IdPartOf(const BrowseRecord &r)
 {
-    std::wstring name = !(r.mask & kBrowseName) ? L"???" : r.name ? r.name : L"";
-    if (name.size() >= 2 && name[0] == L'\\' && name[1] == L'\\')
-        name.erase(0, 2);
-    if ((r.mask & kBrowseKind) && r.kind == L'.') {
+    std::wstring_view name = RecordName(r);
+    if (IsMemberRecord(r)) {
         if (name == L"(implicit)")
-            return L"";
+            return {};
         return name.substr(0, name.find(L'-'));
     }
     return name;
@@ -190,28 +225,18 @@ std::wstring CAddrSpace::IdPartOf(const BrowseRecord &r)
 AddrNodePtr CAddrSpace::MakeNode(const BrowseRecord &r)
 {
     auto node = std::make_shared<CAddrNode>();
-    wchar_t kind = (r.mask & kBrowseKind) ? static_cast<wchar_t>(r.kind) : 0;
-    std::wstring name = !(r.mask & kBrowseName) ? L"???" : r.name ? r.name : L"";
-    if (name.size() >= 2 && name[0] == L'\\' && name[1] == L'\\')
-        name.erase(0, 2);
+    std::wstring_view name = RecordName(r);
     bool leaf = (r.mask & kBrowseFlags) && (r.flags & 1);
     node->m_dataType = NetworkTypeToVarType((r.mask & kBrowseDataType) ? r.dataType : 0);
     uint16_t access = (r.mask & kBrowseAccess) ? r.access : 3;
     node->m_accessRights = ((access & 1) ? OPC_READABLE : 0) | ((access & 2) ? OPC_WRITEABLE : 0);
-    node->m_separator = kind ? std::wstring(1, kind) : std::wstring();
-    node->m_displayName = name;
-    node->m_idPart = name;
-    if (kind == L'.') {
-        size_t dash = name.find(L'-');
-        if (name == L"(implicit)") {
-            node->m_separator.clear();
-            node->m_idPart.clear();
-        } else if (dash != std::wstring::npos) {
-            node->m_idPart = name.substr(0, dash);
-        }
-    }
+    node->m_separator = (r.mask & kBrowseKind) ? static_cast<wchar_t>(r.kind) : 0;
+    node->m_displayName.assign(name);
+    node->m_idPartLength = static_cast<uint32_t>(IdPartOf(r).size()); // always a prefix of the name
+    if (IsMemberRecord(r) && name == L"(implicit)")
+        node->m_separator = 0;
     if (!leaf)
-        node->m_children = std::make_unique<std::vector<AddrNodePtr>>();
+        node->m_branch = std::make_unique<CAddrNode::Branch>();
     return node;
 }
 
@@ -220,52 +245,120 @@ HRESULT CAddrSpace::Refresh(const AddrNodePtr &node)
     CSingleLock lock(&m_lock);
     if (!node->IsBranch() || node->IsRoot())
         return S_OK;
-    std::wstring url;
+    uint64_t pass = CCallPass::Current();
+    if (pass != 0 && node->m_refreshPass == pass)
+        return node->m_refreshResult;
+    HRESULT hr = ReadChildren(node);
+    node->m_refreshPass = pass;
+    node->m_refreshResult = hr;
+    return hr;
+}
+
+HRESULT CAddrSpace::ReadChildren(const AddrNodePtr &node)
+{
     Browser browser;
-    if (node->IsDetached() || !node->ItemId(url) || !m_browserSource || !m_browserSource(browser))
+    if (node->IsDetached() || !node->ItemId(m_url) || !m_browserSource || !m_browserSource(browser))
         return OPC_E_UNKNOWNITEMID;
-    if (FAILED(browser.open(url.c_str())))
+    if (FAILED(browser.open(m_url.c_str())))
         return OPC_E_UNKNOWNITEMID;
 
-    // Children by identifier part without regard to case: a reported name
-    // that the tree has keeps its node (and subtree); only new names get new
-    // nodes; the first of names equal but for case wins.
-    std::map<std::wstring, AddrNodePtr, NoCaseStringLess> old;
-    for (const AddrNodePtr &child : *node->m_children)
-        old.emplace(child->m_idPart, child);
-    std::map<std::wstring, AddrNodePtr, NoCaseStringLess> fresh;
+    // Each record is looked up among the present children by its part
+    // without regard to case and marks the child it finds: a name the tree
+    // has keeps its node (and subtree); only names it lacks make new nodes,
+    // and the first of names equal but for case wins. Nothing is allocated
+    // unless the network reported something the tree lacks.
+    std::vector<AddrNodePtr> &children = node->m_branch->children;
+    uint64_t mark = ++m_lastMark;
+    size_t seen = 0;
+    std::vector<AddrNodePtr> fresh;
     BrowseRecord record = {};
     while (SUCCEEDED(browser.next(&record))) {
-        std::wstring part = IdPartOf(record);
-        if (!fresh.count(part)) {
-            auto kept = old.find(part);
-            fresh.emplace(part, kept != old.end() ? kept->second : MakeNode(record));
+        if (const AddrNodePtr *known = FindPart(children, IdPartOf(record))) {
+            if ((*known)->m_seenMark != mark) {
+                (*known)->m_seenMark = mark;
+                ++seen;
+            }
+        } else {
+            fresh.push_back(MakeNode(record));
         }
         SysFreeString(record.name);
         SysFreeString(record.description);
         record = {};
     }
-    node->m_children->clear();
-    for (auto &entry : fresh) {
-        entry.second->m_parent = node;
-        node->m_children->push_back(entry.second);
-    }
-    for (auto &entry : old) {
-        auto now = fresh.find(entry.first);
-        if (now == fresh.end() || now->second != entry.second)
-            entry.second->m_detached = true;
-    }
+    if (!fresh.empty() || seen != children.size())
+        Merge(node, fresh);
     return S_OK;
 }
 
-AddrNodePtr CAddrSpace::FindFrom(const AddrNodePtr &node, const std::wstring &text)
+void CAddrSpace::Merge(const AddrNodePtr &node, std::vector<AddrNodePtr> &fresh)
 {
-    std::wstring rest = text;
-    if (!node->IsRoot() && !node->m_idPart.empty()) {
-        const std::wstring head = node->m_separator + node->m_idPart;
-        if (rest.compare(0, head.size(), head) != 0)
+    // New names in order, the first of equal ones kept.
+    std::stable_sort(fresh.begin(), fresh.end(), PartLess);
+    fresh.erase(std::unique(fresh.begin(), fresh.end(),
+                            [](const AddrNodePtr &a, const AddrNodePtr &b) { return !PartLess(a, b); }),
+                fresh.end());
+    std::vector<AddrNodePtr> &children = node->m_branch->children;
+    uint64_t mark = m_lastMark;
+    std::vector<AddrNodePtr> kept;
+    kept.reserve(children.size());
+    for (AddrNodePtr &child : children) {
+        if (child->m_seenMark == mark)
+            kept.push_back(std::move(child));
+        else
+            child->m_detached = true;
+    }
+    children.clear();
+    std::merge(std::make_move_iterator(kept.begin()), std::make_move_iterator(kept.end()),
+               std::make_move_iterator(fresh.begin()), std::make_move_iterator(fresh.end()),
+               std::back_inserter(children), PartLess);
+    std::vector<uint32_t> &lengths = node->m_branch->partLengths;
+    lengths.clear();
+    for (const AddrNodePtr &child : children) {
+        child->m_parent = node;
+        uint32_t length = static_cast<uint32_t>(child->IdPart().size());
+        if (std::find(lengths.begin(), lengths.end(), length) == lengths.end())
+            lengths.push_back(length);
+    }
+}
+
+void CAddrSpace::Candidates(CAddrNode &node, std::wstring_view text, std::vector<AddrNodePtr> &out)
+{
+    out.clear();
+    std::vector<AddrNodePtr> &children = node.m_branch->children;
+    if (node.IsRoot()) {
+        // The registry's roots, in its order, may repeat: tried one by one.
+        out = children;
+        return;
+    }
+    // A child can be the next step only if the text begins with its
+    // separator and part: probe the part at each length that a child's part
+    // has, with and without a separator before it. A part without text
+    // (an implicit member) matches whatever follows, and sorts first.
+    for (uint32_t length : node.m_branch->partLengths) {
+        if (length == 0) {
+            out.push_back(children.front());
+            continue;
+        }
+        for (size_t separator = 0; separator <= 1; ++separator) {
+            if (text.size() < separator + length)
+                continue;
+            const AddrNodePtr *child = FindPart(children, text.substr(separator, length));
+            if (child && (*child)->IdPart() == text.substr(separator, length) &&
+                (*child)->Separator() == text.substr(0, separator))
+                out.push_back(*child);
+        }
+    }
+    std::sort(out.begin(), out.end(), PartLess);
+}
+
+AddrNodePtr CAddrSpace::FindFrom(const AddrNodePtr &node, std::wstring_view text)
+{
+    std::wstring_view rest = text;
+    if (!node->IsRoot() && !node->IdPart().empty()) {
+        std::wstring_view separator = node->Separator(), part = node->IdPart();
+        if (rest.substr(0, separator.size()) != separator || rest.substr(separator.size(), part.size()) != part)
             return nullptr;
-        rest.erase(0, head.size());
+        rest.remove_prefix(separator.size() + part.size());
         if (rest.empty())
             return node;
         if (!node->IsBranch() || FAILED(Refresh(node)))
@@ -273,14 +366,15 @@ AddrNodePtr CAddrSpace::FindFrom(const AddrNodePtr &node, const std::wstring &te
     } else if (!node->IsBranch()) {
         return rest.empty() ? node : nullptr; // an implicit member: only its object's own text
     }
-    std::vector<AddrNodePtr> children = *node->m_children; // a refresh below may change the list
-    for (const AddrNodePtr &child : children)
+    std::vector<AddrNodePtr> candidates;
+    Candidates(*node, rest, candidates);
+    for (const AddrNodePtr &child : candidates)
         if (AddrNodePtr found = FindFrom(child, rest))
             return found;
     return nullptr;
 }
 
-AddrNodePtr CAddrSpace::FindByItemId(const std::wstring &itemId)
+AddrNodePtr CAddrSpace::FindByItemId(std::wstring_view itemId)
 {
     CSingleLock lock(&m_lock);
     return FindFrom(m_root, itemId);
@@ -291,8 +385,9 @@ AddrNodePtr CAddrSpace::FindChild(const AddrNodePtr &node, const std::wstring &n
     CSingleLock lock(&m_lock);
     if (!node->IsBranch())
         return nullptr;
-    for (const AddrNodePtr &child : *node->m_children) {
-        const std::wstring &shown = child->m_displayName.empty() ? child->m_idPart : child->m_displayName;
+    for (const AddrNodePtr &child : *node->Children()) {
+        std::wstring_view shown =
+            child->m_displayName.empty() ? child->IdPart() : std::wstring_view(child->m_displayName);
         if (shown == name)
             return child;
     }

@@ -25,38 +25,57 @@ public:
 
     // Reads a branch's children from the network and merges them in; the
     // root and leaves are left as they are. OPC_E_UNKNOWNITEMID when the
-    // network refuses the browse.
+    // network refuses the browse. Within one client call (a CCallPass) a
+    // node is read once: later refreshes in that call give the first one's
+    // result.
     HRESULT Refresh(const AddrNodePtr &node);
     // The node an item identifier names, descending (and refreshing) from
     // the root; null when none.
-    AddrNodePtr FindByItemId(const std::wstring &itemId);
+    AddrNodePtr FindByItemId(std::wstring_view itemId);
     // The direct child whose display name (or part, without one) equals name
     // exactly; no refresh.
     AddrNodePtr FindChild(const AddrNodePtr &node, const std::wstring &name);
 
     // A node from one browse record of the network, and just the
-    // identifier part such a node would have.
+    // identifier part such a node would have (a view into the record).
     static AddrNodePtr MakeNode(const BrowseRecord &record);
-    static std::wstring IdPartOf(const BrowseRecord &record);
+    static std::wstring_view IdPartOf(const BrowseRecord &record);
     // Adds root children from "name=URL,name=URL" text.
     void AddRoots(const std::string &text);
 
     // How the tree reaches the network: Open(url) then Next(mask, record)
     // until a negative result. Installed by the server's services.
+    // The functions hold no more than a pointer or two: a refresh that
+    // finds nothing changed allocates nothing.
     struct Browser {
         std::function<HRESULT(const wchar_t *url)> open;
         std::function<HRESULT(BrowseRecord *record)> next;
-        std::shared_ptr<void> keep; // keeps the session alive while in use
+        std::function<void()> release; // lets go of the session after use
+        Browser() = default;
+        Browser(const Browser &) = delete;
+        Browser &operator=(const Browser &) = delete;
+        ~Browser()
+        {
+            if (release)
+                release();
+        }
     };
     using BrowserSource = std::function<bool(Browser &browser)>;
     void SetBrowserSource(BrowserSource source);
 
 private:
     CAddrSpace();
-    AddrNodePtr FindFrom(const AddrNodePtr &node, const std::wstring &text);
+    AddrNodePtr FindFrom(const AddrNodePtr &node, std::wstring_view text);
+    // The children of node that the next step of a lookup of text can take,
+    // in list order.
+    void Candidates(CAddrNode &node, std::wstring_view text, std::vector<AddrNodePtr> &out);
+    HRESULT ReadChildren(const AddrNodePtr &node);
+    void Merge(const AddrNodePtr &node, std::vector<AddrNodePtr> &fresh);
     void AddRoot(const std::wstring &name, const std::wstring &url);
 
     CCriticalSection m_lock;
     AddrNodePtr m_root;
     BrowserSource m_browserSource;
+    std::wstring m_url;      // a refresh's browse URL, kept for its capacity
+    uint64_t m_lastMark = 0; // marks of refreshes on the children they saw
 };

@@ -1,5 +1,6 @@
 #include "OPCBrowseServerAddressSpace.h"
 
+#include "CallPass.h"
 #include "ComEnum2.h"
 #include "ComUtil.h"
 #include "OpcErrors.h"
@@ -42,6 +43,7 @@ STDMETHODIMP COPCBrowseServerAddressSpace::QueryOrganization(OPCNAMESPACETYPE *p
 STDMETHODIMP COPCBrowseServerAddressSpace::ChangeBrowsePosition(OPCBROWSEDIRECTION dwBrowseDirection, LPCWSTR szString)
 {
     return ComBoundary([&]() -> HRESULT {
+        CCallPass pass; // each node is read from the network once per call
         CSingleLock lock(&m_space->Lock());
         switch (dwBrowseDirection) {
         case OPC_BROWSE_UP: {
@@ -122,6 +124,7 @@ STDMETHODIMP COPCBrowseServerAddressSpace::BrowseOPCItemIDs(OPCBROWSETYPE dwBrow
                                                             LPENUMSTRING *ppIEnumString)
 {
     return ComBoundary([&]() -> HRESULT {
+        CCallPass pass; // each node is read from the network once per call
         if (!IsWritableOut(ppIEnumString))
             return E_INVALIDARG;
         *ppIEnumString = nullptr;
@@ -152,6 +155,7 @@ STDMETHODIMP COPCBrowseServerAddressSpace::BrowseOPCItemIDs(OPCBROWSETYPE dwBrow
 STDMETHODIMP COPCBrowseServerAddressSpace::GetItemID(LPWSTR szItemDataID, LPWSTR *szItemID)
 {
     return ComBoundary([&]() -> HRESULT {
+        CCallPass pass; // each node is read from the network once per call
         if (!IsWritableOut(szItemID) || !szItemDataID)
             return E_INVALIDARG;
         *szItemID = nullptr;

@@ -217,11 +217,7 @@ std::wstring Engine::SetConnected(const std::vector<std::wstring> &args, bool co
                 shard.Post(s, EventKind::Status, kCadroStatusDisconnected);
                 continue;
             }
-            for (uint32_t status :
-                 {kCadroStatusConnecting, kCadroStatusContacted, kCadroStatusSubscribing, kCadroStatusSubscribed})
-                shard.Post(s, EventKind::Status, status);
-            shard.Post(s, EventKind::Attributes);
-            shard.Post(s, EventKind::Activate);
+            shard.Post(s, EventKind::Open);
         }
     }
     return L"ok\n";
@@ -307,6 +303,7 @@ std::wstring Engine::Status()
     for (auto &m : m_network->Machines())
         out << L"machine " << m->name << (m->connected ? L" connected" : L" disconnected") << L"\n";
     out << L"subscriptions " << m_subscriptionCount.load() << L"\n";
+    out << L"browses " << m_browseCount.load() << L"\n";
     return out.str();
 }
 

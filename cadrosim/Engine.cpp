@@ -60,7 +60,8 @@ Subscription::Subscription(Engine &e, std::shared_ptr<Member> m, ICadroRealTimeR
 
 Subscription::~Subscription()
 {
-    receiver->Release();
+    if (receiver)
+        receiver->Release();
     engine.ReleaseUse();
 }
 
@@ -206,14 +207,11 @@ HRESULT Engine::Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeReceiv
     Shard &shard = *member->shard;
     {
         std::lock_guard<SlimMutex> l(shard.lock);
-        member->subscriptions.push_back(sub);
-        shard.Post(sub, EventKind::Status, kCadroStatusConnecting);
-        if (member->machine->connected) {
-            for (uint32_t status : {kCadroStatusContacted, kCadroStatusSubscribing, kCadroStatusSubscribed})
-                shard.Post(sub, EventKind::Status, status);
-            shard.Post(sub, EventKind::Attributes);
-            shard.Post(sub, EventKind::Activate);
-        }
+        Shard::Attach(sub);
+        if (member->machine->connected)
+            shard.Post(sub, EventKind::Open);
+        else
+            shard.Post(sub, EventKind::Status, kCadroStatusConnecting);
     }
     ++m_subscriptionCount;
     *out = sub;
@@ -225,12 +223,23 @@ void Engine::Unsubscribe(Subscription *sub)
     --m_subscriptionCount;
     Shard &shard = *sub->member->shard;
     std::unique_lock<SlimMutex> l(shard.lock);
-    if (!shard.Detach(sub, l)) {
-        shard.Bury(sub);
+    switch (shard.Release(sub, l)) {
+    case Shard::Disposal::Now:
+        l.unlock();
+        delete sub;
+        return;
+    case Shard::Disposal::AfterQueue: {
+        // Nothing calls it any more: its receiver is let go now, only the
+        // memory waits for the queue.
+        ICadroRealTimeReceiver *receiver = sub->receiver;
+        sub->receiver = nullptr;
+        l.unlock();
+        receiver->Release();
         return;
     }
-    l.unlock();
-    delete sub;
+    case Shard::Disposal::AfterBatch:
+        return;
+    }
 }
 
 HRESULT Engine::Write(Subscription *sub, const CadroValue *value)
@@ -287,6 +296,12 @@ bool Engine::List(const std::wstring &url, std::vector<BrowseEntry> &out)
 {
     std::lock_guard<SlimMutex> l(m_networkLock);
     return m_network->List(url, out);
+}
+
+bool Engine::Browse(const std::wstring &url, std::vector<BrowseEntry> &out)
+{
+    ++m_browseCount;
+    return List(url, out);
 }
 
 void Engine::AddBrowserReceiver(ICadroBrowserReceiver *receiver)

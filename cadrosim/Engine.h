@@ -35,10 +35,16 @@ struct Subscription : CSimUnknown<CadroDataItem> {
     ICadroRealTimeReceiver *receiver;
     void *cookie;
     std::atomic<bool> dead{false};
-    bool active = false; // receives values; guarded by the member's shard
+    // Guarded by the member's shard:
+    bool active = false;   // receives values
+    bool released = false; // its holder let go; deleted once nothing refers to it
+    uint32_t queued = 0;   // events of it in the shard's queue
+    size_t slot = 0;       // its place in the member's subscriptions
 };
 
-enum class EventKind { Status, Attributes, Activate, Value };
+// Open: the whole answer to a subscription on a connected machine (contacted,
+// subscribed, attributes, then values), delivered as one batch.
+enum class EventKind { Status, Attributes, Activate, Value, Open };
 
 struct Event {
     Subscription *sub;
@@ -59,10 +65,16 @@ public:
     // Under lock: queue an event / put a member on the heap.
     void Post(Subscription *sub, EventKind kind, uint32_t status = 0);
     void Schedule(const std::shared_ptr<Member> &member);
-    // Under lock (held by l): ends the subscription's deliveries; false when
-    // the caller is inside this shard's callbacks and must not wait.
-    bool Detach(Subscription *sub, std::unique_lock<SlimMutex> &l);
-    void Bury(Subscription *sub) { m_graveyard.push_back(sub); }
+    // Under lock: a subscription joins or leaves its member's list.
+    static void Attach(Subscription *sub);
+    // Under lock (held by l): ends the subscription's deliveries and says
+    // who deletes it.
+    enum class Disposal {
+        Now,        // the caller, at once
+        AfterQueue, // the shard, when its queued events come up
+        AfterBatch  // the shard, after the batch of callbacks it was released from
+    };
+    Disposal Release(Subscription *sub, std::unique_lock<SlimMutex> &l);
     bool OnShardThread() const { return GetCurrentThreadId() == m_threadId; }
 
 private:
@@ -74,6 +86,9 @@ private:
     };
 
     void Run(unsigned generation);
+    // Deletes, with the lock released, the released subscriptions that
+    // nothing refers to any more.
+    void Sweep(std::unique_lock<SlimMutex> &l);
     void Tick(std::unique_lock<SlimMutex> &l, const std::shared_ptr<Member> &member, Clock::time_point at);
     void Dispatch(std::unique_lock<SlimMutex> &l, Event e);
     // Runs callbacks with the lock released, then wakes waiting releases.
@@ -109,6 +124,8 @@ public:
     HRESULT Write(Subscription *sub, const CadroValue *value);
     HRESULT Read(Subscription *sub, uint32_t *flags, CadroValue *value, int32_t *errorFlag, FILETIME *time);
     bool List(const std::wstring &url, std::vector<BrowseEntry> &out);
+    // A browse session's listing: counted, for "status".
+    bool Browse(const std::wstring &url, std::vector<BrowseEntry> &out);
 
     void AddBrowserReceiver(ICadroBrowserReceiver *receiver);
     void RemoveBrowserReceiver(ICadroBrowserReceiver *receiver);
@@ -163,6 +180,7 @@ private:
     std::chrono::steady_clock::time_point m_epoch;
     std::mt19937 m_random;
     std::atomic<long> m_subscriptionCount{0};
+    std::atomic<unsigned long> m_browseCount{0};
 };
 
 // Runs commands from other programs: one named pipe per engine,

@@ -51,7 +51,7 @@ public:
         m_next = 0;
         if (!url)
             return E_POINTER;
-        return Engine::Instance().List(url, m_entries) ? S_OK : HRESULT_FROM_WIN32(ERROR_NOT_FOUND);
+        return Engine::Instance().Browse(url, m_entries) ? S_OK : HRESULT_FROM_WIN32(ERROR_NOT_FOUND);
     }
 
     HRESULT STDMETHODCALLTYPE Next(uint32_t fieldMask, BrowseRecord *record) override

@@ -99,11 +99,11 @@ Object *Network::FindObject(Process &process, const std::vector<std::wstring> &n
 {
     Object *current = nullptr;
     for (size_t i = 0; i < count; ++i) {
-        auto &children = current ? current->objects : process.objects;
-        auto it = std::find_if(children.begin(), children.end(), [&](auto &o) { return o->name == names[i]; });
-        if (it == children.end())
+        auto &index = current ? current->objectIndex : process.objectIndex;
+        auto it = index.find(names[i]);
+        if (it == index.end())
             return nullptr;
-        current = it->get();
+        current = it->second;
     }
     return current;
 }
@@ -128,8 +128,9 @@ bool Network::ParseUrl(const std::wstring &url, Path &path)
     return true;
 }
 
-Object *Network::FindMemberSlot(const std::wstring &url, std::vector<std::shared_ptr<Member>>::iterator &at)
+Object *Network::FindMemberSlot(const std::wstring &url, std::shared_ptr<Member> &member)
 {
+    member.reset();
     Path path;
     if (!ParseUrl(url, path) || !path.process || path.objects.empty())
         return nullptr;
@@ -137,15 +138,18 @@ Object *Network::FindMemberSlot(const std::wstring &url, std::vector<std::shared
     if (!object)
         return nullptr;
     // An object's own URL names its "(implicit)" member, whose part is empty.
-    const std::wstring id = path.hasMember ? path.member : std::wstring();
-    at = std::find_if(object->members.begin(), object->members.end(), [&](auto &m) { return m->idPart == id; });
-    return at == object->members.end() ? nullptr : object;
+    auto it = object->memberIndex.find(path.hasMember ? path.member : std::wstring());
+    if (it == object->memberIndex.end())
+        return nullptr;
+    member = it->second;
+    return object;
 }
 
 std::shared_ptr<Member> Network::FindMember(const std::wstring &url)
 {
-    std::vector<std::shared_ptr<Member>>::iterator at;
-    return FindMemberSlot(url, at) ? *at : nullptr;
+    std::shared_ptr<Member> member;
+    FindMemberSlot(url, member);
+    return member;
 }
 
 bool Network::List(const std::wstring &url, std::vector<BrowseEntry> &out)
@@ -197,15 +201,17 @@ Object *Network::EnsureObject(const std::wstring &objectUrl, std::wstring &error
     }
     Object *object = nullptr;
     auto *children = &path.process->objects;
+    auto *index = &path.process->objectIndex;
     for (const auto &name : path.objects) {
-        auto it = std::find_if(children->begin(), children->end(), [&](auto &o) { return o->name == name; });
-        if (it == children->end()) {
+        auto it = index->find(name);
+        if (it == index->end()) {
             children->push_back(std::make_unique<Object>());
             children->back()->name = name;
-            it = children->end() - 1;
+            it = index->emplace(name, children->back().get()).first;
         }
-        object = it->get();
+        object = it->second;
         children = &object->objects;
+        index = &object->objectIndex;
     }
     return object;
 }
@@ -221,11 +227,11 @@ bool Network::AddMember(const std::wstring &objectUrl, std::shared_ptr<Member> m
     bool hasMember = false;
     SplitUrl(objectUrl, machineName, segments, ignored, hasMember);
     member->machine = FindMachine(machineName);
-    for (auto &m : object->members) {
-        if (m->idPart == member->idPart) {
-            error = L"the object already has a member " + (m->idPart.empty() ? m->name : m->idPart);
-            return false;
-        }
+    auto added = object->memberIndex.emplace(member->idPart, member);
+    if (!added.second) {
+        const Member &m = *added.first->second;
+        error = L"the object already has a member " + (m.idPart.empty() ? m.name : m.idPart);
+        return false;
     }
     object->members.push_back(std::move(member));
     return true;
@@ -233,12 +239,13 @@ bool Network::AddMember(const std::wstring &objectUrl, std::shared_ptr<Member> m
 
 std::shared_ptr<Member> Network::RemoveMember(const std::wstring &url)
 {
-    std::vector<std::shared_ptr<Member>>::iterator at;
-    Object *object = FindMemberSlot(url, at);
+    std::shared_ptr<Member> removed;
+    Object *object = FindMemberSlot(url, removed);
     if (!object)
         return nullptr;
-    std::shared_ptr<Member> removed = *at;
-    object->members.erase(at);
+    object->memberIndex.erase(removed->idPart);
+    auto &members = object->members;
+    members.erase(std::find(members.begin(), members.end(), removed));
     return removed;
 }
 

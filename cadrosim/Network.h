@@ -7,6 +7,7 @@
 #include <atomic>
 #include <memory>
 #include <string>
+#include <unordered_map>
 #include <vector>
 
 namespace cadrosim {
@@ -49,15 +50,21 @@ struct Member {
     std::vector<Subscription *> subscriptions; // active ones
 };
 
+// Objects and members are listed in the order they were added and found
+// by name through an index, so that a lookup costs the same however many
+// siblings there are.
 struct Object {
     std::wstring name;
     std::vector<std::unique_ptr<Object>> objects;
     std::vector<std::shared_ptr<Member>> members;
+    std::unordered_map<std::wstring, Object *> objectIndex;
+    std::unordered_map<std::wstring, std::shared_ptr<Member>> memberIndex; // by part
 };
 
 struct Process {
     std::wstring name;
     std::vector<std::unique_ptr<Object>> objects;
+    std::unordered_map<std::wstring, Object *> objectIndex;
 };
 
 struct Machine {
@@ -128,8 +135,8 @@ private:
     };
     bool ParseUrl(const std::wstring &url, Path &path);
     Object *FindObject(Process &process, const std::vector<std::wstring> &names, size_t count);
-    // The object holding the member a URL names, with the member's position.
-    Object *FindMemberSlot(const std::wstring &url, std::vector<std::shared_ptr<Member>>::iterator &at);
+    // The object holding the member a URL names, and the member.
+    Object *FindMemberSlot(const std::wstring &url, std::shared_ptr<Member> &member);
 
     std::wstring m_host;
     std::vector<std::unique_ptr<Machine>> m_machines;

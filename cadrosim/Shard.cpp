@@ -48,8 +48,20 @@ void Shard::Stop()
 
 void Shard::Post(Subscription *sub, EventKind kind, uint32_t status)
 {
+    ++sub->queued;
+    // The thread sleeps only on an empty queue: waking it for every event
+    // would cost a system call each.
+    bool wake = m_events.empty();
     m_events.push_back({sub, kind, status});
-    m_wake.notify_one();
+    if (wake)
+        m_wake.notify_one();
+}
+
+void Shard::Attach(Subscription *sub)
+{
+    auto &subs = sub->member->subscriptions;
+    sub->slot = subs.size();
+    subs.push_back(sub);
 }
 
 void Shard::Schedule(const std::shared_ptr<Member> &member)
@@ -61,20 +73,41 @@ void Shard::Schedule(const std::shared_ptr<Member> &member)
     m_wake.notify_one();
 }
 
-bool Shard::Detach(Subscription *sub, std::unique_lock<SlimMutex> &l)
+Shard::Disposal Shard::Release(Subscription *sub, std::unique_lock<SlimMutex> &l)
 {
+    // Out of the member's list in one step: the last one takes its place.
     sub->dead = true;
+    sub->released = true;
     auto &subs = sub->member->subscriptions;
-    subs.erase(std::remove(subs.begin(), subs.end(), sub), subs.end());
-    m_events.erase(std::remove_if(m_events.begin(), m_events.end(), [sub](const Event &e) { return e.sub == sub; }),
-                   m_events.end());
-    if (!m_delivering)
-        return true;
-    if (OnShardThread())
-        return false; // released from inside a callback of this batch
-    uint64_t inFlight = m_batchesStarted;
-    m_batchDone.wait(l, [this, inFlight] { return m_batchesFinished >= inFlight; });
-    return true;
+    subs[sub->slot] = subs.back();
+    subs[sub->slot]->slot = sub->slot;
+    subs.pop_back();
+    if (m_delivering) {
+        if (OnShardThread()) {
+            m_graveyard.push_back(sub); // released from inside a callback of this batch
+            return Disposal::AfterBatch;
+        }
+        uint64_t inFlight = m_batchesStarted;
+        m_batchDone.wait(l, [this, inFlight] { return m_batchesFinished >= inFlight; });
+    }
+    // Queued events are skipped when they come up; the last one deletes it.
+    return sub->queued == 0 ? Disposal::Now : Disposal::AfterQueue;
+}
+
+void Shard::Sweep(std::unique_lock<SlimMutex> &l)
+{
+    // Those with events still queued go when the last one comes up.
+    std::vector<Subscription *> dead;
+    for (Subscription *sub : m_graveyard)
+        if (sub->queued == 0)
+            dead.push_back(sub);
+    m_graveyard.clear();
+    if (dead.empty())
+        return;
+    l.unlock();
+    for (Subscription *sub : dead)
+        delete sub;
+    l.lock();
 }
 
 template <class F> void Shard::Deliver(std::unique_lock<SlimMutex> &l, F callbacks)
@@ -89,14 +122,7 @@ template <class F> void Shard::Deliver(std::unique_lock<SlimMutex> &l, F callbac
     m_batchDone.notify_all();
     // Subscriptions released by their own callbacks go now that nothing of
     // this batch refers to them.
-    std::vector<Subscription *> dead;
-    dead.swap(m_graveyard);
-    if (!dead.empty()) {
-        l.unlock();
-        for (Subscription *sub : dead)
-            delete sub;
-        l.lock();
-    }
+    Sweep(l);
 }
 
 void Shard::Run(unsigned generation)
@@ -107,7 +133,17 @@ void Shard::Run(unsigned generation)
         if (!m_events.empty()) {
             Event e = m_events.front();
             m_events.pop_front();
-            Dispatch(l, e);
+            Subscription *sub = e.sub;
+            --sub->queued;
+            if (!sub->dead) {
+                Dispatch(l, e);
+            } else if (sub->released && sub->queued == 0) {
+                // Its holder let go while this event waited: the last
+                // reference to it was this event.
+                l.unlock();
+                delete sub;
+                l.lock();
+            }
             continue;
         }
         if (!m_heap.empty() && m_heap.top().at <= Clock::now()) {
@@ -163,6 +199,25 @@ void Shard::Dispatch(std::unique_lock<SlimMutex> &l, Event e)
     Subscription *sub = e.sub;
     Member &m = *sub->member;
     switch (e.kind) {
+    case EventKind::Open: {
+        CadroAttributes a;
+        Attributes(m, a);
+        Deliver(l, [&] {
+            for (uint32_t status :
+                 {kCadroStatusConnecting, kCadroStatusContacted, kCadroStatusSubscribing, kCadroStatusSubscribed}) {
+                if (sub->dead)
+                    return;
+                sub->receiver->StatusChange(sub->cookie, status, 0, 0);
+            }
+            if (!sub->dead)
+                sub->receiver->OnAttributes(sub->cookie, &a);
+        });
+        if (sub->dead)
+            return;
+        e.kind = EventKind::Activate;
+        Dispatch(l, e);
+        return;
+    }
     case EventKind::Status:
         if (e.status == kCadroStatusDisconnected)
             sub->active = false;

@@ -5,6 +5,7 @@
 // tens of microseconds for each subscription the engine is told about.
 #include <windows.h>
 
+#include <atomic>
 #include <chrono>
 #include <mutex>
 
@@ -29,8 +30,20 @@ public:
     SlimCondition() = default;
     SlimCondition(const SlimCondition &) = delete;
     SlimCondition &operator=(const SlimCondition &) = delete;
-    void notify_one() { WakeConditionVariable(&m_condition); }
-    void notify_all() { WakeAllConditionVariable(&m_condition); }
+    // A wake with nobody asleep is skipped: under Wine it is a system call.
+    // Waiters count themselves under the mutex before they sleep, and a
+    // notifier changes what they wait for under it too, so a waiter either
+    // sees the change or is counted.
+    void notify_one()
+    {
+        if (m_waiters.load() != 0)
+            WakeConditionVariable(&m_condition);
+    }
+    void notify_all()
+    {
+        if (m_waiters.load() != 0)
+            WakeAllConditionVariable(&m_condition);
+    }
     void wait(std::unique_lock<SlimMutex> &l) { Sleep(l, INFINITE); }
     template <class Predicate> void wait(std::unique_lock<SlimMutex> &l, Predicate ready)
     {
@@ -49,9 +62,12 @@ public:
 private:
     void Sleep(std::unique_lock<SlimMutex> &l, DWORD ms)
     {
+        ++m_waiters;
         SleepConditionVariableSRW(&m_condition, l.mutex()->native(), ms, 0);
+        --m_waiters;
     }
     CONDITION_VARIABLE m_condition = CONDITION_VARIABLE_INIT;
+    std::atomic<unsigned> m_waiters{0};
 };
 
 } // namespace cadrosim

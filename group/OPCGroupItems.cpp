@@ -1,5 +1,6 @@
 // IOPCItemMgt of the group: adding, validating, removing and changing items,
 // and the enumerator of their attributes.
+#include "CallPass.h"
 #include "ComUtil.h"
 #include "EnumItemAttributes.h"
 #include "ItemIdChecker.h"
@@ -76,6 +77,7 @@ STDMETHODIMP COPCGroup::AddItems(DWORD dwCount, OPCITEMDEF *pItemArray, OPCITEMR
                                  HRESULT **ppErrors)
 {
     return ComBoundary([&]() -> HRESULT {
+        CCallPass pass; // each node is read from the network once per call
         CSingleLock lock(&m_lock);
         TaskMem<OPCITEMRESULT> results;
         TaskMem<HRESULT> errors;
@@ -121,6 +123,7 @@ STDMETHODIMP COPCGroup::ValidateItems(DWORD dwCount, OPCITEMDEF *pItemArray, BOO
                                       HRESULT **ppErrors)
 {
     return ComBoundary([&]() -> HRESULT {
+        CCallPass pass; // each node is read from the network once per call
         CSingleLock lock(&m_lock);
         TaskMem<OPCITEMRESULT> results;
         TaskMem<HRESULT> errors;

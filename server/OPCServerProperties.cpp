@@ -1,4 +1,5 @@
 // IOPCItemProperties of the server object.
+#include "CallPass.h"
 #include "ComPtr.h"
 #include "ComUtil.h"
 #include "ItemProperties.h"
@@ -61,6 +62,7 @@ STDMETHODIMP COPCServer::QueryAvailableProperties(LPWSTR szItemID, DWORD *pdwCou
                                                   LPWSTR **ppDescriptions, VARTYPE **ppvtDataTypes)
 {
     return ComBoundary([&]() -> HRESULT {
+        CCallPass pass; // each node is read from the network once per call
         CSingleLock lock(&m_lock);
         if (!IsWritableOut(pdwCount) || !IsWritableOut(ppPropertyIDs) || !IsWritableOut(ppDescriptions) ||
             !IsWritableOut(ppvtDataTypes) || !szItemID)
@@ -104,6 +106,7 @@ STDMETHODIMP COPCServer::GetItemProperties(LPWSTR szItemID, DWORD dwCount, DWORD
                                            HRESULT **ppErrors)
 {
     return ComBoundary([&]() -> HRESULT {
+        CCallPass pass; // each node is read from the network once per call
         if (!IsWritableOut(ppvData) || !IsWritableOut(ppErrors) || !szItemID ||
             !IsReadableArray(pdwPropertyIDs, dwCount))
             return E_INVALIDARG;
@@ -205,6 +208,7 @@ STDMETHODIMP COPCServer::LookupItemIDs(LPWSTR szItemID, DWORD dwCount, DWORD *pd
                                        HRESULT **ppErrors)
 {
     return ComBoundary([&]() -> HRESULT {
+        CCallPass pass; // each node is read from the network once per call
         CSingleLock lock(&m_lock);
         if (!IsWritableOut(ppszNewItemIDs) || !IsWritableOut(ppErrors) || !szItemID ||
             !IsReadableArray(pdwPropertyIDs, dwCount))

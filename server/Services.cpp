@@ -45,7 +45,7 @@ bool CurrentBrowser(CAddrSpace::Browser &browser)
     OPCCadroBrowser *current = OPCCadroBrowser::AcquireCurrent();
     if (!current)
         return false;
-    browser.keep = std::shared_ptr<OPCCadroBrowser>(current, [](OPCCadroBrowser *b) { b->Release(); });
+    browser.release = [current] { current->Release(); };
     browser.open = [current](const wchar_t *url) { return current->Open(url); };
     browser.next = [current](BrowseRecord *record) { return current->Next(kBrowseFieldMask, record); };
     return true;

@@ -1,0 +1,338 @@
+// Plant-size item counts, measured as a SCADA client meets them: through COM
+// from this process against the registered local server. It writes its own
+// network description (one object of N members for N = 1,000, 10,000 and
+// 100,000, and 100 objects of 1,000 members), points the simulated network
+// at it through the registry value "Network File" for the length of the run,
+// and prints:
+// - AddItems of N distinct items, all in one object and spread over 100
+//   objects, with the time per item;
+// - ValidateItems of 10,000 items;
+// - cache Read of 1,000 and 10,000 items;
+// - the server's memory per item at 100,000 items (growth of its working
+//   set while the items are added, divided by the items; once with the
+//   address space still to be read, once with it read already).
+// No other server process may run meanwhile: it would serve another network.
+#include "ComPtr.h"
+#include "Handle.h"
+#include "opcda.h"
+
+#include <psapi.h>
+#include <tlhelp32.h>
+
+#include <chrono>
+#include <cstdio>
+#include <string>
+#include <vector>
+
+namespace {
+using Clock = std::chrono::steady_clock;
+const CLSID kServer = {0x5b1e7a20, 0x4c3d, 0x11d3, {0x9a, 0x44, 0x00, 0xa0, 0xc9, 0xe2, 0xb7, 0xf1}};
+const wchar_t kSimulatorKey[] = L"Software\\Tarnwell\\Cadro Simulator";
+const wchar_t kNetworkFileValue[] = L"Network File";
+const DWORD kCounts[] = {1000, 10000, 100000};
+const DWORD kSpreadObjects = 100;
+
+double Ms(Clock::time_point from)
+{
+    return std::chrono::duration<double, std::milli>(Clock::now() - from).count();
+}
+
+std::wstring OneObjectId(DWORD n, DWORD i)
+{
+    return L"\\\\.\\scale\\Flat" + std::to_wstring(n) + L".m" + std::to_wstring(i);
+}
+
+std::wstring SpreadId(DWORD i)
+{
+    return L"\\\\.\\scale\\Spread\\S" + std::to_wstring(i % kSpreadObjects) + L".m" +
+           std::to_wstring(i / kSpreadObjects);
+}
+
+// The layouts, and one more object of 100,000 members ("Fresh") for the
+// memory figure, whose nodes the address space has not read before.
+std::string Description()
+{
+    std::string text = "machine $HOST\nprocess scale\n";
+    for (DWORD n : kCounts) {
+        text += "object Flat" + std::to_string(n) + "\n";
+        for (DWORD i = 0; i < n; ++i)
+            text += "member m" + std::to_string(i) + " value=" + std::to_string(i % 97) + "\n";
+    }
+    text += "object Fresh\n";
+    for (DWORD i = 0; i < 100000; ++i)
+        text += "member m" + std::to_string(i) + " value=1\n";
+    for (DWORD o = 0; o < kSpreadObjects; ++o) {
+        text += "object Spread\\S" + std::to_string(o) + "\n";
+        for (DWORD i = 0; i < 100000 / kSpreadObjects; ++i)
+            text += "member m" + std::to_string(i) + " value=2\n";
+    }
+    return text;
+}
+
+std::wstring BesideThisProgram(const wchar_t *file)
+{
+    wchar_t self[MAX_PATH];
+    GetModuleFileNameW(nullptr, self, MAX_PATH);
+    std::wstring path(self);
+    return path.substr(0, path.find_last_of(L'\\') + 1) + file;
+}
+
+bool WriteFile(const std::wstring &path, const std::string &text)
+{
+    UniqueHandle file(CreateFileW(path.c_str(), GENERIC_WRITE, 0, nullptr, CREATE_ALWAYS, 0, nullptr));
+    DWORD written = 0;
+    return file && ::WriteFile(file.Get(), text.data(), static_cast<DWORD>(text.size()), &written, nullptr) &&
+           written == text.size();
+}
+
+// Sets the registry value for the run and puts back what was there.
+class NetworkFileSetting {
+public:
+    explicit NetworkFileSetting(const std::wstring &path)
+    {
+        DWORD size = sizeof m_previous;
+        m_hadValue = RegGetValueW(HKEY_LOCAL_MACHINE, kSimulatorKey, kNetworkFileValue, RRF_RT_REG_SZ, nullptr,
+                                  m_previous, &size) == ERROR_SUCCESS;
+        Set(path.c_str());
+    }
+    ~NetworkFileSetting()
+    {
+        if (m_hadValue)
+            Set(m_previous);
+        else
+            RegDeleteKeyValueW(HKEY_LOCAL_MACHINE, kSimulatorKey, kNetworkFileValue);
+    }
+    NetworkFileSetting(const NetworkFileSetting &) = delete;
+    NetworkFileSetting &operator=(const NetworkFileSetting &) = delete;
+
+private:
+    static void Set(const wchar_t *value)
+    {
+        RegSetKeyValueW(HKEY_LOCAL_MACHINE, kSimulatorKey, kNetworkFileValue, REG_SZ, value,
+                        static_cast<DWORD>((wcslen(value) + 1) * sizeof(wchar_t)));
+    }
+    wchar_t m_previous[MAX_PATH * 2] = {};
+    bool m_hadValue = false;
+};
+
+int CountServerProcesses()
+{
+    UniqueHandle snapshot(CreateToolhelp32Snapshot(TH32CS_SNAPPROCESS, 0));
+    PROCESSENTRY32W entry = {};
+    entry.dwSize = sizeof entry;
+    int count = 0;
+    for (BOOL more = Process32FirstW(snapshot.Get(), &entry); more; more = Process32NextW(snapshot.Get(), &entry))
+        if (_wcsicmp(entry.szExeFile, L"Local.exe") == 0)
+            ++count;
+    return count;
+}
+
+UniqueHandle OpenServerProcess()
+{
+    UniqueHandle snapshot(CreateToolhelp32Snapshot(TH32CS_SNAPPROCESS, 0));
+    PROCESSENTRY32W entry = {};
+    entry.dwSize = sizeof entry;
+    for (BOOL more = Process32FirstW(snapshot.Get(), &entry); more; more = Process32NextW(snapshot.Get(), &entry))
+        if (_wcsicmp(entry.szExeFile, L"Local.exe") == 0)
+            return UniqueHandle(OpenProcess(PROCESS_QUERY_INFORMATION | PROCESS_VM_READ, FALSE, entry.th32ProcessID));
+    return UniqueHandle();
+}
+
+double WorkingSetKB(HANDLE process)
+{
+    PROCESS_MEMORY_COUNTERS counters = {};
+    counters.cb = sizeof counters;
+    if (!process || !GetProcessMemoryInfo(process, &counters, sizeof counters))
+        return 0;
+    return counters.WorkingSetSize / 1024.0;
+}
+
+// A group of the server with the definitions of ids, all active.
+class Group {
+public:
+    Group(IOPCServer *server, const wchar_t *name) : m_server(server)
+    {
+        DWORD rate = 0;
+        m_server->AddGroup(name, TRUE, 1000, 0, nullptr, nullptr, 0, &m_handle, &rate, IID_IOPCItemMgt,
+                           reinterpret_cast<IUnknown **>(m_items.Out()));
+    }
+    ~Group()
+    {
+        m_items = nullptr;
+        m_server->RemoveGroup(m_handle, TRUE);
+    }
+    Group(const Group &) = delete;
+    Group &operator=(const Group &) = delete;
+
+    IOPCItemMgt *Items() const { return m_items.Get(); }
+    const std::vector<OPCHANDLE> &Handles() const { return m_handles; }
+
+    // AddItems of every id in one call: its time in ms, -1 when it failed.
+    double Add(const std::vector<std::wstring> &ids)
+    {
+        std::vector<OPCITEMDEF> defs = Definitions(ids);
+        OPCITEMRESULT *results = nullptr;
+        HRESULT *errors = nullptr;
+        auto start = Clock::now();
+        HRESULT hr = m_items->AddItems(static_cast<DWORD>(defs.size()), defs.data(), &results, &errors);
+        double ms = Ms(start);
+        if (hr != S_OK) {
+            printf("  AddItems failed: 0x%08lX\n", static_cast<unsigned long>(hr));
+            ms = -1;
+        }
+        for (size_t i = 0; results && i < defs.size(); ++i)
+            m_handles.push_back(results[i].hServer);
+        CoTaskMemFree(results);
+        CoTaskMemFree(errors);
+        return ms;
+    }
+
+    static std::vector<OPCITEMDEF> Definitions(const std::vector<std::wstring> &ids)
+    {
+        std::vector<OPCITEMDEF> defs(ids.size());
+        for (size_t i = 0; i < ids.size(); ++i) {
+            defs[i] = {};
+            defs[i].szItemID = const_cast<wchar_t *>(ids[i].c_str());
+            defs[i].bActive = TRUE;
+            defs[i].hClient = static_cast<OPCHANDLE>(i);
+        }
+        return defs;
+    }
+
+private:
+    IOPCServer *m_server;
+    OPCHANDLE m_handle = 0;
+    ComPtr<IOPCItemMgt> m_items;
+    std::vector<OPCHANDLE> m_handles;
+};
+
+std::vector<std::wstring> Ids(DWORD n, bool spread)
+{
+    std::vector<std::wstring> ids;
+    ids.reserve(n);
+    for (DWORD i = 0; i < n; ++i)
+        ids.push_back(spread ? SpreadId(i) : OneObjectId(n, i));
+    return ids;
+}
+
+void AddItemsFigures(IOPCServer *server)
+{
+    printf("AddItems of N distinct items, one call, through COM:\n");
+    double perItemAt1000[2] = {0, 0};
+    for (DWORD n : kCounts) {
+        for (int spread = 0; spread < 2; ++spread) {
+            Group group(server, L"scale");
+            double ms = group.Add(Ids(n, spread != 0));
+            double perItem = ms * 1000.0 / n;
+            if (n == 1000)
+                perItemAt1000[spread] = perItem;
+            printf("  N=%-7lu %-28s %9.1f ms  %6.2f us per item", static_cast<unsigned long>(n),
+                   spread ? "spread over 100 objects" : "one object of N members", ms, perItem);
+            if (n != 1000 && perItemAt1000[spread] > 0)
+                printf("  (%.2f x the time per item at 1,000)", perItem / perItemAt1000[spread]);
+            printf("\n");
+        }
+    }
+}
+
+void ValidateFigure(IOPCServer *server)
+{
+    Group group(server, L"validate");
+    std::vector<std::wstring> ids = Ids(10000, true);
+    std::vector<OPCITEMDEF> defs = Group::Definitions(ids);
+    OPCITEMRESULT *results = nullptr;
+    HRESULT *errors = nullptr;
+    auto start = Clock::now();
+    HRESULT hr = group.Items()->ValidateItems(10000, defs.data(), FALSE, &results, &errors);
+    printf("ValidateItems of 10,000 items: %.1f ms (0x%08lX)\n", Ms(start), static_cast<unsigned long>(hr));
+    CoTaskMemFree(results);
+    CoTaskMemFree(errors);
+}
+
+void ReadFigures(IOPCServer *server)
+{
+    Group group(server, L"read");
+    group.Add(Ids(10000, true));
+    ComPtr<IOPCSyncIO> io;
+    group.Items()->QueryInterface(IID_IOPCSyncIO, reinterpret_cast<void **>(io.Out()));
+    for (DWORD n : {1000ul, 10000ul}) {
+        std::vector<OPCHANDLE> handles(group.Handles().begin(), group.Handles().begin() + n);
+        double best = 1e9, total = 0;
+        const int runs = 20;
+        HRESULT hr = S_OK;
+        for (int run = 0; run <= runs; ++run) {
+            OPCITEMSTATE *states = nullptr;
+            HRESULT *errors = nullptr;
+            auto start = Clock::now();
+            hr = io->Read(OPC_DS_CACHE, n, handles.data(), &states, &errors);
+            double ms = Ms(start);
+            if (run > 0) { // the first read may wait for first values
+                best = ms < best ? ms : best;
+                total += ms;
+            }
+            for (DWORD i = 0; states && i < n; ++i)
+                VariantClear(&states[i].vDataValue);
+            CoTaskMemFree(states);
+            CoTaskMemFree(errors);
+        }
+        printf("cache Read of %lu items: best %.2f ms, mean %.2f ms (0x%08lX)\n", n, best, total / runs,
+               static_cast<unsigned long>(hr));
+    }
+}
+
+void MemoryFigures(IOPCServer *server)
+{
+    UniqueHandle process = OpenServerProcess();
+    if (WorkingSetKB(process.Get()) == 0) {
+        printf("server memory: the server's working set cannot be read\n");
+        return;
+    }
+    const DWORD n = 100000;
+    std::vector<std::wstring> fresh, known = Ids(n, false);
+    for (DWORD i = 0; i < n; ++i)
+        fresh.push_back(L"\\\\.\\scale\\Fresh.m" + std::to_wstring(i));
+    Sleep(500);
+    Group first(server, L"memory");
+    double before = WorkingSetKB(process.Get());
+    first.Add(fresh);
+    Sleep(500);
+    double afterFresh = WorkingSetKB(process.Get());
+    Group second(server, L"memory2");
+    second.Add(known);
+    Sleep(500);
+    double afterKnown = WorkingSetKB(process.Get());
+    printf("server memory per item at 100,000 items: %.3f KB with the address space to read, %.3f KB with it read\n",
+           (afterFresh - before) / n, (afterKnown - afterFresh) / n);
+}
+} // namespace
+
+int main()
+{
+    if (CountServerProcesses() != 0) {
+        printf("a server process is running already: it serves another network; stop it first\n");
+        return 1;
+    }
+    std::wstring path = BesideThisProgram(L"scale_network.txt");
+    if (!WriteFile(path, Description())) {
+        printf("cannot write %ls\n", path.c_str());
+        return 1;
+    }
+    NetworkFileSetting setting(path);
+    CoInitializeEx(nullptr, COINIT_MULTITHREADED);
+    {
+        ComPtr<IOPCServer> server;
+        HRESULT hr = CoCreateInstance(kServer, nullptr, CLSCTX_LOCAL_SERVER, IID_IOPCServer,
+                                      reinterpret_cast<void **>(server.Out()));
+        if (FAILED(hr)) {
+            printf("the server is not registered (0x%08lX): run ./test.sh or scripts/setup.sh first\n",
+                   static_cast<unsigned long>(hr));
+        } else {
+            MemoryFigures(server.Get());
+            AddItemsFigures(server.Get());
+            ValidateFigure(server.Get());
+            ReadFigures(server.Get());
+        }
+    }
+    CoUninitialize();
+    return 0;
+}
