@@ -67,6 +67,17 @@ std::wstring_view RecordName(const BrowseRecord &r)
     return name;
 }
 
+VARTYPE DataTypeOf(const BrowseRecord &r)
+{
+    return NetworkTypeToVarType((r.mask & kBrowseDataType) ? r.dataType : 0);
+}
+
+DWORD RightsOf(const BrowseRecord &r)
+{
+    uint16_t access = (r.mask & kBrowseAccess) ? r.access : 3;
+    return ((access & 1) ? OPC_READABLE : 0) | ((access & 2) ? OPC_WRITEABLE : 0);
+}
+
 bool IsMemberRecord(const BrowseRecord &r)
 {
     return (r.mask & kBrowseKind) && r.kind == L'.';
@@ -227,9 +238,8 @@ AddrNodePtr CAddrSpace::MakeNode(const BrowseRecord &r)
     auto node = std::make_shared<CAddrNode>();
     std::wstring_view name = RecordName(r);
     bool leaf = (r.mask & kBrowseFlags) && (r.flags & 1);
-    node->m_dataType = NetworkTypeToVarType((r.mask & kBrowseDataType) ? r.dataType : 0);
-    uint16_t access = (r.mask & kBrowseAccess) ? r.access : 3;
-    node->m_accessRights = ((access & 1) ? OPC_READABLE : 0) | ((access & 2) ? OPC_WRITEABLE : 0);
+    node->m_dataType = DataTypeOf(r);
+    node->m_accessRights = RightsOf(r);
     node->m_separator = (r.mask & kBrowseKind) ? static_cast<wchar_t>(r.kind) : 0;
     node->m_displayName.assign(name);
     node->m_idPartLength = static_cast<uint32_t>(IdPartOf(r).size()); // always a prefix of the name
@@ -275,7 +285,12 @@ HRESULT CAddrSpace::ReadChildren(const AddrNodePtr &node)
     while (SUCCEEDED(browser.next(&record))) {
         if (const AddrNodePtr *known = FindPart(children, IdPartOf(record))) {
             if ((*known)->m_seenMark != mark) {
+                // A kept node keeps its texts and subtree, and takes the
+                // member's present type and rights (a member made read-only
+                // is seen by the next call).
                 (*known)->m_seenMark = mark;
+                (*known)->m_dataType = DataTypeOf(record);
+                (*known)->m_accessRights = RightsOf(record);
                 ++seen;
             }
         } else {

@@ -224,11 +224,14 @@ HRESULT COPCItem::Write(const VARIANT &value)
     if (!(m_accessRights & OPC_WRITEABLE)) {
         hr = OPC_E_BADRIGHTS;
     } else {
-        CopyVariant(m_lastWritten.Get(), value);
-        if (V_VT(m_lastWritten.Get()) != m_canonicalType)
-            hr = VariantChangeType(m_lastWritten.Get(), m_lastWritten.Get(), 0, m_canonicalType);
+        // The written value is needed only on its way to the network: an
+        // item does not keep it (a write changes nothing a client reads).
+        CVariant written;
+        CopyVariant(written.Get(), value);
+        if (V_VT(written.Get()) != m_canonicalType)
+            hr = VariantChangeType(written.Get(), written.Get(), 0, m_canonicalType);
         if (SUCCEEDED(hr))
-            hr = VariantToCadroValue(m_lastWritten.Value(), record);
+            hr = VariantToCadroValue(written.Value(), record);
         if (SUCCEEDED(hr)) {
             if (m_dataItem)
                 m_dataItem->Write(record.Get()); // the network answers with an update

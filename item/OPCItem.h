@@ -55,7 +55,7 @@ private:
     WORD m_deviceQuality = 0xC0;
     WORD m_lastQuality = 0x00;
     HRESULT m_lastReadResult = S_OK;
-    CManualResetEvent m_valueArrived; // created unsignalled
+    CManualResetEvent m_valueArrived{m_lock}; // created unsignalled
     CVariant m_lastValue;
     FILETIME m_lastTime = {};
     OPCHANDLE m_clientHandle = 0;
@@ -68,7 +68,6 @@ private:
     std::wstring m_itemId;
     ActiveItemList::iterator m_activePosition;
     OPCHANDLE m_serverHandle = 0;
-    CVariant m_lastWritten;
     HRESULT m_writeResult = S_OK;
     CadroDataItem *m_dataItem = nullptr;
 };

@@ -8,9 +8,13 @@
 #include <atomic>
 #include <windows.h>
 
+//
+// It sleeps on its owner's lock rather than one of its own: an item has one
+// lock however many waits it serves. Wait must be called without that lock
+// held; Set and Reset may be called with it held or not.
 class CManualResetEvent {
 public:
-    CManualResetEvent() { InitializeConditionVariable(&m_changed); }
+    explicit CManualResetEvent(CCriticalSection &lock) : m_lock(lock) { InitializeConditionVariable(&m_changed); }
     CManualResetEvent(const CManualResetEvent &) = delete;
     CManualResetEvent &operator=(const CManualResetEvent &) = delete;
 
@@ -23,6 +27,6 @@ private:
     // Read without the lock by Set, which the network calls at every value:
     // setting a set event changes nothing and needs no lock.
     std::atomic<bool> m_signalled{false};
-    CCriticalSection m_lock;
+    CCriticalSection &m_lock;
     CONDITION_VARIABLE m_changed;
 };

@@ -15,7 +15,9 @@ public:
 // that slept at once would make them wait for each other item after item.
 class CCriticalSection : public CSyncObject {
 public:
-    CCriticalSection() { InitializeCriticalSectionAndSpinCount(&m_cs, kSpinCount); }
+    // Without debug information: every item has a lock, and the system's
+    // record of each would be a second allocation per item.
+    CCriticalSection() { InitializeCriticalSectionEx(&m_cs, kSpinCount, CRITICAL_SECTION_NO_DEBUG_INFO); }
     static constexpr DWORD kSpinCount = 4000;
     ~CCriticalSection() override { DeleteCriticalSection(&m_cs); }
     CCriticalSection(const CCriticalSection &) = delete;

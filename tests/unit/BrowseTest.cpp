@@ -3,6 +3,7 @@
 // default network through the server object.
 #include "AddrSpace.h"
 #include "CadroSim.h"
+#include "CallPass.h"
 #include "InProcServer.h"
 #include "OpcErrors.h"
 #include "PatternMatch.h"
@@ -27,6 +28,7 @@ BrowseRecord Record(const wchar_t *name, wchar_t kind, bool leaf, uint16_t type 
 // A network whose listings the test sets per URL.
 struct FakeNetwork {
     std::map<std::wstring, std::vector<std::tuple<std::wstring, wchar_t, bool>>> listings;
+    std::map<std::wstring, uint16_t> access; // by name; rw when absent
     std::vector<std::wstring> opened;
     std::vector<std::tuple<std::wstring, wchar_t, bool>> current;
     size_t next = 0;
@@ -47,7 +49,8 @@ struct FakeNetwork {
                 if (next >= current.size())
                     return E_FAIL;
                 auto &[name, kind, leaf] = current[next++];
-                *r = Record(name.c_str(), kind, leaf, kCadroNumber);
+                auto rights = access.find(name);
+                *r = Record(name.c_str(), kind, leaf, kCadroNumber, rights == access.end() ? 3 : rights->second);
                 return S_OK;
             };
             return true;
@@ -334,4 +337,132 @@ TEST_F(BrowseServer, MembersAppearAndDisappearAndPositionsSurviveTheirNodes)
     EXPECT_EQ(browse->ChangeBrowsePosition(OPC_BROWSE_UP, L""), E_FAIL);
     EXPECT_EQ(browse->ChangeBrowsePosition(OPC_BROWSE_TO, L""), S_OK);
     EXPECT_EQ(List(OPC_BRANCH).size(), 2u);
+}
+
+TEST(AddressSpace, OneCallReadsEachNodeOnceAndTheNextCallSeesTheNetworkAgain)
+{
+    std::unique_ptr<CAddrSpace> space(CAddrSpace::Create());
+    space->AddRoots("A=\\\\x");
+    FakeNetwork net;
+    space->SetBrowserSource(net.Source());
+    net.listings[L"\\\\x"] = {{L"proc", L'\\', false}};
+    net.listings[L"\\\\x\\proc"] = {{L"Obj", L'\\', false}};
+    auto &members = net.listings[L"\\\\x\\proc\\Obj"];
+    for (int i = 0; i < 500; ++i)
+        members.emplace_back(L"m" + std::to_wstring(i), L'.', true);
+    {
+        CCallPass pass;
+        for (int i = 0; i < 500; ++i)
+            ASSERT_TRUE(space->FindByItemId(L"\\\\x\\proc\\Obj.m" + std::to_wstring(i))) << i;
+        EXPECT_FALSE(space->FindByItemId(L"\\\\x\\proc\\Obj.m500"));
+        EXPECT_EQ(net.opened.size(), 3u) << "one read per node for the whole call";
+    }
+
+    // Between calls a member is added, one removed, one made read-only.
+    members.emplace_back(L"added", L'.', true);
+    members.erase(members.begin());
+    net.access[L"m7"] = 1;
+    CCallPass next;
+    EXPECT_TRUE(space->FindByItemId(L"\\\\x\\proc\\Obj.added"));
+    EXPECT_FALSE(space->FindByItemId(L"\\\\x\\proc\\Obj.m0"));
+    AddrNodePtr m7 = space->FindByItemId(L"\\\\x\\proc\\Obj.m7");
+    ASSERT_TRUE(m7);
+    EXPECT_EQ(m7->AccessRights(), static_cast<DWORD>(OPC_READABLE));
+    EXPECT_EQ(net.opened.size(), 6u);
+}
+
+namespace {
+// The lookup as the tree's rules state it, over every child in list order:
+// what the indexed lookup must agree with.
+AddrNodePtr WalkFrom(CAddrSpace &space, const AddrNodePtr &node, std::wstring text)
+{
+    std::wstring part(node->IdPart()), separator(node->Separator());
+    if (!node->IsRoot() && !part.empty()) {
+        if (text.compare(0, separator.size() + part.size(), separator + part) != 0)
+            return nullptr;
+        text.erase(0, separator.size() + part.size());
+        if (text.empty())
+            return node;
+        if (!node->IsBranch() || FAILED(space.Refresh(node)))
+            return nullptr;
+    } else if (!node->IsBranch()) {
+        return text.empty() ? node : nullptr;
+    }
+    std::vector<AddrNodePtr> children = *node->Children();
+    for (const AddrNodePtr &child : children)
+        if (AddrNodePtr found = WalkFrom(space, child, text))
+            return found;
+    return nullptr;
+}
+} // namespace
+
+TEST(AddressSpace, IndexedLookupsFindWhatTheWalkOverEverySiblingFinds)
+{
+    std::unique_ptr<CAddrSpace> space(CAddrSpace::Create());
+    space->AddRoots("A=\\\\x,B=\\\\x\\proc1");
+    FakeNetwork net;
+    space->SetBrowserSource(net.Source());
+    net.listings[L"\\\\x"] = {{L"proc1", L'\\', false}, {L"proc10", L'\\', false}, {L"Proc2", L'\\', false}};
+    net.listings[L"\\\\x\\proc1"] = {{L"Obj", L'\\', false}, {L"Ob", L'\\', false}};
+    net.listings[L"\\\\x\\proc10"] = {{L"Obj", L'\\', false}};
+    net.listings[L"\\\\x\\Proc2"] = {{L"deep", L'\\', false}};
+    net.listings[L"\\\\x\\Proc2\\deep"] = {{L"er", L'\\', false}, {L"v", L'.', true}};
+    net.listings[L"\\\\x\\Proc2\\deep\\er"] = {{L"v", L'.', true}};
+    net.listings[L"\\\\x\\proc1\\Obj"] = {{L"(implicit)", L'.', true},
+                                          {L"cosine-Cosine wave", L'.', true},
+                                          {L"cos", L'.', true},
+                                          {L"Sub", L'\\', false},
+                                          {L"a-b", L'.', true}};
+    net.listings[L"\\\\x\\proc1\\Ob"] = {{L"j", L'\\', false}};
+    net.listings[L"\\\\x\\proc1\\Ob\\j"] = {{L"x", L'.', true}};
+    net.listings[L"\\\\x\\proc1\\Obj\\Sub"] = {{L"(implicit)", L'.', true}, {L"x", L'.', true}};
+    net.listings[L"\\\\x\\proc10\\Obj"] = {{L"v", L'.', true}};
+
+    std::vector<std::wstring> ids = {
+        L"\\\\x\\proc1\\Obj",        // the object, not its implicit member
+        L"\\\\x\\proc1\\Obj.",       // a final mark
+        L"\\\\x\\proc1\\Obj.cosine", // a member with a description
+        L"\\\\x\\proc1\\Obj.cos",    // a prefix of a sibling
+        L"\\\\x\\proc1\\Obj.cosin",  // no such member
+        L"\\\\x\\proc1\\Obj.cosine-Cosine wave",
+        L"\\\\x\\proc1\\Obj.a",        // only members split at the dash
+        L"\\\\x\\proc1\\Obj.cosinex",  // past a leaf
+        L"\\\\x\\proc1\\Obj.cosine.x", // past a leaf
+        L"\\\\x\\proc1\\Obj\\Sub",     // a branch whose implicit member comes first
+        L"\\\\x\\proc1\\Obj\\Sub.x",
+        L"\\\\x\\proc1\\Ob\\j.x", // a sibling that is a prefix: its own subtree
+        L"\\\\x\\proc10\\Obj.v",  // proc1 is tried first and fails
+        L"\\\\x\\PROC1\\Obj.cos", // parts match with their case
+        L"\\\\x\\proc1\\obj.cos",
+        L"\\\\x\\Proc2\\deep\\er.v",
+        L"\\\\x\\Proc2\\deep.v",
+        L"\\\\x\\proc2\\deep.v",
+        L"\\\\x",
+        L"\\\\y",
+        L"",
+        L"\\\\x\\",
+        L"\\\\x\\proc1\\Obj.cos" + std::wstring(10000, L'x'),
+    };
+    std::wstring deep = L"\\\\x\\proc1";
+    for (int i = 0; i < 2000; ++i)
+        deep += L"\\Obj";
+    ids.push_back(deep);
+
+    for (const std::wstring &id : ids) {
+        AddrNodePtr walked = WalkFrom(*space, space->Root(), id);
+        AddrNodePtr indexed = space->FindByItemId(id);
+        EXPECT_EQ(indexed, walked) << std::string(id.begin(), id.begin() + std::min<size_t>(id.size(), 60));
+    }
+    // A few answers spelled out, so that both cannot be wrong alike.
+    AddrNodePtr object = space->FindByItemId(L"\\\\x\\proc1\\Obj");
+    ASSERT_TRUE(object);
+    EXPECT_EQ(object->DisplayName(), L"Obj");
+    AddrNodePtr cosine = space->FindByItemId(L"\\\\x\\proc1\\Obj.cosine");
+    ASSERT_TRUE(cosine);
+    EXPECT_EQ(cosine->DisplayName(), L"cosine-Cosine wave");
+    AddrNodePtr implicit = space->FindByItemId(L"\\\\x\\proc1\\Obj\\Sub");
+    ASSERT_TRUE(implicit);
+    EXPECT_EQ(implicit->DisplayName(), L"Sub");
+    EXPECT_FALSE(space->FindByItemId(L"\\\\x\\PROC1\\Obj.cos"));
+    EXPECT_TRUE(space->FindByItemId(L"\\\\x\\proc10\\Obj.v"));
 }

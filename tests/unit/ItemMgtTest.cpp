@@ -1,5 +1,6 @@
 // Item management and synchronous I/O of a group in this process, against
 // the simulated default network.
+#include "CadroSim.h"
 #include "InProcServer.h"
 #include "OpcErrors.h"
 #include "ValueConversion.h"
@@ -373,4 +374,59 @@ TEST_F(ItemMgtTest, HugeIdentifiersAndDuplicateHandlesGetPerItemAnswers)
     EXPECT_EQ(errors[0], S_OK);
     EXPECT_EQ(errors[1], OPC_E_INVALIDHANDLE);
     CoTaskMemFree(errors);
+}
+
+namespace {
+std::wstring Sim(const std::wstring &command)
+{
+    BSTR answer = nullptr;
+    CadroSim_Execute(command.c_str(), &answer);
+    std::wstring text = answer ? answer : L"";
+    SysFreeString(answer);
+    return text;
+}
+
+unsigned long BrowsesSoFar()
+{
+    std::wstring status = Sim(L"status");
+    size_t at = status.find(L"\nbrowses ");
+    return at == std::wstring::npos ? 0 : wcstoul(status.c_str() + at + 9, nullptr, 10);
+}
+} // namespace
+
+TEST_F(ItemMgtTest, OneAddItemsBrowsesEachLevelOnceAndTheNextSeesTheNetworkAgain)
+{
+    const int count = 400;
+    for (int i = 0; i < count; ++i)
+        ASSERT_EQ(Sim(L"add-member \\\\.\\proc2\\Many m" + std::to_wstring(i) + L" type=bool"), L"ok\n");
+    std::vector<std::wstring> ids;
+    std::vector<OPCITEMDEF> defs;
+    for (int i = 0; i < count; ++i)
+        ids.push_back(L"\\\\.\\proc2\\Many.m" + std::to_wstring(i));
+    for (const auto &id : ids)
+        defs.push_back(Def(id.c_str()));
+    std::vector<OPCITEMRESULT> results;
+    std::vector<HRESULT> errors;
+    unsigned long before = BrowsesSoFar();
+    ASSERT_EQ(Add(defs, results, errors), S_OK);
+    EXPECT_EQ(BrowsesSoFar() - before, 3u) << "this machine, the process and the object, once each";
+    for (const OPCITEMRESULT &r : results)
+        EXPECT_EQ(r.vtCanonicalDataType, VT_BOOL);
+
+    // Between calls one member goes, one comes back read-only, one is new.
+    ASSERT_EQ(Sim(L"remove-member \\\\.\\proc2\\Many.m0"), L"ok\n");
+    ASSERT_EQ(Sim(L"remove-member \\\\.\\proc2\\Many.m1"), L"ok\n");
+    ASSERT_EQ(Sim(L"add-member \\\\.\\proc2\\Many m1 type=text access=r"), L"ok\n");
+    ASSERT_EQ(Sim(L"add-member \\\\.\\proc2\\Many fresh type=number"), L"ok\n");
+    before = BrowsesSoFar();
+    ASSERT_EQ(Add({Def(ids[0].c_str()), Def(ids[1].c_str()), Def(L"\\\\.\\proc2\\Many.fresh")}, results, errors),
+              S_FALSE);
+    EXPECT_EQ(BrowsesSoFar() - before, 4u) << "the vanished member is looked for below \"Network\" too, once";
+    EXPECT_EQ(errors[0], OPC_E_UNKNOWNITEMID) << "the network no longer has it";
+    EXPECT_EQ(errors[1], S_OK);
+    EXPECT_EQ(results[1].dwAccessRights, static_cast<DWORD>(OPC_READABLE));
+    EXPECT_EQ(results[1].vtCanonicalDataType, VT_BSTR);
+    EXPECT_EQ(errors[2], S_OK);
+    EXPECT_EQ(results[2].vtCanonicalDataType, VT_R8);
+    Sim(L"reset");
 }
