@@ -14,6 +14,7 @@
 // No other server process may run meanwhile: it would serve another network.
 #include "ComPtr.h"
 #include "Handle.h"
+#include "ItemDefinitions.h"
 #include "opcda.h"
 
 #include <psapi.h>
@@ -170,7 +171,7 @@ public:
     // AddItems of every id in one call: its time in ms, -1 when it failed.
     double Add(const std::vector<std::wstring> &ids)
     {
-        std::vector<OPCITEMDEF> defs = Definitions(ids);
+        std::vector<OPCITEMDEF> defs = ActiveDefinitions(ids);
         OPCITEMRESULT *results = nullptr;
         HRESULT *errors = nullptr;
         auto start = Clock::now();
@@ -185,18 +186,6 @@ public:
         CoTaskMemFree(results);
         CoTaskMemFree(errors);
         return ms;
-    }
-
-    static std::vector<OPCITEMDEF> Definitions(const std::vector<std::wstring> &ids)
-    {
-        std::vector<OPCITEMDEF> defs(ids.size());
-        for (size_t i = 0; i < ids.size(); ++i) {
-            defs[i] = {};
-            defs[i].szItemID = const_cast<wchar_t *>(ids[i].c_str());
-            defs[i].bActive = TRUE;
-            defs[i].hClient = static_cast<OPCHANDLE>(i);
-        }
-        return defs;
     }
 
 private:
@@ -239,7 +228,7 @@ void ValidateFigure(IOPCServer *server)
 {
     Group group(server, L"validate");
     std::vector<std::wstring> ids = Ids(10000, true);
-    std::vector<OPCITEMDEF> defs = Group::Definitions(ids);
+    std::vector<OPCITEMDEF> defs = ActiveDefinitions(ids);
     OPCITEMRESULT *results = nullptr;
     HRESULT *errors = nullptr;
     auto start = Clock::now();

@@ -34,12 +34,13 @@ struct Subscription : CSimUnknown<CadroDataItem> {
     std::shared_ptr<Member> member;
     ICadroRealTimeReceiver *receiver;
     void *cookie;
+    // Set when its holder lets go: nothing calls it any more, and it is
+    // deleted once nothing refers to it.
     std::atomic<bool> dead{false};
     // Guarded by the member's shard:
-    bool active = false;   // receives values
-    bool released = false; // its holder let go; deleted once nothing refers to it
-    uint32_t queued = 0;   // events of it in the shard's queue
-    size_t slot = 0;       // its place in the member's subscriptions
+    bool active = false; // receives values
+    uint32_t queued = 0; // events of it in the shard's queue
+    size_t slot = 0;     // its place in the member's subscriptions
 };
 
 // Open: the whole answer to a subscription on a connected machine (contacted,
@@ -65,7 +66,7 @@ public:
     // Under lock: queue an event / put a member on the heap.
     void Post(Subscription *sub, EventKind kind, uint32_t status = 0);
     void Schedule(const std::shared_ptr<Member> &member);
-    // Under lock: a subscription joins or leaves its member's list.
+    // Under lock: a new subscription joins its member's list.
     static void Attach(Subscription *sub);
     // Under lock (held by l): ends the subscription's deliveries and says
     // who deletes it.
@@ -86,8 +87,8 @@ private:
     };
 
     void Run(unsigned generation);
-    // Deletes, with the lock released, the released subscriptions that
-    // nothing refers to any more.
+    // Between batches: deletes, with the lock released, the subscriptions
+    // released from inside callbacks that nothing refers to any more.
     void Sweep(std::unique_lock<SlimMutex> &l);
     void Tick(std::unique_lock<SlimMutex> &l, const std::shared_ptr<Member> &member, Clock::time_point at);
     void Dispatch(std::unique_lock<SlimMutex> &l, Event e);

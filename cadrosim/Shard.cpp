@@ -77,7 +77,6 @@ Shard::Disposal Shard::Release(Subscription *sub, std::unique_lock<SlimMutex> &l
 {
     // Out of the member's list in one step: the last one takes its place.
     sub->dead = true;
-    sub->released = true;
     auto &subs = sub->member->subscriptions;
     subs[sub->slot] = subs.back();
     subs[sub->slot]->slot = sub->slot;
@@ -97,6 +96,8 @@ Shard::Disposal Shard::Release(Subscription *sub, std::unique_lock<SlimMutex> &l
 void Shard::Sweep(std::unique_lock<SlimMutex> &l)
 {
     // Those with events still queued go when the last one comes up.
+    if (m_graveyard.empty())
+        return;
     std::vector<Subscription *> dead;
     for (Subscription *sub : m_graveyard)
         if (sub->queued == 0)
@@ -120,9 +121,6 @@ template <class F> void Shard::Deliver(std::unique_lock<SlimMutex> &l, F callbac
     m_batchesFinished = batch;
     m_delivering = false;
     m_batchDone.notify_all();
-    // Subscriptions released by their own callbacks go now that nothing of
-    // this batch refers to them.
-    Sweep(l);
 }
 
 void Shard::Run(unsigned generation)
@@ -137,7 +135,10 @@ void Shard::Run(unsigned generation)
             --sub->queued;
             if (!sub->dead) {
                 Dispatch(l, e);
-            } else if (sub->released && sub->queued == 0) {
+                // Subscriptions released by their own callbacks go once the
+                // event that called them is done with them.
+                Sweep(l);
+            } else if (sub->queued == 0) {
                 // Its holder let go while this event waited: the last
                 // reference to it was this event.
                 l.unlock();
@@ -150,6 +151,7 @@ void Shard::Run(unsigned generation)
             Due due = m_heap.top();
             m_heap.pop();
             Tick(l, due.member, due.at);
+            Sweep(l);
             continue;
         }
         if (m_heap.empty())

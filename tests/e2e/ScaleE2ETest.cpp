@@ -2,6 +2,7 @@
 // one network file, every result with its member's own type and rights.
 #include "ComPtr.h"
 #include "Handle.h"
+#include "ItemDefinitions.h"
 #include "ServerProcess.h"
 #include "opcda.h"
 
@@ -73,13 +74,7 @@ TEST(ScaleE2E, AddItemsOfTwentyThousandDistinctItemsGivesEachItsTypeAndRights)
         for (DWORD i = 0; i < count; ++i)
             ids.push_back(L"\\\\.\\plant\\Area" + std::to_wstring(i % 4) + L"\\Unit.tag" + std::to_wstring(i));
         ids.push_back(L"\\\\.\\plant\\Area0\\Unit.nothing");
-        std::vector<OPCITEMDEF> defs(ids.size());
-        for (size_t i = 0; i < ids.size(); ++i) {
-            defs[i] = {};
-            defs[i].szItemID = const_cast<wchar_t *>(ids[i].c_str());
-            defs[i].bActive = TRUE;
-            defs[i].hClient = static_cast<OPCHANDLE>(i);
-        }
+        std::vector<OPCITEMDEF> defs = ActiveDefinitions(ids);
         OPCITEMRESULT *results = nullptr;
         HRESULT *errors = nullptr;
         ASSERT_EQ(items->AddItems(static_cast<DWORD>(defs.size()), defs.data(), &results, &errors), S_FALSE);
