@@ -94,6 +94,9 @@ private:
     void Dispatch(std::unique_lock<SlimMutex> &l, Event e);
     // Runs callbacks with the lock released, then wakes waiting releases.
     template <class F> void Deliver(std::unique_lock<SlimMutex> &l, F callbacks);
+    // One event or tick of the shard's thread, which may deliver several
+    // batches and read its subscriptions between them.
+    template <class F> void Unit(F work);
 
     Engine &m_engine;
     SlimCondition m_wake;
@@ -106,6 +109,11 @@ private:
     // batch in flight when it detached, never for an idle moment.
     uint64_t m_batchesStarted = 0;
     uint64_t m_batchesFinished = 0;
+    // The same for the shard thread's units of work: a release from another
+    // thread waits for the unit in flight, as the unit still reads the
+    // subscription after its batch.
+    uint64_t m_unitsStarted = 0;
+    uint64_t m_unitsFinished = 0;
     unsigned m_generation = 0;
     DWORD m_threadId = 0;
     std::thread m_thread;

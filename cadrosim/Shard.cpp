@@ -81,13 +81,17 @@ Shard::Disposal Shard::Release(Subscription *sub, std::unique_lock<SlimMutex> &l
     subs[sub->slot] = subs.back();
     subs[sub->slot]->slot = sub->slot;
     subs.pop_back();
-    if (m_delivering) {
-        if (OnShardThread()) {
-            m_graveyard.push_back(sub); // released from inside a callback of this batch
-            return Disposal::AfterBatch;
-        }
-        uint64_t inFlight = m_batchesStarted;
-        m_batchDone.wait(l, [this, inFlight] { return m_batchesFinished >= inFlight; });
+    if (OnShardThread() && m_unitsFinished != m_unitsStarted) {
+        m_graveyard.push_back(sub); // released from inside a callback of this unit
+        return Disposal::AfterBatch;
+    }
+    if (m_delivering || m_unitsFinished != m_unitsStarted) {
+        // Held like a queued event while the lock is let go for the wait,
+        // so that the shard does not delete it when its last event comes up.
+        ++sub->queued;
+        uint64_t batch = m_batchesStarted, unit = m_unitsStarted;
+        m_batchDone.wait(l, [this, batch, unit] { return m_batchesFinished >= batch && m_unitsFinished >= unit; });
+        --sub->queued;
     }
     // Queued events are skipped when they come up; the last one deletes it.
     return sub->queued == 0 ? Disposal::Now : Disposal::AfterQueue;
@@ -123,6 +127,14 @@ template <class F> void Shard::Deliver(std::unique_lock<SlimMutex> &l, F callbac
     m_batchDone.notify_all();
 }
 
+template <class F> void Shard::Unit(F work)
+{
+    uint64_t unit = ++m_unitsStarted;
+    work();
+    m_unitsFinished = unit;
+    m_batchDone.notify_all();
+}
+
 void Shard::Run(unsigned generation)
 {
     m_threadId = GetCurrentThreadId();
@@ -134,7 +146,7 @@ void Shard::Run(unsigned generation)
             Subscription *sub = e.sub;
             --sub->queued;
             if (!sub->dead) {
-                Dispatch(l, e);
+                Unit([&] { Dispatch(l, e); });
                 // Subscriptions released by their own callbacks go once the
                 // event that called them is done with them.
                 Sweep(l);
@@ -150,7 +162,7 @@ void Shard::Run(unsigned generation)
         if (!m_heap.empty() && m_heap.top().at <= Clock::now()) {
             Due due = m_heap.top();
             m_heap.pop();
-            Tick(l, due.member, due.at);
+            Unit([&] { Tick(l, due.member, due.at); });
             Sweep(l);
             continue;
         }

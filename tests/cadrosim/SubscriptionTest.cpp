@@ -1,5 +1,6 @@
 #include "SimFixture.h"
 
+#include <future>
 #include <thread>
 
 namespace {
@@ -170,6 +171,38 @@ TEST_F(SimTest, ReleaseEndsCallbacksBeforeItReturns)
     size_t n = recorder.Count(selfCookie, Delivery::Data);
     Sleep(30);
     EXPECT_EQ(recorder.Count(selfCookie, Delivery::Data), n);
+    recorder.onData = nullptr;
+}
+
+TEST_F(SimTest, AReleaseThatWaitsForACallbackOwnsItsSubscriptionUntilItReturns)
+{
+    // One subscription's callback holds the shard while a second one of the
+    // same member waits in the queue; the second is released from another
+    // thread meanwhile. The shard must not delete it when its event comes up
+    // while the release still waits: it was deleted twice, and its receiver
+    // released twice.
+    std::promise<void> inCallback, goOn;
+    std::shared_future<void> goOnFuture = goOn.get_future().share();
+    std::atomic<void *> blocking{nullptr};
+    recorder.onData = [&](void *cookie) {
+        if (cookie == blocking.load() && blocking.exchange(nullptr)) {
+            inCallback.set_value();
+            goOnFuture.wait();
+        }
+    };
+    blocking = NextCookie();
+    ASSERT_TRUE(Subscribe(L"\\\\.\\p\\o.num", nullptr, blocking.load()));
+    ASSERT_EQ(inCallback.get_future().wait_for(std::chrono::seconds(10)), std::future_status::ready);
+    ULONG refs = recorder.Refs();
+    CadroDataItem *queued = nullptr;
+    SubscribeOptions options = {13, 7, 0, 0, 0};
+    ASSERT_EQ(realTime->Subscribe(L"\\\\.\\p\\o.num", NextCookie(), &options, &queued), S_OK);
+    auto release = std::async(std::launch::async, [queued] { queued->Release(); });
+    Sleep(100); // the release now waits for the callback
+    goOn.set_value();
+    ASSERT_EQ(release.wait_for(std::chrono::seconds(10)), std::future_status::ready);
+    Sleep(100);
+    EXPECT_EQ(recorder.Refs(), refs) << "the released subscription lets go of its receiver once";
     recorder.onData = nullptr;
 }
 
