@@ -2,14 +2,30 @@
 
 #include "IdMgr.h"
 
+#include <cstring>
+
+namespace {
+DVTARGETDEVICE *CopyTargetDevice(const DVTARGETDEVICE *device)
+{
+    if (!device)
+        return nullptr;
+    auto *copy = static_cast<DVTARGETDEVICE *>(CoTaskMemAlloc(device->tdSize));
+    if (copy)
+        memcpy(copy, device, device->tdSize);
+    return copy;
+}
+} // namespace
+
 CConnectionData::CConnectionData(const FORMATETC &f, DWORD a, IAdviseSink *s)
     : format(f), advf(a), id(CIdMgr::Instance().GetId()), sink(s)
 {
+    format.ptd = CopyTargetDevice(f.ptd);
     sink->AddRef();
 }
 
 CConnectionData::~CConnectionData()
 {
+    CoTaskMemFree(format.ptd);
     CIdMgr::Instance().ReleaseId(id);
     sink->Release();
 }
@@ -17,6 +33,8 @@ CConnectionData::~CConnectionData()
 HRESULT CAdvisoryConnectionMgr::Add(const FORMATETC &format, DWORD advf, IAdviseSink *sink, DWORD *id)
 {
     auto record = std::make_unique<CConnectionData>(format, advf, sink);
+    if (format.ptd && !record->format.ptd)
+        return E_OUTOFMEMORY;
     CSingleLock lock(&m_lock);
     *id = record->id;
     m_connections.push_front(std::move(record));

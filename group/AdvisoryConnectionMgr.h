@@ -10,6 +10,9 @@
 
 class CConnectionData {
 public:
+    // format.ptd is copied: the caller's target device is the caller's
+    // (across the process boundary it is freed when DAdvise returns), and
+    // every notification sends the format back.
     CConnectionData(const FORMATETC &format, DWORD advf, IAdviseSink *sink);
     virtual ~CConnectionData();
     CConnectionData(const CConnectionData &) = delete;
@@ -24,6 +27,7 @@ public:
 class CAdvisoryConnectionMgr {
 public:
     virtual ~CAdvisoryConnectionMgr() = default;
+    // E_OUTOFMEMORY when the target device cannot be copied.
     HRESULT Add(const FORMATETC &format, DWORD advf, IAdviseSink *sink, DWORD *id);
     HRESULT Remove(DWORD id);
     void RemoveAll();

@@ -9,7 +9,9 @@
 #include "Trace.h"
 #include "UpdateScanMgr.h"
 
+#include <algorithm>
 #include <cmath>
+#include <utility>
 
 namespace {
 constexpr DWORD kMinUpdateRate = 10;
@@ -33,10 +35,8 @@ COPCGroup *COPCGroup::Create()
     return group;
 }
 
-COPCGroup::COPCGroup() : m_idle(CreateEventW(nullptr, TRUE, TRUE, nullptr))
+COPCGroup::COPCGroup()
 {
-    if (!m_idle)
-        INTERNAL_ASSERT_FAILED("CreateEvent for the group's idle event");
     m_serverHandle = CIdMgr::Instance().GetId();
 }
 
@@ -78,56 +78,104 @@ std::wstring COPCGroup::Name()
     return m_name;
 }
 
-void COPCGroup::UpdateIdle()
+bool COPCGroup::Caller::operator==(const Caller &o) const
 {
-    // Idle: no scan or transaction queued or running, but for the ones that
-    // are inside a client callback (which may itself be removing the group).
-    if (!m_idle)
-        return;
-    BOOL ok = m_pendingWork - m_callbacksInFlight <= 0 ? SetEvent(m_idle.Get()) : ResetEvent(m_idle.Get());
-    if (!ok)
-        INTERNAL_ASSERT_FAILED("setting the group's idle event");
+    // Without a logical thread (COM refused it), the physical one decides.
+    if (IsEqualGUID(logicalThread, GUID_NULL) || IsEqualGUID(o.logicalThread, GUID_NULL))
+        return thread == o.thread;
+    return IsEqualGUID(logicalThread, o.logicalThread) != FALSE;
+}
+
+COPCGroup::Caller COPCGroup::Caller::Current()
+{
+    // A call that a client makes from inside a callback carries the
+    // callback's logical thread, also when it arrives on another thread.
+    Caller c{GUID_NULL, GetCurrentThreadId()};
+    if (FAILED(CoGetCurrentLogicalThreadId(&c.logicalThread)))
+        c.logicalThread = GUID_NULL;
+    return c;
+}
+
+LONG COPCGroup::CallbacksOf(const Caller &caller) const
+{
+    return static_cast<LONG>(std::count(m_callbacks.begin(), m_callbacks.end(), caller));
+}
+
+void COPCGroup::WakeRemoval()
+{
+    if (m_removalsWaiting > 0)
+        WakeAllConditionVariable(&m_workChanged);
 }
 
 LONG COPCGroup::AddPendingWork()
 {
     CSingleLock lock(&m_lock);
-    ++m_pendingWork;
-    UpdateIdle();
-    return m_pendingWork;
+    return ++m_pendingWork;
 }
 
 LONG COPCGroup::ReleasePendingWork()
 {
     CSingleLock lock(&m_lock);
     --m_pendingWork;
-    UpdateIdle();
+    WakeRemoval();
     return m_pendingWork;
+}
+
+void COPCGroup::ReleaseWork()
+{
+    bool handedOver;
+    {
+        CSingleLock lock(&m_lock);
+        handedOver = m_removalsWaiting > 0;
+        if (handedOver)
+            ++m_handedOverReferences;
+        --m_pendingWork;
+        WakeRemoval();
+    }
+    // Otherwise released after the work unit, as it may be the last.
+    if (!handedOver)
+        InnerUnknown()->Release();
 }
 
 void COPCGroup::BeginCallback()
 {
     CSingleLock lock(&m_lock);
-    ++m_callbacksInFlight;
-    UpdateIdle();
+    m_callbacks.push_back(Caller::Current());
 }
 
 void COPCGroup::EndCallback()
 {
     CSingleLock lock(&m_lock);
-    --m_callbacksInFlight;
-    UpdateIdle();
+    auto it = std::find(m_callbacks.begin(), m_callbacks.end(), Caller::Current());
+    if (it != m_callbacks.end())
+        m_callbacks.erase(it);
+    WakeRemoval();
 }
 
 void COPCGroup::BeginRemoval()
 {
+    LONG handedOver;
     {
         CSingleLock lock(&m_lock);
         m_removing = true;
+        m_callback.Close();
         SetActive(FALSE);
+        Caller self = Caller::Current();
+        ++m_removalsWaiting;
+        // The callbacks of this logical thread wait for this removal: every
+        // other unit of work is waited for.
+        while (m_pendingWork - CallbacksOf(self) > 0)
+            if (!SleepConditionVariableCS(&m_workChanged, m_lock.Native(), INFINITE))
+                INTERNAL_ASSERT_FAILED("wait for the group's work");
+        --m_removalsWaiting;
+        handedOver = m_removalsWaiting == 0 ? std::exchange(m_handedOverReferences, 0) : 0;
+        // A scan still inside this caller's callback must not reach an owner
+        // that may be gone when it returns.
+        m_owner = nullptr;
     }
-    if (m_idle && WaitForSingleObject(m_idle.Get(), INFINITE) != WAIT_OBJECT_0)
-        INTERNAL_ASSERT_FAILED("wait for the group's idle event");
+    // Never the last: the caller holds the server's reference.
+    for (; handedOver > 0; --handedOver)
+        InnerUnknown()->Release();
 }
 
 void COPCGroup::Destroy()
@@ -137,11 +185,10 @@ void COPCGroup::Destroy()
         return;
     m_destroyed = true;
     m_removing = true;
+    m_callback.Close();
     m_items.clear(); // each item leaves the active list and ends its subscription
     if (m_serverHandle != 0)
         CIdMgr::Instance().ReleaseId(m_serverHandle);
-    if (!m_idle.Reset())
-        INTERNAL_ASSERT_FAILED("CloseHandle for the group's idle event");
     m_owner = nullptr;
     lock.Unlock();
     // The clients' sinks are released without the group lock.
@@ -164,7 +211,7 @@ void COPCGroup::SetActive(BOOL active)
         // A queued entry goes now; one in flight is dropped by the scanner.
         if (scanner && scanner->Unschedule(this)) {
             --m_pendingWork;
-            UpdateIdle();
+            WakeRemoval();
             InnerUnknown()->Release(); // the caller holds another reference
         }
         for (auto &entry : m_items)
@@ -172,7 +219,6 @@ void COPCGroup::SetActive(BOOL active)
     } else if (scanner) {
         InnerUnknown()->AddRef();
         ++m_pendingWork;
-        UpdateIdle();
         scanner->Schedule(this, 0, true); // scanned at once
     }
 }

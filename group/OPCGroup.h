@@ -112,8 +112,10 @@ public:
     BOOL Scan(LONGLONG &next);
     void SetFailedScans(DWORD count);
     DWORD IncrementFailedScans();
-    // The scanner lets go of its queue entry: work unit, then reference.
-    void ReleaseScanEntry();
+    // A scanner entry or a transaction lets go of its work unit and its
+    // reference to the group. While a removal waits, the reference goes to
+    // the removal, so that the removal sees the client's references alone.
+    void ReleaseWork();
 
     // IOPCItemMgt
     STDMETHODIMP AddItems(DWORD dwCount, OPCITEMDEF *pItemArray, OPCITEMRESULT **ppAddResults,
@@ -128,7 +130,8 @@ public:
     STDMETHODIMP CreateEnumerator(REFIID riid, LPUNKNOWN *ppUnk) override;
 
     // Set by AddGroup: the owning server object (not referenced; the link is
-    // cut when the group is destroyed, which the server's release waits for).
+    // cut by the removal, which the server's release makes of every group it
+    // still holds, and at destruction).
     void SetOwner(CGroupOwner *owner);
     OPCHANDLE ServerHandle() const { return m_serverHandle; }
     std::wstring Name();
@@ -173,8 +176,11 @@ public:
     LONG AddPendingWork();
     LONG ReleasePendingWork();
 
-    // Removal: sets the removing flag, makes the group inactive and waits until
-    // no scan and no transaction of the group is queued or running.
+    // Removal: sets the removing flag, makes the group inactive, waits until
+    // no scan and no transaction of the group is queued or running, and cuts
+    // the link to the owner. Only a removal made from inside one of the
+    // group's own client callbacks (the same logical thread, also across the
+    // process boundary) does not wait for that callback, which waits for it.
     void BeginRemoval();
     // Destroys the items and gives the handle back; later calls fail with
     // E_FAIL. Runs once, at forced removal or at the last release.
@@ -193,10 +199,18 @@ private:
 
     COPCItem *FindItem(OPCHANDLE handle);
     class ScanColumns;
-    // IOPCDataCallback calls in flight: removal does not wait for them, so
-    // that a client may remove the group from inside its own callback.
+    // Client callbacks in flight, by the logical thread that makes them: a
+    // removal from inside one of them does not wait for it.
     void BeginCallback();
     void EndCallback();
+    struct Caller {
+        GUID logicalThread;
+        DWORD thread;
+        bool operator==(const Caller &o) const;
+        static Caller Current();
+    };
+    LONG CallbacksOf(const Caller &caller) const;
+    void WakeRemoval();
     struct CallbackInFlight {
         explicit CallbackInFlight(COPCGroup &g) : group(g) { group.BeginCallback(); }
         ~CallbackInFlight() { group.EndCallback(); }
@@ -210,7 +224,6 @@ private:
                                                                          HRESULT *);
     HRESULT SendReadResults(CSingleLock &lock, DWORD clientId, OPCDATASOURCE source,
                             const std::vector<OPCHANDLE> &handles, ReadCallback callback);
-    void UpdateIdle();
     // Reads the active items (list order) for a refresh.
     std::vector<OPCHANDLE> ActiveHandles();
     HRESULT QueueTransaction(std::unique_ptr<class CTransaction> t);
@@ -264,12 +277,14 @@ private:
     ~COPCGroup() override;
 
     CCriticalSection m_lock; // guards every field below
-    UniqueHandle m_idle;     // manual reset; signalled while no work is pending
+    CONDITION_VARIABLE m_workChanged = CONDITION_VARIABLE_INIT;
     LONG m_pendingWork = 0;
+    LONG m_removalsWaiting = 0;
+    LONG m_handedOverReferences = 0;
     CGroupOwner *m_owner = nullptr;
     std::map<OPCHANDLE, std::unique_ptr<COPCItem>> m_items;
     ActiveItemList m_activeItems;
-    CSinkSlot m_callback{IID_IOPCDataCallback, kCallbackCookie}; // the one IOPCDataCallback sink
+    CSinkSlot m_callback{IID_IOPCDataCallback, kCallbackCookie, InnerUnknown()}; // the one IOPCDataCallback sink
     CAdvisoryConnectionMgr m_dataAdvise;
     CAdvisoryConnectionMgr m_dataTimeAdvise;
     CAdvisoryConnectionMgr m_writeAdvise;
@@ -278,7 +293,7 @@ private:
     // neither allocates nor touches fresh pages. Taken out for a scan, so
     // that two scans of the group can never share them.
     std::unique_ptr<Delivery> m_scanColumns;
-    LONG m_callbacksInFlight = 0;
+    std::vector<Caller> m_callbacks;
     bool m_removing = false;
     bool m_destroyed = false;
     DWORD m_updateRate = 0;

@@ -17,12 +17,12 @@
 
 STDMETHODIMP COPCGroup::FindConnectionPoint(REFIID riid, IConnectionPoint **ppCP)
 {
-    return FindSingleSinkPoint(&m_callback, InnerUnknown(), riid, ppCP);
+    return m_callback.Find(riid, ppCP);
 }
 
 STDMETHODIMP COPCGroup::EnumConnectionPoints(IEnumConnectionPoints **ppEnum)
 {
-    return EnumSingleSinkPoint(&m_callback, InnerUnknown(), ppEnum);
+    return m_callback.Enumerate(ppEnum);
 }
 
 // ---- IOPCAsyncIO2 ----------------------------------------------------
@@ -280,12 +280,6 @@ private:
     size_t m_used = 0;
 };
 
-void COPCGroup::ReleaseScanEntry()
-{
-    ReleasePendingWork();
-    InnerUnknown()->Release();
-}
-
 BOOL COPCGroup::Scan(LONGLONG &next)
 {
     CSingleLock lock(&m_lock);
@@ -323,6 +317,9 @@ BOOL COPCGroup::Scan(LONGLONG &next)
         callbackResult =
             sink->OnDataChange(0, hGroup, d.MasterQuality(n), masterError, static_cast<DWORD>(n), d.clients.data(),
                                d.values.data(), d.qualities.data(), d.times.data(), d.errors.data());
+        // Let go before the lock is taken again: a sink unadvised meanwhile
+        // has its last release here, which must not run under the lock.
+        sink.Reset();
         lock.Lock();
     }
     HRESULT adviseResult =

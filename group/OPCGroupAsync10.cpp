@@ -176,6 +176,13 @@ STDMETHODIMP COPCGroup::DAdvise(FORMATETC *pformatetc, DWORD advf, IAdviseSink *
         if (!pformatetc || !pAdvSink || !IsWritableOut(pdwConnection))
             return E_INVALIDARG;
         CSingleLock lock(&m_lock);
+        if (m_removing)
+            return E_FAIL;
+        // A target device's size must cover at least its own header.
+        const DVTARGETDEVICE *device = pformatetc->ptd;
+        if (device && (!IsReadable(device, sizeof(DWORD)) || device->tdSize < sizeof(DVTARGETDEVICE) ||
+                       !IsReadable(device, device->tdSize)))
+            return DV_E_DVTARGETDEVICE;
         CLIPFORMAT cf = pformatetc->cfFormat;
         CAdvisoryConnectionMgr *manager = cf == OpcStreams::DataTime()        ? &m_dataTimeAdvise
                                           : cf == OpcStreams::Data()          ? &m_dataAdvise

@@ -10,9 +10,7 @@ CTransaction::CTransaction(DWORD id, COPCGroup *group, DWORD request) : m_id(id)
 
 CTransaction::~CTransaction()
 {
-    // The work unit goes before the reference, which may be the last.
-    m_group->ReleasePendingWork();
-    m_group->InnerUnknown()->Release();
+    m_group->ReleaseWork();
 }
 
 HRESULT CRead2Transaction::Execute()

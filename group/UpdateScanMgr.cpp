@@ -149,7 +149,7 @@ void CUpdateScanMgr::ScanOne(COPCGroup *group)
     } else if (group->IncrementFailedScans() >= 3) {
         // Deactivated first: the entry's reference still keeps it alive.
         group->SetActive(FALSE);
-        group->ReleaseScanEntry();
+        group->ReleaseWork();
         return;
     }
     CSingleLock lock(&m_lock);
@@ -165,5 +165,5 @@ void CUpdateScanMgr::Run(HANDLE stopEvent)
     while (COPCGroup *group = WaitForDueGroup(stopEvent))
         ScanOne(group);
     while (COPCGroup *group = TakeAny())
-        group->ReleaseScanEntry(); // the groups keep their active flag
+        group->ReleaseWork(); // the groups keep their active flag
 }

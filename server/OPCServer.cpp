@@ -104,6 +104,7 @@ void COPCServer::FinalRelease()
     }
     if (m_counted)
         ServerServices::ServerReleased();
+    m_shutdownSink.Close();
     m_shutdownSink.Clear(); // a sink still advised goes with the server (no lock held)
     CSingleLock registryLock(&m_registry.Lock());
     // No client can reach the object any more: every group goes, by force.
@@ -278,12 +279,12 @@ STDMETHODIMP COPCServer::SetClientName(LPCWSTR szName)
 
 STDMETHODIMP COPCServer::FindConnectionPoint(REFIID riid, IConnectionPoint **ppCP)
 {
-    return FindSingleSinkPoint(&m_shutdownSink, InnerUnknown(), riid, ppCP);
+    return m_shutdownSink.Find(riid, ppCP);
 }
 
 STDMETHODIMP COPCServer::EnumConnectionPoints(IEnumConnectionPoints **ppEnum)
 {
-    return EnumSingleSinkPoint(&m_shutdownSink, InnerUnknown(), ppEnum);
+    return m_shutdownSink.Enumerate(ppEnum);
 }
 
 STDMETHODIMP COPCServer::GetGroupByName(LPCWSTR szName, REFIID riid, LPUNKNOWN *ppUnk)

@@ -99,7 +99,7 @@ private:
     CGroupRegistry m_registry;
     volatile LCID m_locale = LOCALE_SYSTEM_DEFAULT;
     // The one IOPCShutdown sink; the server never calls it.
-    CSinkSlot m_shutdownSink{IID_IOPCShutdown, kShutdownCookie};
+    CSinkSlot m_shutdownSink{IID_IOPCShutdown, kShutdownCookie, InnerUnknown()};
     std::wstring m_clientName;
     bool m_counted = false; // counted among the server objects of the process
     // Calls from groups into this object; innermost lock.

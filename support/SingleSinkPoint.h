@@ -1,83 +1,62 @@
 #pragma once
 // A connection point with room for one sink, for containers that keep the
 // sink themselves (the group's IOPCDataCallback, the server's IOPCShutdown).
-// Made on request; it keeps its container alive.
-#include "ComObject.h"
+// It is part of its container: the same object at every request, with an
+// identity of its own but its container's reference count (it must answer
+// GetConnectionPointContainer, and owning the container would be a cycle).
 #include "ComPtr.h"
 #include "SyncObject.h"
 
 #include <ocidl.h>
 #include <olectl.h>
 
-class ISinkSlot {
+class CSinkSlot : public IConnectionPoint {
 public:
-    virtual const IID &SinkIid() const = 0;
-    // Stores sink (already queried for SinkIid); CONNECT_E_ADVISELIMIT when
-    // the slot is taken.
-    virtual HRESULT FillSlot(const ComPtr<IUnknown> &sink, DWORD *cookie) = 0;
+    // container: the container's IUnknown, which outlives the slot.
+    CSinkSlot(const IID &iid, DWORD cookie, IUnknown *container) : m_iid(iid), m_cookie(cookie), m_container(container)
+    {
+    }
+    CSinkSlot(const CSinkSlot &) = delete;
+    CSinkSlot &operator=(const CSinkSlot &) = delete;
+
+    STDMETHODIMP QueryInterface(REFIID riid, void **ppv) override;
+    STDMETHODIMP_(ULONG) AddRef() override { return m_container->AddRef(); }
+    STDMETHODIMP_(ULONG) Release() override { return m_container->Release(); }
+
+    STDMETHODIMP GetConnectionInterface(IID *pIID) override;
+    STDMETHODIMP GetConnectionPointContainer(IConnectionPointContainer **ppCPC) override;
+    // CONNECT_E_ADVISELIMIT when the slot is taken; E_FAIL once closed.
+    STDMETHODIMP Advise(IUnknown *pUnkSink, DWORD *pdwCookie) override;
     // CONNECT_E_NOCONNECTION for any other cookie.
-    virtual HRESULT EmptySlot(DWORD cookie) = 0;
-    // The sink and its cookie, or null.
-    virtual ComPtr<IUnknown> SlotSink(DWORD *cookie) = 0;
+    STDMETHODIMP Unadvise(DWORD dwCookie) override;
+    STDMETHODIMP EnumConnections(IEnumConnections **ppEnum) override;
 
-protected:
-    ~ISinkSlot() = default;
-};
+    // The container's IConnectionPointContainer, for a container with this
+    // one point.
+    HRESULT Find(REFIID riid, IConnectionPoint **ppCP);
+    HRESULT Enumerate(IEnumConnectionPoints **ppEnum);
 
-// The slot itself: the sink, its fixed cookie, and a lock of its own
-// (innermost) under which Advise and Unadvise change it.
-class CSinkSlot : public ISinkSlot {
-public:
-    CSinkSlot(const IID &iid, DWORD cookie) : m_iid(iid), m_cookie(cookie) {}
-    const IID &SinkIid() const override { return m_iid; }
-    HRESULT FillSlot(const ComPtr<IUnknown> &sink, DWORD *cookie) override;
-    HRESULT EmptySlot(DWORD cookie) override;
-    ComPtr<IUnknown> SlotSink(DWORD *cookie) override;
-
-    // The sink as its interface (the slot holds it queried for SinkIid), with
-    // a reference of the caller's own: a concurrent Unadvise cannot free it.
+    // The sink as its interface (the slot holds it queried for the sink
+    // interface), with a reference of the caller's own: a concurrent
+    // Unadvise cannot free it.
     template <class I> ComPtr<I> Sink()
     {
-        DWORD cookie;
-        ComPtr<IUnknown> sink = SlotSink(&cookie);
+        ComPtr<IUnknown> sink = SlotSink();
         return ComPtr<I>(static_cast<I *>(sink.Get()));
     }
     bool IsFilled();
     // Releases the sink, after the slot's lock.
     void Clear();
+    // The container is going: Advise fails from now on.
+    void Close();
 
 private:
+    ComPtr<IUnknown> SlotSink();
+
     const IID &m_iid;
     const DWORD m_cookie;
-    CCriticalSection m_lock;
+    IUnknown *const m_container;
+    CCriticalSection m_lock; // innermost: guards the two below
     ComPtr<IUnknown> m_sink;
+    bool m_closed = false;
 };
-
-class CSingleSinkPoint : public CComObjectRoot, public IConnectionPoint {
-public:
-    // container: the object's IUnknown (kept alive; answers the container query).
-    static HRESULT Create(ISinkSlot *slot, IUnknown *container, REFIID riid, void **ppv);
-
-    DECLARE_COM_UNKNOWN()
-
-    STDMETHODIMP GetConnectionInterface(IID *pIID) override;
-    STDMETHODIMP GetConnectionPointContainer(IConnectionPointContainer **ppCPC) override;
-    STDMETHODIMP Advise(IUnknown *pUnkSink, DWORD *pdwCookie) override;
-    STDMETHODIMP Unadvise(DWORD dwCookie) override;
-    STDMETHODIMP EnumConnections(IEnumConnections **ppEnum) override;
-
-protected:
-    void *FindInterface(REFIID riid) override;
-
-private:
-    template <class T, class... Args> friend T *NewComObject(Args &&...args);
-    CSingleSinkPoint() = default;
-
-    ISinkSlot *m_slot = nullptr;
-    ComPtr<IUnknown> m_container;
-};
-
-// IConnectionPointContainer::FindConnectionPoint and EnumConnectionPoints
-// for a container with one such point.
-HRESULT FindSingleSinkPoint(ISinkSlot *slot, IUnknown *container, REFIID riid, IConnectionPoint **ppCP);
-HRESULT EnumSingleSinkPoint(ISinkSlot *slot, IUnknown *container, IEnumConnectionPoints **ppEnum);

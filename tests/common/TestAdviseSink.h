@@ -11,6 +11,7 @@
 struct ReceivedStream {
     CLIPFORMAT format;
     std::vector<BYTE> bytes;
+    std::vector<BYTE> device; // the format's target device, when it has one
     DWORD At(size_t offset) const
     {
         DWORD v = 0;
@@ -36,7 +37,11 @@ public:
     STDMETHODIMP_(ULONG) Release() override { return 1; }
     STDMETHODIMP_(void) OnDataChange(FORMATETC *format, STGMEDIUM *medium) override
     {
-        ReceivedStream s{format ? format->cfFormat : CLIPFORMAT(0), {}};
+        ReceivedStream s{format ? format->cfFormat : CLIPFORMAT(0), {}, {}};
+        if (format && format->ptd) {
+            const BYTE *device = reinterpret_cast<const BYTE *>(format->ptd);
+            s.device.assign(device, device + format->ptd->tdSize);
+        }
         if (medium && medium->tymed == TYMED_HGLOBAL && medium->hGlobal) {
             SIZE_T size = GlobalSize(medium->hGlobal);
             const BYTE *p = static_cast<const BYTE *>(GlobalLock(medium->hGlobal));

@@ -10,6 +10,7 @@
 #include <gtest/gtest.h>
 
 #include <cmath>
+#include <future>
 #include <ocidl.h>
 #include <olectl.h>
 
@@ -163,4 +164,67 @@ TEST_F(SubscriptionE2E, CancelledReadsSendNothingAndFailingSinksDeactivateTheGro
             Publish(std::wstring(kTemperature) + L" " + std::to_wstring(10 + i));
     }
     EXPECT_FALSE(active);
+}
+
+TEST_F(SubscriptionE2E, RemovalWaitsForARunningCallbackUnlessMadeFromInsideIt)
+{
+    // From inside the group's own OnDataChange: the call arrives on another
+    // server thread but carries the callback's logical thread, so it must
+    // not wait for the callback that waits for it.
+    const wchar_t kFast[] = L"\\\\.\\proc1\\Counters.fast";
+    std::promise<HRESULT> inside;
+    std::atomic<bool> first{true};
+    sink.onDataChange = [&] {
+        if (first.exchange(false))
+            inside.set_value(server->RemoveGroup(hGroup, FALSE));
+    };
+    Add(kFast, 1);
+    auto f = inside.get_future();
+    ASSERT_EQ(f.wait_for(std::chrono::seconds(20)), std::future_status::ready)
+        << "the removal inside the callback waited for that callback";
+    EXPECT_EQ(f.get(), OPC_S_INUSE) << "this client still holds the group";
+
+    // From another thread: RemoveGroup returns only after the callback has
+    // returned, and no data change follows it.
+    DWORD rate;
+    OPCHANDLE second = 0;
+    ComPtr<IOPCItemMgt> other;
+    ASSERT_EQ(server->AddGroup(L"other", TRUE, 100, 56, nullptr, nullptr, 0, &second, &rate, IID_IOPCItemMgt,
+                               reinterpret_cast<IUnknown **>(other.Out())),
+              S_OK);
+    TestSink slow;
+    std::promise<void> inCallback;
+    std::atomic<bool> callbackDone{false};
+    std::atomic<bool> firstSlow{true};
+    slow.onDataChange = [&] {
+        if (firstSlow.exchange(false)) {
+            inCallback.set_value();
+            Sleep(1000);
+            callbackDone = true;
+        }
+    };
+    {
+        ComPtr<IConnectionPointContainer> container;
+        ComPtr<IConnectionPoint> otherPoint;
+        DWORD otherCookie = 0;
+        ASSERT_EQ(other.As(container), S_OK);
+        ASSERT_EQ(container->FindConnectionPoint(IID_IOPCDataCallback, otherPoint.Out()), S_OK);
+        ASSERT_EQ(otherPoint->Advise(&slow, &otherCookie), S_OK);
+    }
+    OPCITEMDEF d = {};
+    d.szItemID = const_cast<wchar_t *>(kFast);
+    d.bActive = TRUE;
+    OPCITEMRESULT *r = nullptr;
+    HRESULT *e = nullptr;
+    ASSERT_EQ(other->AddItems(1, &d, &r, &e), S_OK);
+    CoTaskMemFree(r);
+    CoTaskMemFree(e);
+    other.Reset(); // the client holds nothing of the group any more
+    ASSERT_EQ(inCallback.get_future().wait_for(std::chrono::seconds(20)), std::future_status::ready);
+    EXPECT_EQ(server->RemoveGroup(second, FALSE), S_OK) << "only the scan held the group";
+    EXPECT_TRUE(callbackDone) << "RemoveGroup returned while the callback was running";
+    size_t after = slow.Count(Callback::DataChange);
+    Sleep(300);
+    EXPECT_EQ(slow.Count(Callback::DataChange), after) << "a data change after RemoveGroup returned";
+    CoDisconnectObject(&slow, 0);
 }

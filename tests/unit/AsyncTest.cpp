@@ -2,6 +2,7 @@
 // simulated default network.
 #include "ComModule.h"
 #include "InProcServer.h"
+#include "OPCGroup.h"
 #include "OpcErrors.h"
 #include "TestSink.h"
 
@@ -240,6 +241,29 @@ TEST_F(AsyncTest, ConnectionPointRules)
     EXPECT_EQ(async->Refresh2(OPC_DS_CACHE, 1, &cancelId), E_FAIL) << "an active group without active items";
     Add({kTemperature}, FALSE);
     EXPECT_EQ(async->Refresh2(OPC_DS_CACHE, 1, &cancelId), E_FAIL);
+
+    // One point object, whichever way it is reached, part of its group.
+    ComPtr<IConnectionPoint> again;
+    ASSERT_EQ(container->FindConnectionPoint(IID_IOPCDataCallback, again.Out()), S_OK);
+    EXPECT_EQ(again.Get(), point.Get());
+    ComPtr<IEnumConnectionPoints> points;
+    ASSERT_EQ(container->EnumConnectionPoints(points.Out()), S_OK);
+    IConnectionPoint *listed = nullptr;
+    ASSERT_EQ(points->Next(1, &listed, nullptr), S_OK);
+    EXPECT_EQ(listed, point.Get());
+    listed->Release();
+    ComPtr<IConnectionPointContainer> back;
+    ASSERT_EQ(point->GetConnectionPointContainer(back.Out()), S_OK);
+    EXPECT_EQ(back.Get(), container.Get());
+
+    // A group whose removal has begun takes no new sink.
+    EXPECT_EQ(point->Unadvise(cookie), S_OK);
+    cookie = 0;
+    ASSERT_EQ(server->RemoveGroup(hGroup, FALSE), OPC_S_INUSE);
+    hGroup = 0;
+    EXPECT_EQ(point->Advise(&other, &c2), E_FAIL);
+    EXPECT_EQ(c2, 0u);
+    EXPECT_EQ(other.Refs(), 1u);
 }
 
 TEST_F(AsyncTest, ThreeFailedDeliveriesMakeTheGroupInactive)
@@ -257,35 +281,130 @@ TEST_F(AsyncTest, ThreeFailedDeliveriesMakeTheGroupInactive)
     EXPECT_EQ(sink.Count(Callback::DataChange), after);
 }
 
-TEST_F(AsyncTest, RemovalDuringACallbackNeverWaitsForThatCallback)
+TEST_F(AsyncTest, RemovalFromAnotherThreadWaitsForTheCallbackInProgress)
 {
-    // The hazard: RemoveGroup holds the server lock while it waits for the
-    // group to be idle, and a scan inside OnDataChange still holds the
-    // group's work. Without the fix this test hangs (each wait is bounded
-    // here so that it fails instead).
-    std::promise<void> inCallback, removed;
-    std::shared_future<void> removedFuture = removed.get_future().share();
+    // RemoveGroup returns only once the scan inside OnDataChange has let go
+    // of the group, and then answers S_OK: nothing but the scanner held it.
+    std::promise<void> inCallback;
+    std::promise<void> goOn;
+    std::shared_future<void> goOnFuture = goOn.get_future().share();
     std::atomic<bool> first{true};
     sink.onDataChange = [&] {
         if (first.exchange(false)) {
             inCallback.set_value();
-            removedFuture.wait_for(std::chrono::seconds(10));
+            goOnFuture.wait();
         }
     };
     Advise();
     Add({kFast});
     ASSERT_EQ(inCallback.get_future().wait_for(std::chrono::seconds(10)), std::future_status::ready);
+    cookie = 0; // the sink goes with the group
+    point.Reset();
+    container.Reset();
+    async.Reset();
+    state.Reset();
+    items.Reset();
     auto remover = std::async(std::launch::async, [&] {
         CoInitializeEx(nullptr, COINIT_MULTITHREADED);
         HRESULT hr = server->RemoveGroup(hGroup, FALSE);
         CoUninitialize();
         return hr;
     });
-    ASSERT_EQ(remover.wait_for(std::chrono::seconds(5)), std::future_status::ready)
-        << "RemoveGroup waited for the callback that is waiting for it";
-    EXPECT_EQ(remover.get(), OPC_S_INUSE);
-    removed.set_value();
+    EXPECT_EQ(remover.wait_for(std::chrono::milliseconds(300)), std::future_status::timeout)
+        << "RemoveGroup returned while the group's callback was still running";
+    goOn.set_value();
+    ASSERT_EQ(remover.wait_for(std::chrono::seconds(10)), std::future_status::ready);
+    EXPECT_EQ(remover.get(), S_OK);
+    size_t after = sink.Count(Callback::DataChange);
+    Sleep(200);
+    EXPECT_EQ(sink.Count(Callback::DataChange), after) << "a data change after RemoveGroup returned";
     hGroup = 0;
+}
+
+TEST_F(AsyncTest, AGroupRemovedInsideItsCallbackNeverReachesItsOwnerAgain)
+{
+    // A client removes the group from inside its callback (the scan still
+    // holds the group) and may then release the server: when the callback
+    // returns, the scan must not reach the owner. An owner that records
+    // calls stands in for the server object that would be gone.
+    class Owner : public CGroupOwner {
+    public:
+        IOPCServer *OwnerServer() override { return nullptr; }
+        CGroupRegistry &Registry() override { return registry; }
+        bool EnterGroupCall() override
+        {
+            callsAfterRemoval += removed ? 1 : 0;
+            return true;
+        }
+        void LeaveGroupCall() override {}
+        void SetLastUpdateTime(const FILETIME &) override {}
+        CGroupRegistry registry;
+        std::atomic<bool> removed{false};
+        std::atomic<int> callsAfterRemoval{0};
+    } owner;
+    static_cast<COPCGroup *>(state.Get())->SetOwner(&owner);
+    std::atomic<bool> first{true};
+    std::promise<HRESULT> removed;
+    sink.onDataChange = [&] {
+        if (!first.exchange(false))
+            return;
+        HRESULT hr = server->RemoveGroup(hGroup, FALSE);
+        owner.removed = true;
+        removed.set_value(hr);
+    };
+    Advise();
+    Add({kFast});
+    auto f = removed.get_future();
+    ASSERT_EQ(f.wait_for(std::chrono::seconds(10)), std::future_status::ready);
+    EXPECT_EQ(f.get(), OPC_S_INUSE);
+    hGroup = 0;
+    Sleep(300); // the scan returns from the callback and ends
+    EXPECT_EQ(owner.callsAfterRemoval, 0);
+}
+
+TEST_F(AsyncTest, ASinkUnadvisedInsideItsCallbackIsReleasedOutsideTheGroupLock)
+{
+    // The last release of a sink may call back into the server (or block on
+    // the client's side): it must never run under the group lock, here
+    // shown by another thread that must get through to the group meanwhile.
+    class ProbingSink : public TestSink {
+    public:
+        STDMETHODIMP_(ULONG) Release() override
+        {
+            ULONG refs = TestSink::Release();
+            if (refs == 1 && group) {
+                reader = std::async(std::launch::async, [this] {
+                    CoInitializeEx(nullptr, COINIT_MULTITHREADED);
+                    BOOL enabled;
+                    group->GetEnable(&enabled);
+                    CoUninitialize();
+                });
+                lockFree = reader.wait_for(std::chrono::seconds(2)) == std::future_status::ready;
+                released = true;
+            }
+            return refs;
+        }
+        IOPCAsyncIO2 *group = nullptr;
+        std::future<void> reader; // ends once the group lock is free
+        std::atomic<bool> released{false};
+        std::atomic<bool> lockFree{false};
+    } probing;
+    probing.group = async.Get();
+    probing.dataChangeResult = E_FAIL; // the scan then ends under its lock
+    ASSERT_EQ(point->Advise(&probing, &cookie), S_OK);
+    std::atomic<bool> first{true};
+    probing.onDataChange = [&] {
+        if (first.exchange(false)) {
+            EXPECT_EQ(point->Unadvise(cookie), S_OK);
+        }
+    };
+    Add({kFast});
+    for (int i = 0; i < 500 && !probing.released; ++i)
+        Sleep(10);
+    cookie = 0;
+    EXPECT_TRUE(probing.released);
+    EXPECT_TRUE(probing.lockFree) << "the sink was released under the group lock";
+    probing.group = nullptr;
 }
 
 TEST_F(AsyncTest, AClientMayRemoveItsGroupFromInsideItsOwnCallback)

@@ -179,3 +179,54 @@ TEST(DataObject, AdviseReadWriteAndSubscriptionStreams)
     EXPECT_EQ(async->Refresh(timedId, OPC_DS_CACHE, &tid), OLE_E_NOCONNECTION);
     server->RemoveGroup(hGroup, TRUE);
 }
+
+TEST(DataObject, AdviseKeepsItsOwnTargetDeviceAndARemovedGroupRefusesIt)
+{
+    auto server = CreateInProcServer();
+    OPCHANDLE hGroup;
+    DWORD rate;
+    ComPtr<IOPCItemMgt> items;
+    ASSERT_EQ(server->AddGroup(L"device", TRUE, 50, 67, nullptr, nullptr, 0, &hGroup, &rate, IID_IOPCItemMgt,
+                               reinterpret_cast<IUnknown **>(items.Out())),
+              S_OK);
+    ComPtr<IDataObject> data;
+    ASSERT_EQ(items.As(data), S_OK);
+    OPCITEMDEF def = {};
+    def.szItemID = const_cast<wchar_t *>(L"\\\\.\\proc1\\Counters.fast");
+    def.bActive = TRUE;
+    OPCITEMRESULT *results = nullptr;
+    HRESULT *errors = nullptr;
+    ASSERT_EQ(items->AddItems(1, &def, &results, &errors), S_OK);
+    CoTaskMemFree(results);
+    CoTaskMemFree(errors);
+
+    // The caller's target device is gone once DAdvise returns (as across
+    // the process boundary): later notifications carry the group's copy.
+    const DWORD size = sizeof(DVTARGETDEVICE) + 16;
+    auto *device = static_cast<DVTARGETDEVICE *>(CoTaskMemAlloc(size));
+    memset(device, 0x5A, size);
+    device->tdSize = size;
+    std::vector<BYTE> original(reinterpret_cast<BYTE *>(device), reinterpret_cast<BYTE *>(device) + size);
+    FORMATETC timed = {OpcStreams::DataTime(), device, DVASPECT_CONTENT, -1, TYMED_HGLOBAL};
+    TestAdviseSink sink;
+    DWORD id = 0;
+    ASSERT_EQ(data->DAdvise(&timed, 0, &sink, &id), S_OK);
+    memset(device, 0xEE, size);
+    CoTaskMemFree(device);
+    ASSERT_TRUE(sink.WaitFor([](auto &s) { return s.size() >= 3; }));
+    EXPECT_EQ(sink.Streams().back().device, original);
+    DVTARGETDEVICE tooSmall = {};
+    tooSmall.tdSize = 2;
+    timed.ptd = &tooSmall;
+    DWORD refused = 0;
+    EXPECT_EQ(data->DAdvise(&timed, 0, &sink, &refused), DV_E_DVTARGETDEVICE);
+    EXPECT_EQ(data->DUnadvise(id), S_OK);
+
+    ASSERT_EQ(server->RemoveGroup(hGroup, FALSE), OPC_S_INUSE);
+    timed.ptd = nullptr;
+    TestAdviseSink late;
+    id = 0;
+    EXPECT_EQ(data->DAdvise(&timed, 0, &late, &id), E_FAIL) << "a group whose removal has begun";
+    EXPECT_EQ(id, 0u);
+    EXPECT_TRUE(late.Streams().empty());
+}

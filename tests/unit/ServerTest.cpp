@@ -368,15 +368,18 @@ TEST(Server, CloningWhileTheServerIsReleasedNeverUsesAFreedServer)
         auto server = CreateInProcServer();
         auto g = AddGroup(server.Get(), L"source");
         std::atomic<bool> stop{false};
+        std::atomic<int> made{0};
         std::thread cloner([&] {
             CoInitializeEx(nullptr, COINIT_MULTITHREADED);
             while (!stop) {
                 ComPtr<IUnknown> clone;
                 g.group->CloneGroup(L"", IID_IUnknown, clone.Out());
+                ++made;
             }
             CoUninitialize();
         });
-        Sleep(5);
+        while (made < 20)
+            Sleep(0);
         server.Reset(); // final release while clones are being made
         Sleep(5);
         stop = true;
