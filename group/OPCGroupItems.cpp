@@ -94,16 +94,24 @@ STDMETHODIMP COPCGroup::AddItems(DWORD dwCount, OPCITEMDEF *pItemArray, OPCITEMR
 
 HRESULT COPCGroup::AddItemsLocked(DWORD count, const OPCITEMDEF *items, OPCITEMRESULT *results, HRESULT *errors)
 {
-    std::vector<OPCHANDLE> added;
-    auto undo = [&](HRESULT failure) {
-        for (auto it = added.rbegin(); it != added.rend(); ++it)
-            m_items.erase(*it);
-        return failure;
-    };
+    // The items this call added go again unless it completes: a failure, or
+    // an exception (out of memory) part-way, leaves the group as it was.
+    struct Undo {
+        COPCGroup &group;
+        std::vector<OPCHANDLE> added;
+        bool done = false;
+        ~Undo()
+        {
+            if (!done)
+                for (auto it = added.rbegin(); it != added.rend(); ++it)
+                    group.m_items.erase(*it);
+        }
+    } undo{*this, {}};
+    undo.added.reserve(count); // no allocation between an insertion and its record
     for (DWORD i = 0; i < count; ++i) {
         std::unique_ptr<COPCItem> item(new (std::nothrow) COPCItem());
         if (!item)
-            return undo(E_OUTOFMEMORY);
+            return E_OUTOFMEMORY;
         errors[i] = item->Init(this, items[i], results[i]);
         if (FAILED(errors[i])) {
             memset(&results[i], 0, sizeof results[i]);
@@ -112,10 +120,11 @@ HRESULT COPCGroup::AddItemsLocked(DWORD count, const OPCITEMDEF *items, OPCITEMR
         OPCHANDLE handle = item->ServerHandle();
         if (!m_items.emplace(handle, std::move(item)).second) {
             INTERNAL_ASSERT_FAILED("item handle already in the item map");
-            return undo(E_FAIL);
+            return E_FAIL;
         }
-        added.push_back(handle);
+        undo.added.push_back(handle);
     }
+    undo.done = true;
     return Overall(errors, count);
 }
 

@@ -1,19 +1,25 @@
 #include "ItemServices.h"
 
+#include "SyncObject.h"
+
 #include <atomic>
 
 namespace {
-std::atomic<OPCCadroClient *> g_client{nullptr};
+CCriticalSection g_clientLock;
+ComPtr<OPCCadroClient> g_client; // guarded by g_clientLock
 std::atomic<ItemServices::NodeLookup> g_lookup{nullptr};
 } // namespace
 
 void ItemServices::SetRealTimeClient(OPCCadroClient *client)
 {
-    g_client = client;
+    ComPtr<OPCCadroClient> previous(client); // the old one is released after the lock
+    CSingleLock lock(&g_clientLock);
+    std::swap(previous, g_client);
 }
 
-OPCCadroClient *ItemServices::RealTimeClient()
+ComPtr<OPCCadroClient> ItemServices::RealTimeClient()
 {
+    CSingleLock lock(&g_clientLock);
     return g_client;
 }
 

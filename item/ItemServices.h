@@ -1,17 +1,21 @@
 #pragma once
 // The process-wide services an item uses: the real-time client and the
 // address-space lookup. The server's services install them.
+#include "ComPtr.h"
+#include "OPCCadroClient.h"
+
 #include <oaidl.h>
 
 #include <string>
 
-class OPCCadroClient;
-
 namespace ItemServices {
 using NodeLookup = bool (*)(const std::wstring &itemId, VARTYPE &type, DWORD &rights);
 
+// The client is held by reference: an item creation that took it keeps it
+// (and the network session's end then only fails its subscription) while the
+// last server's release shuts the services down.
 void SetRealTimeClient(OPCCadroClient *client);
-OPCCadroClient *RealTimeClient();
+ComPtr<OPCCadroClient> RealTimeClient();
 void SetNodeLookup(NodeLookup lookup);
 // The canonical type and access rights of the address-space node that the
 // identifier names; false when the address space does not know it.

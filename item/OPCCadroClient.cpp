@@ -6,6 +6,7 @@
 #include <cstdio>
 #include <cwchar>
 #include <new>
+#include <utility>
 
 OPCCadroClient *OPCCadroClient::Create()
 {
@@ -27,16 +28,31 @@ HRESULT OPCCadroClient::Init()
 void OPCCadroClient::Shutdown()
 {
     Trace("Freeing OPCCadroClient\n");
-    if (m_realTime) {
+    CadroRealTime *realTime;
+    CadroSession *session;
+    {
+        CSingleLock lock(&m_lock);
+        realTime = std::exchange(m_realTime, nullptr);
+        session = std::exchange(m_session, nullptr);
+    }
+    // Released after the lock: a subscription in progress holds its own
+    // reference to the session.
+    if (realTime) {
         Trace("Releasing the CadroRealTime interface\n");
-        m_realTime->Release();
-        m_realTime = nullptr;
+        realTime->Release();
     }
-    if (m_session) {
+    if (session) {
         Trace("Releasing the CadroSession interface\n");
-        m_session->Release();
-        m_session = nullptr;
+        session->Release();
     }
+}
+
+CadroRealTime *OPCCadroClient::AcquireRealTime()
+{
+    CSingleLock lock(&m_lock);
+    if (m_realTime)
+        m_realTime->AddRef();
+    return m_realTime;
 }
 
 wchar_t *ExpandLocalMachine(const wchar_t *url, bool bareDot)
@@ -61,13 +77,16 @@ wchar_t *ExpandLocalMachine(const wchar_t *url, bool bareDot)
 HRESULT OPCCadroClient::Subscribe(const wchar_t *url, COPCItem *item, CadroDataItem **out)
 {
     *out = nullptr;
-    // No session (the factory failed): the network cannot know the item.
-    if (!m_realTime)
+    // No session (the factory failed, or the services shut down): the
+    // network cannot know the item.
+    CadroRealTime *realTime = AcquireRealTime();
+    if (!realTime)
         return E_FAIL;
     SubscribeOptions options = {13, 7, 0, 0, 0};
     wchar_t *expanded = ExpandLocalMachine(url);
-    HRESULT hr = m_realTime->Subscribe(expanded ? expanded : url, item, &options, out);
+    HRESULT hr = realTime->Subscribe(expanded ? expanded : url, item, &options, out);
     cdd_free(expanded);
+    realTime->Release();
     return hr;
 }
 

@@ -66,7 +66,7 @@ HRESULT COPCItem::Init(CItemOwner *group, const OPCITEMDEF &definition, OPCITEMR
         }
     }
     // Subscribed without the item lock: the library may call back at once.
-    if (OPCCadroClient *client = ItemServices::RealTimeClient()) {
+    if (ComPtr<OPCCadroClient> client = ItemServices::RealTimeClient()) {
         CadroDataItem *dataItem = nullptr;
         HRESULT hr = client->Subscribe(m_itemId.c_str(), this, &dataItem);
         if (FAILED(hr))

@@ -1,6 +1,7 @@
 // Item management and synchronous I/O of a group in this process, against
 // the simulated default network.
 #include "CadroSim.h"
+#include "FailingAllocations.h"
 #include "InProcServer.h"
 #include "OpcErrors.h"
 #include "ValueConversion.h"
@@ -429,4 +430,43 @@ TEST_F(ItemMgtTest, OneAddItemsBrowsesEachLevelOnceAndTheNextSeesTheNetworkAgain
     EXPECT_EQ(errors[2], S_OK);
     EXPECT_EQ(results[2].vtCanonicalDataType, VT_R8);
     Sim(L"reset");
+}
+
+TEST_F(ItemMgtTest, MemoryRunningOutPartWayThroughAddItemsLeavesOnlyWhatItReported)
+{
+    // Each allocation of the call fails in turn: a failed call leaves no item
+    // behind, a successful one exactly the items it reported.
+    std::vector<OPCITEMDEF> defs = {Def(kTemperature, 1), Def(kLimit, 2), Def(kLabel, 3), Def(kTemperature, 4)};
+    int failedCalls = 0;
+    for (long k = 0; k < 5000; ++k) {
+        OPCITEMRESULT *r = nullptr;
+        HRESULT *e = nullptr;
+        FailingAllocations::Arm(k);
+        HRESULT hr = items->AddItems(static_cast<DWORD>(defs.size()), defs.data(), &r, &e);
+        FailingAllocations::Disarm();
+        ComPtr<IEnumOPCItemAttributes> en;
+        items->CreateEnumerator(IID_IEnumOPCItemAttributes, reinterpret_cast<IUnknown **>(en.Out()));
+        size_t present = en ? Enumerate(en.Get()).size() : 0;
+        if (FAILED(hr)) {
+            ++failedCalls;
+            EXPECT_EQ(hr, E_OUTOFMEMORY);
+            EXPECT_EQ(present, 0u) << "allocation " << k;
+            continue;
+        }
+        std::vector<OPCHANDLE> added;
+        for (size_t i = 0; i < defs.size(); ++i)
+            if (SUCCEEDED(e[i]))
+                added.push_back(r[i].hServer);
+        CoTaskMemFree(r);
+        CoTaskMemFree(e);
+        EXPECT_EQ(present, added.size()) << "allocation " << k;
+        if (!added.empty()) {
+            HRESULT *removed = nullptr;
+            items->RemoveItems(static_cast<DWORD>(added.size()), added.data(), &removed);
+            CoTaskMemFree(removed);
+        }
+        if (hr == S_OK)
+            break; // every allocation of the call has failed once
+    }
+    EXPECT_GT(failedCalls, 3);
 }

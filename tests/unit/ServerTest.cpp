@@ -1,6 +1,7 @@
 #include "AsyncIOMgr.h"
 #include "ComModule.h"
 #include "InProcServer.h"
+#include "ItemServices.h"
 #include "OPCGroup.h"
 #include "OpcErrors.h"
 #include "Services.h"
@@ -63,6 +64,20 @@ TEST(Server, SharedServicesLiveWhileAnyServerObjectDoes)
     EXPECT_EQ(CUpdateScanMgr::RefCount(), 0);
     EXPECT_EQ(CAsyncIOMgr::RefCount(), 0);
     EXPECT_EQ(ComModule::LockCount(), locks);
+}
+
+TEST(Server, AnItemCreationHoldingTheRealTimeClientOutlivesTheServicesShutdown)
+{
+    // An AddItems in progress while the last server object goes: the item
+    // keeps the client it took, and its subscription fails cleanly.
+    auto server = CreateInProcServer();
+    ComPtr<OPCCadroClient> client = ItemServices::RealTimeClient();
+    ASSERT_TRUE(client);
+    server.Reset(); // the services shut down
+    EXPECT_FALSE(ItemServices::RealTimeClient());
+    CadroDataItem *item = nullptr;
+    EXPECT_EQ(client->Subscribe(L"\\\\.\\proc1\\Setpoints.temperature", nullptr, &item), E_FAIL);
+    EXPECT_EQ(item, nullptr);
 }
 
 TEST(Server, AggregatedServerAnswersThroughItsInnerUnknown)
