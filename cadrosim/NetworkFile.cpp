@@ -240,7 +240,9 @@ bool ParseMemberSpec(const std::vector<std::wstring> &tokens, size_t first, Memb
     }
     if (!hasLiteral)
         m.value = FromNumber(m.type, m.source.kind == SourceKind::Ramp ? m.source.min : m.source.offset);
-    m.hasValue = !m.stalled;
+    // A changing source has no value until it produces its first: the
+    // starting number is only where a counter counts from.
+    m.hasValue = !m.stalled && (hasLiteral || m.source.kind == SourceKind::Const);
     GetSystemTimeAsFileTime(&m.time);
     return true;
 }

@@ -69,7 +69,9 @@ void Shard::Schedule(const std::shared_ptr<Member> &member)
     if (member->scheduled || member->source.kind == SourceKind::Const || member->source.period == 0)
         return;
     member->scheduled = true;
-    m_heap.push({Clock::now() + std::chrono::milliseconds(member->source.period), member});
+    // A member without a value yet produces its first at once.
+    auto first = member->hasValue ? std::chrono::milliseconds(member->source.period) : std::chrono::milliseconds(0);
+    m_heap.push({Clock::now() + first, member});
     m_wake.notify_one();
 }
 

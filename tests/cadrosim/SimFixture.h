@@ -29,6 +29,7 @@ machine OTHER
   process q
     object z
       member tick type=number access=r source=counter period=20
+      member noisy type=number access=r source=random period=50 min=9.5 max=10.5
 )NET";
 
 inline std::wstring Host()

@@ -206,6 +206,19 @@ TEST_F(SimTest, AReleaseThatWaitsForACallbackOwnsItsSubscriptionUntilItReturns)
     recorder.onData = nullptr;
 }
 
+TEST_F(SimTest, AChangingSourceReportsNoValueBeforeItsFirst)
+{
+    // Its starting number (0 here) is nothing the source ever produces.
+    ASSERT_TRUE(Subscribe(L"\\\\other\\q\\z.noisy"));
+    void *cookie = LastCookie();
+    ASSERT_TRUE(recorder.WaitFor([&](auto &all) { return DataCount(all, cookie) >= 3; }));
+    for (const Delivery &d : Of(recorder.Snapshot(), cookie))
+        if (d.kind == Delivery::Data) {
+            EXPECT_GE(d.number, 9.5);
+            EXPECT_LE(d.number, 10.5);
+        }
+}
+
 TEST_F(SimTest, FaultsDisconnectStallAndBadQuality)
 {
     Subscribe(L"\\\\other\\q\\z.tick");

@@ -59,7 +59,10 @@ STDMETHODIMP TestSink::OnReadComplete(DWORD dwTransid, OPCHANDLE hGroup, HRESULT
 {
     Callback c = Make(Callback::ReadComplete, dwTransid, hGroup, hrMasterquality, hrMastererror);
     c.clients.assign(phClientItems, phClientItems + dwCount);
-    return Record(std::move(c), dwCount, pvValues, pwQualities, pErrors);
+    HRESULT hr = Record(std::move(c), dwCount, pvValues, pwQualities, pErrors);
+    if (onReadComplete)
+        onReadComplete(dwTransid);
+    return hr;
 }
 
 STDMETHODIMP TestSink::OnWriteComplete(DWORD dwTransid, OPCHANDLE hGroup, HRESULT hrMastererr, DWORD dwCount,

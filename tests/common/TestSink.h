@@ -48,6 +48,8 @@ public:
     std::atomic<HRESULT> dataChangeResult{S_OK};
     // Runs inside OnDataChange after recording (re-entrancy tests).
     std::function<void()> onDataChange;
+    // Runs inside OnReadComplete, after recording, with the transaction id.
+    std::function<void(DWORD)> onReadComplete;
     ULONG Refs() const { return m_refs; }
 
 private:
