@@ -12,8 +12,12 @@
 #include <vector>
 
 // Interface pointers of type I (AddRef'd copies).
+// kEmptyFails: Next of an empty enumerator answers E_FAIL, as the server's
+// group and name enumerators do; a connection enumerator without a sink just
+// runs out (S_FALSE), as every connection point's does.
 template <class I> struct EnumCopyInterface {
     using Item = I *;
+    static constexpr bool kEmptyFails = true;
     static bool Copy(Item &to, Item from)
     {
         to = from;
@@ -32,6 +36,7 @@ using EnumCopyUnknown = EnumCopyInterface<IUnknown>;
 
 struct EnumCopyConnection {
     using Item = CONNECTDATA;
+    static constexpr bool kEmptyFails = false;
     static bool Copy(Item &to, const Item &from)
     {
         to = from;
@@ -48,6 +53,7 @@ struct EnumCopyConnection {
 
 struct EnumCopyString {
     using Item = LPOLESTR;
+    static constexpr bool kEmptyFails = true;
     static bool Copy(Item &to, Item from)
     {
         to = from ? TaskStrDup(from) : nullptr;
@@ -85,7 +91,7 @@ public:
             return E_POINTER;
         CSingleLock lock(&m_lock);
         const std::vector<Item> &items = *m_items;
-        if (items.empty())
+        if (items.empty() && Policy::kEmptyFails)
             return E_FAIL;
         size_t remaining = items.size() - m_index;
         ULONG count = celt < remaining ? celt : static_cast<ULONG>(remaining);

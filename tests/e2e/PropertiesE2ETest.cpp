@@ -78,3 +78,46 @@ TEST(PropertiesE2E, PropertiesOfLeavesAndTheShutdownSlot)
     CoDisconnectObject(&first, 0);
     CoDisconnectObject(&second, 0);
 }
+
+TEST(PropertiesE2E, TheShutdownPointIsOneObjectAndItsConnectionsEnumerateAcrossTheBoundary)
+{
+    ShutdownSink sink;
+    ASSERT_TRUE(WaitForNoServerProcess(20000));
+    {
+        ComPtr<IOPCServer> server;
+        ASSERT_EQ(CoCreateInstance(CLSID_SkylarcOPCServerE2E, nullptr, CLSCTX_LOCAL_SERVER, IID_IOPCServer,
+                                   reinterpret_cast<void **>(server.Out())),
+                  S_OK);
+        ComPtr<IConnectionPointContainer> container;
+        ASSERT_EQ(server.As(container), S_OK);
+        ComPtr<IConnectionPoint> point, again;
+        ASSERT_EQ(container->FindConnectionPoint(IID_IOPCShutdown, point.Out()), S_OK);
+        ASSERT_EQ(container->FindConnectionPoint(IID_IOPCShutdown, again.Out()), S_OK);
+        EXPECT_EQ(point.Get(), again.Get()) << "one connection point object";
+
+        ComPtr<IEnumConnections> connections;
+        ASSERT_EQ(point->EnumConnections(connections.Out()), S_OK);
+        CONNECTDATA data = {};
+        ULONG fetched = 7;
+        EXPECT_EQ(connections->Next(1, &data, &fetched), S_FALSE) << "no sink: the enumerator just runs out";
+        EXPECT_EQ(fetched, 0u);
+
+        DWORD cookie = 0;
+        ASSERT_EQ(point->Advise(&sink, &cookie), S_OK);
+        connections.Reset();
+        ASSERT_EQ(point->EnumConnections(connections.Out()), S_OK);
+        // With a sink advised, Wine's own IEnumConnections proxy is at
+        // fault: it hands back a count of 0, the sink without the reference
+        // it should carry, and at times a result that is no HRESULT of ours.
+        // What is ours: the server answers, lets go of the sink, and exits.
+        for (int i = 0; i < 20; ++i) {
+            connections->Reset();
+            data = {};
+            connections->Next(1, &data, &fetched);
+        }
+        connections.Reset();
+        EXPECT_EQ(point->Unadvise(cookie), S_OK);
+    }
+    EXPECT_TRUE(WaitForNoServerProcess(20000)) << "the server did not exit";
+    CoDisconnectObject(&sink, 0);
+}

@@ -232,6 +232,11 @@ TEST_F(AsyncTest, ConnectionPointRules)
     EXPECT_EQ(point->Advise(&other, &c2), S_OK) << "free again after Unadvise";
     EXPECT_EQ(point->Unadvise(c2), S_OK);
     EXPECT_EQ(point->Advise(nullptr, &c2), E_POINTER);
+    ComPtr<IEnumConnections> empty;
+    ASSERT_EQ(point->EnumConnections(empty.Out()), S_OK);
+    ULONG fetched = 7;
+    EXPECT_EQ(empty->Next(1, &data, &fetched), S_FALSE) << "without a sink the enumerator just runs out";
+    EXPECT_EQ(fetched, 0u);
     EXPECT_EQ(async->SetEnable(TRUE), CONNECT_E_NOCONNECTION);
     EXPECT_EQ(other.Refs(), 1u) << "the group released the sink";
 

@@ -77,6 +77,15 @@ HRESULT ItemGroup::Create(IOPCServer *server, DWORD rate, bool active, float dea
     return hr;
 }
 
+HRESULT ItemGroup::Activate()
+{
+    ComPtr<IOPCGroupStateMgt> state;
+    HRESULT hr = m_items.As(state);
+    BOOL active = TRUE;
+    DWORD revised = 0;
+    return SUCCEEDED(hr) ? state->SetState(nullptr, &revised, &active, nullptr, nullptr, nullptr, nullptr) : hr;
+}
+
 HRESULT ItemGroup::Add(const std::vector<std::wstring> &ids, VARTYPE requested, std::vector<Item> &items)
 {
     std::vector<OPCITEMDEF> defs(ids.size());

@@ -50,6 +50,8 @@ public:
     // Adds every identifier, active, with client handles 0..n-1.
     HRESULT Add(const std::vector<std::wstring> &ids, VARTYPE requested, std::vector<Item> &items);
     template <class I> HRESULT As(ComPtr<I> &out) const { return m_items.As(out); }
+    // Makes the group active (its first scan reports every item at once).
+    HRESULT Activate();
     // The handles of the items that were added, and their client handles.
     static void Valid(const std::vector<Item> &items, std::vector<OPCHANDLE> &servers, std::vector<size_t> &which);
 

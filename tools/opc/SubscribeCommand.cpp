@@ -193,8 +193,10 @@ int Subscribe(const Arguments &args, Output &out, Connection &server)
     }
     ItemGroup group;
     std::vector<ItemGroup::Item> items;
+    // Made active only once the sink is connected, so that the first scan,
+    // which reports every item, reaches it: a constant is reported once.
     HRESULT hr =
-        group.Create(server.Server(), static_cast<DWORD>(limits.rate), true, static_cast<float>(limits.deadband));
+        group.Create(server.Server(), static_cast<DWORD>(limits.rate), false, static_cast<float>(limits.deadband));
     if (SUCCEEDED(hr))
         hr = group.Add(args.Positional(), requested, items);
     if (FAILED(hr) && items.empty()) {
@@ -224,6 +226,8 @@ int Subscribe(const Arguments &args, Output &out, Connection &server)
     {
         Advice advice;
         hr = sink ? advice.Start(group, sink.Get(), da1, format) : E_OUTOFMEMORY;
+        if (SUCCEEDED(hr))
+            hr = group.Activate();
         if (FAILED(hr)) {
             out.Error(std::wstring(L"subscribe: the group takes no ") + (da1 ? L"data stream" : L"callback") + L": " +
                       server.Describe(hr));
