@@ -203,12 +203,18 @@ void Round(IOPCServer *server, int worker, long round, Recorder &r, CountingSink
     r.Time("RemoveGroup", {S_OK}, [&] { return server->RemoveGroup(hGroup, FALSE); });
 }
 
+ComPtr<IOPCServer> CreateServer()
+{
+    ComPtr<IOPCServer> server;
+    CoCreateInstance(kServer, nullptr, CLSCTX_LOCAL_SERVER, IID_IOPCServer, reinterpret_cast<void **>(server.Out()));
+    return server;
+}
+
 int Worker(int worker, double seconds, double warmSeconds)
 {
     CoInitializeEx(nullptr, COINIT_MULTITHREADED);
-    ComPtr<IOPCServer> server;
-    if (FAILED(CoCreateInstance(kServer, nullptr, CLSCTX_LOCAL_SERVER, IID_IOPCServer,
-                                reinterpret_cast<void **>(server.Out())))) {
+    ComPtr<IOPCServer> server = CreateServer();
+    if (!server) {
         printf("error no server\n");
         return 1;
     }
@@ -303,9 +309,8 @@ int Parent(int clients, double minutes)
     CoInitializeEx(nullptr, COINIT_MULTITHREADED);
     // This process holds the server for the whole run, so that its memory is
     // measured in one process from start to end.
-    ComPtr<IOPCServer> server;
-    if (FAILED(CoCreateInstance(kServer, nullptr, CLSCTX_LOCAL_SERVER, IID_IOPCServer,
-                                reinterpret_cast<void **>(server.Out())))) {
+    ComPtr<IOPCServer> server = CreateServer();
+    if (!server) {
         printf("the server could not be created (is it registered?)\n");
         return 1;
     }

@@ -237,7 +237,7 @@ void Engine::Unsubscribe(Subscription *sub)
         receiver->Release();
         return;
     }
-    case Shard::Disposal::AfterBatch:
+    case Shard::Disposal::AfterUnit:
         return;
     }
 }

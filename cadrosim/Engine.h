@@ -73,7 +73,7 @@ public:
     enum class Disposal {
         Now,        // the caller, at once
         AfterQueue, // the shard, when its queued events come up
-        AfterBatch  // the shard, after the batch of callbacks it was released from
+        AfterUnit   // the shard, after the event or tick whose callback released it
     };
     Disposal Release(Subscription *sub, std::unique_lock<SlimMutex> &l);
     bool OnShardThread() const { return GetCurrentThreadId() == m_threadId; }
@@ -87,31 +87,29 @@ private:
     };
 
     void Run(unsigned generation);
-    // Between batches: deletes, with the lock released, the subscriptions
+    // Between units: deletes, with the lock released, the subscriptions
     // released from inside callbacks that nothing refers to any more.
     void Sweep(std::unique_lock<SlimMutex> &l);
     void Tick(std::unique_lock<SlimMutex> &l, const std::shared_ptr<Member> &member, Clock::time_point at);
     void Dispatch(std::unique_lock<SlimMutex> &l, Event e);
-    // Runs callbacks with the lock released, then wakes waiting releases.
+    // Runs callbacks with the lock released (always inside a unit).
     template <class F> void Deliver(std::unique_lock<SlimMutex> &l, F callbacks);
     // One event or tick of the shard's thread, which may deliver several
-    // batches and read its subscriptions between them.
+    // batches and read its subscriptions between them; wakes waiting
+    // releases when it ends.
     template <class F> void Unit(F work);
+    bool InUnit() const { return m_unitsFinished != m_unitsStarted; }
 
     Engine &m_engine;
     SlimCondition m_wake;
-    SlimCondition m_batchDone;
+    SlimCondition m_unitDone;
     std::deque<Event> m_events;
     std::priority_queue<Due, std::vector<Due>, std::greater<Due>> m_heap;
     std::vector<Subscription *> m_graveyard;
-    bool m_delivering = false;
-    // Batches of callbacks begun and ended; a release waits only for the
-    // batch in flight when it detached, never for an idle moment.
-    uint64_t m_batchesStarted = 0;
-    uint64_t m_batchesFinished = 0;
-    // The same for the shard thread's units of work: a release from another
-    // thread waits for the unit in flight, as the unit still reads the
-    // subscription after its batch.
+    // Units of work of the shard's thread begun and ended: a release from
+    // another thread waits only for the unit in flight when it detached
+    // (which may still read the subscription after a batch of callbacks),
+    // never for an idle moment.
     uint64_t m_unitsStarted = 0;
     uint64_t m_unitsFinished = 0;
     unsigned m_generation = 0;

@@ -83,18 +83,18 @@ Shard::Disposal Shard::Release(Subscription *sub, std::unique_lock<SlimMutex> &l
     subs[sub->slot] = subs.back();
     subs[sub->slot]->slot = sub->slot;
     subs.pop_back();
-    if (OnShardThread() && m_unitsFinished != m_unitsStarted) {
+    if (!InUnit())
+        return sub->queued == 0 ? Disposal::Now : Disposal::AfterQueue;
+    if (OnShardThread()) {
         m_graveyard.push_back(sub); // released from inside a callback of this unit
-        return Disposal::AfterBatch;
+        return Disposal::AfterUnit;
     }
-    if (m_delivering || m_unitsFinished != m_unitsStarted) {
-        // Held like a queued event while the lock is let go for the wait,
-        // so that the shard does not delete it when its last event comes up.
-        ++sub->queued;
-        uint64_t batch = m_batchesStarted, unit = m_unitsStarted;
-        m_batchDone.wait(l, [this, batch, unit] { return m_batchesFinished >= batch && m_unitsFinished >= unit; });
-        --sub->queued;
-    }
+    // Held like a queued event while the lock is let go for the wait, so
+    // that the shard does not delete it when its last event comes up.
+    ++sub->queued;
+    uint64_t unit = m_unitsStarted;
+    m_unitDone.wait(l, [this, unit] { return m_unitsFinished >= unit; });
+    --sub->queued;
     // Queued events are skipped when they come up; the last one deletes it.
     return sub->queued == 0 ? Disposal::Now : Disposal::AfterQueue;
 }
@@ -119,14 +119,9 @@ void Shard::Sweep(std::unique_lock<SlimMutex> &l)
 
 template <class F> void Shard::Deliver(std::unique_lock<SlimMutex> &l, F callbacks)
 {
-    uint64_t batch = ++m_batchesStarted;
-    m_delivering = true;
     l.unlock();
     callbacks();
     l.lock();
-    m_batchesFinished = batch;
-    m_delivering = false;
-    m_batchDone.notify_all();
 }
 
 template <class F> void Shard::Unit(F work)
@@ -134,7 +129,7 @@ template <class F> void Shard::Unit(F work)
     uint64_t unit = ++m_unitsStarted;
     work();
     m_unitsFinished = unit;
-    m_batchDone.notify_all();
+    m_unitDone.notify_all();
 }
 
 void Shard::Run(unsigned generation)

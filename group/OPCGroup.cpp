@@ -137,16 +137,16 @@ void COPCGroup::ReleaseWork()
         InnerUnknown()->Release();
 }
 
-void COPCGroup::BeginCallback()
+void COPCGroup::BeginCallback(const Caller &caller)
 {
     CSingleLock lock(&m_lock);
-    m_callbacks.push_back(Caller::Current());
+    m_callbacks.push_back(caller);
 }
 
-void COPCGroup::EndCallback()
+void COPCGroup::EndCallback(const Caller &caller)
 {
     CSingleLock lock(&m_lock);
-    auto it = std::find(m_callbacks.begin(), m_callbacks.end(), Caller::Current());
+    auto it = std::find(m_callbacks.begin(), m_callbacks.end(), caller);
     if (it != m_callbacks.end())
         m_callbacks.erase(it);
     WakeRemoval();

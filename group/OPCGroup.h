@@ -201,20 +201,21 @@ private:
     class ScanColumns;
     // Client callbacks in flight, by the logical thread that makes them: a
     // removal from inside one of them does not wait for it.
-    void BeginCallback();
-    void EndCallback();
     struct Caller {
         GUID logicalThread;
         DWORD thread;
         bool operator==(const Caller &o) const;
         static Caller Current();
     };
+    void BeginCallback(const Caller &caller);
+    void EndCallback(const Caller &caller);
     LONG CallbacksOf(const Caller &caller) const;
     void WakeRemoval();
     struct CallbackInFlight {
-        explicit CallbackInFlight(COPCGroup &g) : group(g) { group.BeginCallback(); }
-        ~CallbackInFlight() { group.EndCallback(); }
+        explicit CallbackInFlight(COPCGroup &g) : group(g), caller(Caller::Current()) { group.BeginCallback(caller); }
+        ~CallbackInFlight() { group.EndCallback(caller); }
         COPCGroup &group;
+        const Caller caller;
     };
     // Reads the handles and sends the results through one of the two
     // callbacks that carry values; the lock (held on entry) is released for

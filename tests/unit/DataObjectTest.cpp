@@ -39,6 +39,38 @@ struct TwoItems {
     }
     ~TwoItems() { VariantClear(&values[1]); }
 };
+// An active group of 50 ms in a server of this process, with the given
+// items (active, client handles 1, 2, ...) and its IDataObject.
+struct V1Group {
+    ComPtr<IOPCServer> server;
+    OPCHANDLE handle = 0;
+    ComPtr<IOPCItemMgt> items;
+    ComPtr<IDataObject> data;
+    std::vector<OPCHANDLE> handles;
+};
+
+void MakeV1Group(const wchar_t *name, OPCHANDLE clientGroup, const std::vector<const wchar_t *> &ids, V1Group &g)
+{
+    g.server = CreateInProcServer();
+    DWORD rate;
+    ASSERT_EQ(g.server->AddGroup(name, TRUE, 50, clientGroup, nullptr, nullptr, 0, &g.handle, &rate, IID_IOPCItemMgt,
+                                 reinterpret_cast<IUnknown **>(g.items.Out())),
+              S_OK);
+    ASSERT_EQ(g.items.As(g.data), S_OK);
+    std::vector<OPCITEMDEF> defs(ids.size());
+    for (size_t i = 0; i < ids.size(); ++i) {
+        defs[i].szItemID = const_cast<wchar_t *>(ids[i]);
+        defs[i].bActive = TRUE;
+        defs[i].hClient = static_cast<OPCHANDLE>(i + 1);
+    }
+    OPCITEMRESULT *results = nullptr;
+    HRESULT *errors = nullptr;
+    ASSERT_EQ(g.items->AddItems(static_cast<DWORD>(defs.size()), defs.data(), &results, &errors), S_OK);
+    for (size_t i = 0; i < ids.size(); ++i)
+        g.handles.push_back(results[i].hServer);
+    CoTaskMemFree(results);
+    CoTaskMemFree(errors);
+}
 } // namespace
 
 TEST(Streams, DataWithTimeMatchesTheLayout)
@@ -95,30 +127,16 @@ TEST(Streams, DataAndWriteCompleteMatchTheirLayouts)
 
 TEST(DataObject, AdviseReadWriteAndSubscriptionStreams)
 {
-    auto server = CreateInProcServer();
-    OPCHANDLE hGroup;
-    DWORD rate;
-    ComPtr<IOPCItemMgt> items;
-    ASSERT_EQ(server->AddGroup(L"v1", TRUE, 50, 66, nullptr, nullptr, 0, &hGroup, &rate, IID_IOPCItemMgt,
-                               reinterpret_cast<IUnknown **>(items.Out())),
-              S_OK);
-    ComPtr<IDataObject> data;
+    V1Group g;
+    ASSERT_NO_FATAL_FAILURE(
+        MakeV1Group(L"v1", 66, {L"\\\\.\\proc1\\Setpoints.temperature", L"\\\\.\\proc1\\Counters.fast"}, g));
+    auto &server = g.server;
+    auto &data = g.data;
+    OPCHANDLE hGroup = g.handle;
     ComPtr<IOPCAsyncIO> async;
-    ASSERT_EQ(items.As(data), S_OK);
-    ASSERT_EQ(items.As(async), S_OK);
-    OPCITEMDEF defs[2] = {};
-    defs[0].szItemID = const_cast<wchar_t *>(L"\\\\.\\proc1\\Setpoints.temperature");
-    defs[0].bActive = TRUE;
-    defs[0].hClient = 1;
-    defs[1].szItemID = const_cast<wchar_t *>(L"\\\\.\\proc1\\Counters.fast");
-    defs[1].bActive = TRUE;
-    defs[1].hClient = 2;
-    OPCITEMRESULT *results = nullptr;
+    ASSERT_EQ(g.items.As(async), S_OK);
+    OPCHANDLE *handles = g.handles.data();
     HRESULT *errors = nullptr;
-    ASSERT_EQ(items->AddItems(2, defs, &results, &errors), S_OK);
-    OPCHANDLE handles[] = {results[0].hServer, results[1].hServer};
-    CoTaskMemFree(results);
-    CoTaskMemFree(errors);
 
     FORMATETC timed = {OpcStreams::DataTime(), nullptr, DVASPECT_CONTENT, -1, TYMED_HGLOBAL};
     FORMATETC plain = timed;
@@ -182,23 +200,11 @@ TEST(DataObject, AdviseReadWriteAndSubscriptionStreams)
 
 TEST(DataObject, AdviseKeepsItsOwnTargetDeviceAndARemovedGroupRefusesIt)
 {
-    auto server = CreateInProcServer();
-    OPCHANDLE hGroup;
-    DWORD rate;
-    ComPtr<IOPCItemMgt> items;
-    ASSERT_EQ(server->AddGroup(L"device", TRUE, 50, 67, nullptr, nullptr, 0, &hGroup, &rate, IID_IOPCItemMgt,
-                               reinterpret_cast<IUnknown **>(items.Out())),
-              S_OK);
-    ComPtr<IDataObject> data;
-    ASSERT_EQ(items.As(data), S_OK);
-    OPCITEMDEF def = {};
-    def.szItemID = const_cast<wchar_t *>(L"\\\\.\\proc1\\Counters.fast");
-    def.bActive = TRUE;
-    OPCITEMRESULT *results = nullptr;
-    HRESULT *errors = nullptr;
-    ASSERT_EQ(items->AddItems(1, &def, &results, &errors), S_OK);
-    CoTaskMemFree(results);
-    CoTaskMemFree(errors);
+    V1Group g;
+    ASSERT_NO_FATAL_FAILURE(MakeV1Group(L"device", 67, {L"\\\\.\\proc1\\Counters.fast"}, g));
+    auto &server = g.server;
+    auto &data = g.data;
+    OPCHANDLE hGroup = g.handle;
 
     // The caller's target device is gone once DAdvise returns (as across
     // the process boundary): later notifications carry the group's copy.
