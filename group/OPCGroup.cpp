@@ -186,7 +186,7 @@ void COPCGroup::Destroy()
     m_destroyed = true;
     m_removing = true;
     m_callback.Close();
-    m_items.clear(); // each item leaves the active list and ends its subscription
+    m_items.Clear(); // each item leaves the active list and ends its subscription
     if (m_serverHandle != 0)
         CIdMgr::Instance().ReleaseId(m_serverHandle);
     m_owner = nullptr;
@@ -214,8 +214,7 @@ void COPCGroup::SetActive(BOOL active)
             WakeRemoval();
             InnerUnknown()->Release(); // the caller holds another reference
         }
-        for (auto &entry : m_items)
-            entry.second->SetOutOfService();
+        m_items.ForEach([](COPCItem &item) { item.SetOutOfService(); });
     } else if (scanner) {
         InnerUnknown()->AddRef();
         ++m_pendingWork;

@@ -8,6 +8,7 @@
 #include "GroupRegistry.h"
 #include "Handle.h"
 #include "ItemOwner.h"
+#include "ItemTable.h"
 #include "OPCItem.h"
 #include "SingleSinkPoint.h"
 #include "SyncObject.h"
@@ -16,13 +17,14 @@
 
 #include <atomic>
 #include <functional>
-#include <map>
 #include <memory>
 #include <ocidl.h>
 #include <string>
 #include <vector>
 
 struct Delivery;
+
+struct ItemAttributesSnapshot;
 
 class COPCGroup : public CComObjectRoot,
                   public IOPCGroupStateMgt,
@@ -194,7 +196,7 @@ protected:
 private:
     // CItemOwner
     CSyncObject &GroupLock() override { return m_lock; }
-    ActiveItemList &ActiveItems() override { return m_activeItems; }
+    CActiveItemList &ActiveItems() override { return m_activeItems; }
     bool GroupActive() const override { return m_active != FALSE; }
 
     COPCItem *FindItem(OPCHANDLE handle);
@@ -272,6 +274,8 @@ private:
                                  TaskMem<OPCITEMRESULT> &results, TaskMem<HRESULT> &errors);
     HRESULT AddItemsLocked(DWORD count, const OPCITEMDEF *items, OPCITEMRESULT *results, HRESULT *errors);
     HRESULT CopyItems(IOPCItemMgt *target);
+    // Every item's attributes, in handle order; false when memory is short.
+    bool TakeAttributes(ItemAttributesSnapshot &snapshot);
 
     template <class T, class... Args> friend T *NewComObject(Args &&...args);
     COPCGroup();
@@ -283,8 +287,8 @@ private:
     LONG m_removalsWaiting = 0;
     LONG m_handedOverReferences = 0;
     CGroupOwner *m_owner = nullptr;
-    std::map<OPCHANDLE, std::unique_ptr<COPCItem>> m_items;
-    ActiveItemList m_activeItems;
+    CItemTable m_items;
+    CActiveItemList m_activeItems;
     CSinkSlot m_callback{IID_IOPCDataCallback, kCallbackCookie, InnerUnknown()}; // the one IOPCDataCallback sink
     CAdvisoryConnectionMgr m_dataAdvise;
     CAdvisoryConnectionMgr m_dataTimeAdvise;

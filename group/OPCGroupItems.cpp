@@ -27,8 +27,7 @@ HRESULT Overall(const HRESULT *errors, DWORD count)
 
 COPCItem *COPCGroup::FindItem(OPCHANDLE handle)
 {
-    auto it = m_items.find(handle);
-    return it == m_items.end() ? nullptr : it->second.get();
+    return m_items.Find(handle);
 }
 
 template <class PerItem>
@@ -104,12 +103,13 @@ HRESULT COPCGroup::AddItemsLocked(DWORD count, const OPCITEMDEF *items, OPCITEMR
         {
             if (!done)
                 for (auto it = added.rbegin(); it != added.rend(); ++it)
-                    group.m_items.erase(*it);
+                    group.m_items.Erase(*it);
         }
     } undo{*this, {}};
     undo.added.reserve(count); // no allocation between an insertion and its record
+    m_items.Reserve(count);
     for (DWORD i = 0; i < count; ++i) {
-        std::unique_ptr<COPCItem> item(new (std::nothrow) COPCItem());
+        std::unique_ptr<COPCItem> item = COPCItem::Create(items[i]);
         if (!item)
             return E_OUTOFMEMORY;
         errors[i] = item->Init(this, items[i], results[i]);
@@ -118,7 +118,7 @@ HRESULT COPCGroup::AddItemsLocked(DWORD count, const OPCITEMDEF *items, OPCITEMR
             continue; // the item goes, ending any subscription it made
         }
         OPCHANDLE handle = item->ServerHandle();
-        if (!m_items.emplace(handle, std::move(item)).second) {
+        if (!m_items.Insert(std::move(item))) {
             INTERNAL_ASSERT_FAILED("item handle already in the item map");
             return E_FAIL;
         }
@@ -174,7 +174,7 @@ STDMETHODIMP COPCGroup::RemoveItems(DWORD dwCount, OPCHANDLE *phServer, HRESULT 
 {
     return ComBoundary([&]() -> HRESULT {
         return ForEachHandle(dwCount, phServer, ppErrors, [this](DWORD, COPCItem &item) -> HRESULT {
-            if (m_items.erase(item.ServerHandle()) != 1) {
+            if (!m_items.Erase(item.ServerHandle())) {
                 INTERNAL_ASSERT_FAILED("item erase");
                 return E_FAIL;
             }
@@ -232,11 +232,8 @@ STDMETHODIMP COPCGroup::CreateEnumerator(REFIID riid, LPUNKNOWN *ppUnk)
         if (!IsEqualIID(riid, IID_IEnumOPCItemAttributes))
             return E_INVALIDARG;
         auto snapshot = std::make_shared<ItemAttributesSnapshot>();
-        snapshot->records.resize(m_items.size());
-        size_t i = 0;
-        for (auto &entry : m_items)
-            if (FAILED(entry.second->GetAttributes(snapshot->records[i++], malloc)))
-                return E_OUTOFMEMORY;
+        if (!TakeAttributes(*snapshot))
+            return E_OUTOFMEMORY;
         HRESULT hr = CEnumOPCItemAttributes::Create(snapshot, 0, riid, reinterpret_cast<void **>(ppUnk));
         if (FAILED(hr))
             return hr == E_OUTOFMEMORY ? hr : E_FAIL;
@@ -244,16 +241,23 @@ STDMETHODIMP COPCGroup::CreateEnumerator(REFIID riid, LPUNKNOWN *ppUnk)
     });
 }
 
+bool COPCGroup::TakeAttributes(ItemAttributesSnapshot &snapshot)
+{
+    snapshot.records.resize(m_items.size());
+    size_t i = 0;
+    bool complete = true;
+    m_items.ForEach(
+        [&](COPCItem &item) { complete = complete && SUCCEEDED(item.GetAttributes(snapshot.records[i++], malloc)); });
+    return complete;
+}
+
 HRESULT COPCGroup::CopyItems(IOPCItemMgt *target)
 {
     ItemAttributesSnapshot attributes;
     {
         CSingleLock lock(&m_lock);
-        attributes.records.resize(m_items.size());
-        size_t i = 0;
-        for (auto &entry : m_items)
-            if (FAILED(entry.second->GetAttributes(attributes.records[i++], malloc)))
-                return E_OUTOFMEMORY;
+        if (!TakeAttributes(attributes))
+            return E_OUTOFMEMORY;
     }
     if (attributes.records.empty())
         return S_OK;

@@ -114,11 +114,11 @@ HRESULT COPCGroup::ReadForProperties(const wchar_t *itemId, PropertyRead &out)
     def.szItemID = const_cast<wchar_t *>(itemId);
     def.hClient = 100;
     OPCITEMRESULT result = {};
-    std::unique_ptr<COPCItem> item(new (std::nothrow) COPCItem());
+    std::unique_ptr<COPCItem> item = COPCItem::Create(def);
     if (!item || FAILED(item->Init(this, def, result)))
         return E_FAIL;
     COPCItem *raw = item.get();
-    if (!m_items.emplace(raw->ServerHandle(), std::move(item)).second)
+    if (!m_items.Insert(std::move(item)))
         return E_FAIL;
     OPCHANDLE client;
     HRESULT hr = raw->Read(OPC_DS_DEVICE, &client, out.value.Get(), &out.quality, &out.time);

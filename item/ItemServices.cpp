@@ -28,7 +28,7 @@ void ItemServices::SetNodeLookup(NodeLookup lookup)
     g_lookup = lookup;
 }
 
-bool ItemServices::FindNode(const std::wstring &itemId, VARTYPE &type, DWORD &rights)
+bool ItemServices::FindNode(std::wstring_view itemId, VARTYPE &type, DWORD &rights)
 {
     NodeLookup lookup = g_lookup;
     return lookup && lookup(itemId, type, rights);

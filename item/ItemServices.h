@@ -9,7 +9,7 @@
 #include <string>
 
 namespace ItemServices {
-using NodeLookup = bool (*)(const std::wstring &itemId, VARTYPE &type, DWORD &rights);
+using NodeLookup = bool (*)(std::wstring_view itemId, VARTYPE &type, DWORD &rights);
 
 // The client is held by reference: an item creation that took it keeps it
 // (and the network session's end then only fails its subscription) while the
@@ -19,5 +19,5 @@ ComPtr<OPCCadroClient> RealTimeClient();
 void SetNodeLookup(NodeLookup lookup);
 // The canonical type and access rights of the address-space node that the
 // identifier names; false when the address space does not know it.
-bool FindNode(const std::wstring &itemId, VARTYPE &type, DWORD &rights);
+bool FindNode(std::wstring_view itemId, VARTYPE &type, DWORD &rights);
 } // namespace ItemServices

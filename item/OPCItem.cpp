@@ -16,16 +16,48 @@ bool IsZero(const FILETIME &t)
     return t.dwLowDateTime == 0 && t.dwHighDateTime == 0;
 }
 
-wchar_t *CopyText(const std::wstring &text, void *(*allocate)(size_t))
+wchar_t *CopyText(std::wstring_view text, void *(*allocate)(size_t))
 {
     auto *copy = static_cast<wchar_t *>(allocate((text.size() + 1) * sizeof(wchar_t)));
-    if (copy)
-        memcpy(copy, text.c_str(), (text.size() + 1) * sizeof(wchar_t));
+    if (copy) {
+        memcpy(copy, text.data(), text.size() * sizeof(wchar_t));
+        copy[text.size()] = L'\0';
+    }
     return copy;
+}
+
+size_t TextLength(const wchar_t *text)
+{
+    return text ? wcslen(text) : 0;
 }
 } // namespace
 
-COPCItem::COPCItem() = default;
+std::unique_ptr<COPCItem> COPCItem::Create(const OPCITEMDEF &definition)
+{
+    size_t idLength = TextLength(definition.szItemID);
+    size_t pathLength = TextLength(definition.szAccessPath);
+    if (idLength > UINT32_MAX / 4 || pathLength > UINT32_MAX / 4)
+        return nullptr;
+    return std::unique_ptr<COPCItem>(new (idLength + pathLength + 2, std::nothrow)
+                                         COPCItem(definition.szItemID, idLength, definition.szAccessPath, pathLength));
+}
+
+void *COPCItem::operator new(size_t size, size_t textChars, const std::nothrow_t &) noexcept
+{
+    return ::operator new(size + textChars * sizeof(wchar_t), std::nothrow);
+}
+
+COPCItem::COPCItem(const wchar_t *itemId, size_t itemIdLength, const wchar_t *accessPath, size_t accessPathLength)
+    : m_itemIdLength(static_cast<uint32_t>(itemIdLength)), m_accessPathLength(static_cast<uint32_t>(accessPathLength))
+{
+    auto *texts = const_cast<wchar_t *>(Texts());
+    if (itemIdLength)
+        memcpy(texts, itemId, itemIdLength * sizeof(wchar_t));
+    texts[itemIdLength] = L'\0';
+    if (accessPathLength)
+        memcpy(texts + itemIdLength + 1, accessPath, accessPathLength * sizeof(wchar_t));
+    texts[itemIdLength + 1 + accessPathLength] = L'\0';
+}
 
 COPCItem::~COPCItem()
 {
@@ -42,20 +74,18 @@ HRESULT COPCItem::Init(CItemOwner *group, const OPCITEMDEF &definition, OPCITEMR
         CSingleLock lock(&m_lock);
         memset(&result, 0, sizeof result);
         m_group = group;
-        m_accessPath = definition.szAccessPath ? definition.szAccessPath : L"";
-        m_itemId = definition.szItemID ? definition.szItemID : L"";
         m_clientHandle = definition.hClient;
         m_requestedType = definition.vtRequestedDataType;
         m_serverHandle = CIdMgr::Instance().GetId();
         m_accessRights = OPC_READABLE | OPC_WRITEABLE;
         m_canonicalType = VT_EMPTY;
-        if (m_itemId.empty())
+        if (m_itemIdLength == 0)
             return OPC_E_INVALIDITEMID;
         if (m_serverHandle == 0)
             return E_OUTOFMEMORY; // no identifier left for a handle
         DWORD rights;
         VARTYPE type;
-        if (ItemServices::FindNode(m_itemId, type, rights)) {
+        if (ItemServices::FindNode(ItemId(), type, rights)) {
             m_canonicalType = type;
             m_accessRights = rights;
         } else {
@@ -68,7 +98,7 @@ HRESULT COPCItem::Init(CItemOwner *group, const OPCITEMDEF &definition, OPCITEMR
     // Subscribed without the item lock: the library may call back at once.
     if (ComPtr<OPCCadroClient> client = ItemServices::RealTimeClient()) {
         CadroDataItem *dataItem = nullptr;
-        HRESULT hr = client->Subscribe(m_itemId.c_str(), this, &dataItem);
+        HRESULT hr = client->Subscribe(Texts(), this, &dataItem);
         if (FAILED(hr))
             return OPC_E_UNKNOWNITEMID;
         m_dataItem = dataItem;
@@ -92,12 +122,11 @@ HRESULT COPCItem::SetActive(BOOL active)
     CSingleLock groupLock(&m_group->GroupLock());
     m_active = active;
     if (!active) {
-        m_group->ActiveItems().erase(m_activePosition);
+        m_group->ActiveItems().Erase(this);
         if (m_group->GroupActive())
             m_lastQuality = OPC_QUALITY_OUT_OF_SERVICE;
     } else {
-        m_group->ActiveItems().push_front(this);
-        m_activePosition = m_group->ActiveItems().begin();
+        m_group->ActiveItems().PushFront(this);
     }
     return S_OK;
 }
@@ -137,8 +166,8 @@ HRESULT COPCItem::GetAttributes(OPCITEMATTRIBUTES &record, void *(*allocate)(siz
 {
     CSingleLock lock(&m_lock);
     memset(&record, 0, sizeof record);
-    record.szAccessPath = CopyText(m_accessPath, allocate);
-    record.szItemID = CopyText(m_itemId, allocate);
+    record.szAccessPath = CopyText(AccessPath(), allocate);
+    record.szItemID = CopyText(ItemId(), allocate);
     record.bActive = m_active;
     record.hClient = m_clientHandle;
     record.hServer = m_serverHandle;
@@ -239,7 +268,6 @@ HRESULT COPCItem::Write(const VARIANT &value)
                 hr = E_FAIL;
         }
     }
-    m_writeResult = hr;
     return hr;
 }
 

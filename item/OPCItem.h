@@ -3,6 +3,11 @@
 // handles, types, rights, the newest network value (device record), the
 // value last handed to the client (last reported record) and the item's own
 // network subscription. Owned and deleted by its group.
+//
+// An item is one heap block: its identifier and access path follow the
+// object in the same allocation, and it links itself into the group's active
+// list. A plant adds tens of thousands of items, each of which would
+// otherwise cost three or four more blocks.
 #include "CadroNetwork.h"
 #include "ItemOwner.h"
 #include "ManualResetEvent.h"
@@ -10,15 +15,22 @@
 #include "ValueConversion.h"
 #include "opcda.h"
 
-#include <string>
+#include <cstdint>
+#include <memory>
+#include <new>
+#include <string_view>
 
 class COPCItem {
 public:
-    COPCItem();
-    virtual ~COPCItem();
+    // An item with the texts of definition (a null text is empty); null
+    // when memory is short.
+    static std::unique_ptr<COPCItem> Create(const OPCITEMDEF &definition);
+    ~COPCItem();
     COPCItem(const COPCItem &) = delete;
     COPCItem &operator=(const COPCItem &) = delete;
+    static void operator delete(void *block) noexcept { ::operator delete(block); }
 
+    // The rest of definition (its texts were taken by Create).
     HRESULT Init(CItemOwner *group, const OPCITEMDEF &definition, OPCITEMRESULT &result);
     HRESULT SetActive(BOOL active);
     // Copies of the texts come from allocate (CoTaskMemAlloc or malloc).
@@ -40,8 +52,17 @@ public:
     void SetClientHandle(OPCHANDLE client);
     void SetRequestedType(VARTYPE type);
     CSyncObject &Lock() { return m_lock; }
+    std::wstring_view ItemId() const { return {Texts(), m_itemIdLength}; }
+    std::wstring_view AccessPath() const { return {Texts() + m_itemIdLength + 1, m_accessPathLength}; }
+    CActiveItemList::Links &ActiveLinks() { return m_activeLinks; }
 
 private:
+    COPCItem(const wchar_t *itemId, size_t itemIdLength, const wchar_t *accessPath, size_t accessPathLength);
+    static void *operator new(size_t size, size_t textChars, const std::nothrow_t &) noexcept;
+    static void operator delete(void *block, size_t, const std::nothrow_t &) noexcept { ::operator delete(block); }
+    // The identifier, its NUL, the access path and its NUL, after the object.
+    const wchar_t *Texts() const { return reinterpret_cast<const wchar_t *>(this + 1); }
+
     // Converts an output value to the requested type when one is set.
     HRESULT ToRequestedType(VARIANT *value);
     void CopyDeviceToLastReported();
@@ -64,10 +85,9 @@ private:
     VARTYPE m_canonicalType = VT_EMPTY;
     BOOL m_active = FALSE;
     CItemOwner *m_group = nullptr;
-    std::wstring m_accessPath;
-    std::wstring m_itemId;
-    ActiveItemList::iterator m_activePosition;
+    CActiveItemList::Links m_activeLinks;
     OPCHANDLE m_serverHandle = 0;
-    HRESULT m_writeResult = S_OK;
     CadroDataItem *m_dataItem = nullptr;
+    uint32_t m_itemIdLength;
+    uint32_t m_accessPathLength;
 };

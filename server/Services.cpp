@@ -52,7 +52,7 @@ bool CurrentBrowser(CAddrSpace::Browser &browser)
 }
 
 // Items take their canonical type and access rights from the tree.
-bool LookupNode(const std::wstring &itemId, VARTYPE &type, DWORD &rights)
+bool LookupNode(std::wstring_view itemId, VARTYPE &type, DWORD &rights)
 {
     CAddrSpace *space = g_addrSpace.get();
     AddrNodePtr node = space ? space->FindByItemId(itemId) : nullptr;

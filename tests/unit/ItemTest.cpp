@@ -5,14 +5,17 @@
 
 #include <gtest/gtest.h>
 
+#include <cstdlib>
+#include <string>
+
 namespace {
 class FakeGroup : public CItemOwner {
 public:
     CSyncObject &GroupLock() override { return lock; }
-    ActiveItemList &ActiveItems() override { return active; }
+    CActiveItemList &ActiveItems() override { return active; }
     bool GroupActive() const override { return groupActive; }
     CCriticalSection lock;
-    ActiveItemList active;
+    CActiveItemList active;
     bool groupActive = true;
 };
 
@@ -65,7 +68,8 @@ TEST(Item, InitChoosesCanonicalTypesForUnknownItems)
                  {VT_DISPATCH, VT_R8, OPC_E_BADTYPE},
                  {VT_I4 | VT_ARRAY, VT_R8, OPC_E_BADTYPE}};
     for (const Case &c : cases) {
-        COPCItem item;
+        auto made = COPCItem::Create(Def(L"\\\\.\\p\\o.m", c.requested));
+        COPCItem &item = *made;
         OPCITEMRESULT result;
         EXPECT_EQ(item.Init(&group, Def(L"\\\\.\\p\\o.m", c.requested), result), c.hr) << c.requested;
         if (SUCCEEDED(c.hr)) {
@@ -74,17 +78,34 @@ TEST(Item, InitChoosesCanonicalTypesForUnknownItems)
             EXPECT_NE(result.hServer, 0u);
         }
     }
-    COPCItem empty;
     OPCITEMRESULT result;
-    EXPECT_EQ(empty.Init(&group, Def(L""), result), OPC_E_INVALIDITEMID);
+    EXPECT_EQ(COPCItem::Create(Def(L""))->Init(&group, Def(L""), result), OPC_E_INVALIDITEMID);
     EXPECT_EQ(result.hServer, 0u);
-    EXPECT_EQ(empty.Init(&group, Def(nullptr), result), OPC_E_INVALIDITEMID);
+    EXPECT_EQ(COPCItem::Create(Def(nullptr))->Init(&group, Def(nullptr), result), OPC_E_INVALIDITEMID);
+
+    // The texts live in the item's own block: long ones and a null access
+    // path come back intact.
+    std::wstring longId = L"\\\\.\\p\\o." + std::wstring(10000, L'x');
+    OPCITEMDEF def = Def(longId.c_str());
+    def.szAccessPath = const_cast<wchar_t *>(L"path");
+    for (const wchar_t *path : {L"path", static_cast<const wchar_t *>(nullptr)}) {
+        def.szAccessPath = const_cast<wchar_t *>(path);
+        auto item = COPCItem::Create(def);
+        ASSERT_EQ(item->Init(&group, def, result), S_OK);
+        OPCITEMATTRIBUTES attributes;
+        ASSERT_EQ(item->GetAttributes(attributes, malloc), S_OK);
+        EXPECT_EQ(attributes.szItemID, longId);
+        EXPECT_STREQ(attributes.szAccessPath, path ? path : L"");
+        free(attributes.szItemID);
+        free(attributes.szAccessPath);
+    }
 }
 
 TEST(Item, ChangesFollowQualityAndValueButNotTime)
 {
     FakeGroup group;
-    COPCItem item;
+    auto made = COPCItem::Create(Def(L"\\\\.\\p\\o.m"));
+    COPCItem &item = *made;
     OPCITEMRESULT result;
     ASSERT_EQ(item.Init(&group, Def(L"\\\\.\\p\\o.m"), result), S_OK);
     EXPECT_EQ(group.active.size(), 1u);
@@ -140,7 +161,8 @@ TEST(Item, ChangesFollowQualityAndValueButNotTime)
 TEST(Item, RequestedTypesConvertAndFailuresPassThrough)
 {
     FakeGroup group;
-    COPCItem item;
+    auto made = COPCItem::Create(Def(L"\\\\.\\p\\o.m", VT_I4));
+    COPCItem &item = *made;
     OPCITEMRESULT result;
     ASSERT_EQ(item.Init(&group, Def(L"\\\\.\\p\\o.m", VT_I4), result), S_OK);
     Feed(item, 41.6);
@@ -169,7 +191,8 @@ TEST(Item, RequestedTypesConvertAndFailuresPassThrough)
 TEST(Item, WritesCheckRightsAndNeedANetwork)
 {
     FakeGroup group;
-    COPCItem item;
+    auto made = COPCItem::Create(Def(L"\\\\.\\p\\o.m"));
+    COPCItem &item = *made;
     OPCITEMRESULT result;
     ASSERT_EQ(item.Init(&group, Def(L"\\\\.\\p\\o.m"), result), S_OK);
     CVariant v;

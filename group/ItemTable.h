@@ -1,0 +1,51 @@
+#pragma once
+// A group's items by server handle. A vector of (handle, item) entries in
+// ascending handle order rather than a tree: a plant's group holds tens of
+// thousands of items, and a tree node per item would cost more memory than
+// the entry itself. Handles come from the process-wide allocator, which hands
+// out rising numbers, so an insertion almost always appends; a removal
+// leaves a hole that later compaction closes, so that removing many items
+// stays linear.
+#include "OPCItem.h"
+
+#include <memory>
+#include <vector>
+
+class CItemTable {
+public:
+    CItemTable() = default;
+    ~CItemTable() { Clear(); }
+    CItemTable(const CItemTable &) = delete;
+    CItemTable &operator=(const CItemTable &) = delete;
+
+    COPCItem *Find(OPCHANDLE handle) const;
+    // Takes the item; false (and the item deleted) when its handle is taken.
+    bool Insert(std::unique_ptr<COPCItem> item);
+    // Deletes the item; false when there is none with that handle.
+    bool Erase(OPCHANDLE handle);
+    // Deletes every item.
+    void Clear();
+    // Room for more items, so that inserting them cannot fail half-way.
+    void Reserve(size_t more) { m_entries.reserve(m_entries.size() + more); }
+    size_t size() const { return m_entries.size() - m_holes; }
+    bool empty() const { return size() == 0; }
+
+    // f(COPCItem &) for every item in ascending handle order.
+    template <class F> void ForEach(F f) const
+    {
+        for (const Entry &entry : m_entries)
+            if (entry.item)
+                f(*entry.item);
+    }
+
+private:
+    struct Entry {
+        OPCHANDLE handle;
+        COPCItem *item; // null: a hole left by a removal
+    };
+    std::vector<Entry>::const_iterator Position(OPCHANDLE handle) const;
+    void Compact();
+
+    std::vector<Entry> m_entries;
+    size_t m_holes = 0;
+};
