@@ -336,22 +336,44 @@ void CAddrSpace::Merge(const AddrNodePtr &node, std::vector<AddrNodePtr> &fresh)
     }
 }
 
-void CAddrSpace::Candidates(CAddrNode &node, std::wstring_view text, std::vector<AddrNodePtr> &out)
+// Pointers into a node's list of children: no lookup below a step changes
+// the list of the node it steps from (a node is read once per call, and only
+// its own list changes when it is). Held inline, so that a lookup allocates
+// nothing; only a node with unusually many lengths of part spills over.
+struct CAddrSpace::Steps {
+    static constexpr size_t kInline = 16;
+    const AddrNodePtr *inlined[kInline];
+    std::vector<const AddrNodePtr *> spilled;
+    size_t size = 0;
+
+    void Add(const AddrNodePtr *child)
+    {
+        if (size < kInline)
+            inlined[size] = child;
+        else
+            spilled.push_back(child);
+        ++size;
+    }
+    const AddrNodePtr *At(size_t i) const { return i < kInline ? inlined[i] : spilled[i - kInline]; }
+};
+
+void CAddrSpace::Candidates(CAddrNode &node, std::wstring_view text, Steps &out)
 {
-    out.clear();
-    std::vector<AddrNodePtr> &children = node.m_branch->children;
+    const std::vector<AddrNodePtr> &children = node.m_branch->children;
     if (node.IsRoot()) {
         // The registry's roots, in its order, may repeat: tried one by one.
-        out = children;
+        for (const AddrNodePtr &child : children)
+            out.Add(&child);
         return;
     }
     // A child can be the next step only if the text begins with its
     // separator and part: probe the part at each length that a child's part
-    // has, with and without a separator before it. A part without text
-    // (an implicit member) matches whatever follows, and sorts first.
+    // has, with and without a separator before it (a binary search in the
+    // list, which is sorted by part without regard to case). A part without
+    // text (an implicit member) matches whatever follows, and sorts first.
     for (uint32_t length : node.m_branch->partLengths) {
         if (length == 0) {
-            out.push_back(children.front());
+            out.Add(&children.front());
             continue;
         }
         for (size_t separator = 0; separator <= 1; ++separator) {
@@ -360,10 +382,19 @@ void CAddrSpace::Candidates(CAddrNode &node, std::wstring_view text, std::vector
             const AddrNodePtr *child = FindPart(children, text.substr(separator, length));
             if (child && (*child)->IdPart() == text.substr(separator, length) &&
                 (*child)->Separator() == text.substr(0, separator))
-                out.push_back(*child);
+                out.Add(child);
         }
     }
-    std::sort(out.begin(), out.end(), PartLess);
+    // In list order, as the walk over every child would try them.
+    auto inList = [](const AddrNodePtr *a, const AddrNodePtr *b) { return a < b; };
+    if (out.size <= Steps::kInline) {
+        std::sort(out.inlined, out.inlined + out.size, inList);
+    } else {
+        out.spilled.insert(out.spilled.begin(), out.inlined, out.inlined + Steps::kInline);
+        std::sort(out.spilled.begin(), out.spilled.end(), inList);
+        std::copy(out.spilled.begin(), out.spilled.begin() + Steps::kInline, out.inlined);
+        out.spilled.erase(out.spilled.begin(), out.spilled.begin() + Steps::kInline);
+    }
 }
 
 AddrNodePtr CAddrSpace::FindFrom(const AddrNodePtr &node, std::wstring_view text)
@@ -381,10 +412,10 @@ AddrNodePtr CAddrSpace::FindFrom(const AddrNodePtr &node, std::wstring_view text
     } else if (!node->IsBranch()) {
         return rest.empty() ? node : nullptr; // an implicit member: only its object's own text
     }
-    std::vector<AddrNodePtr> candidates;
+    Steps candidates;
     Candidates(*node, rest, candidates);
-    for (const AddrNodePtr &child : candidates)
-        if (AddrNodePtr found = FindFrom(child, rest))
+    for (size_t i = 0; i < candidates.size; ++i)
+        if (AddrNodePtr found = FindFrom(*candidates.At(i), rest))
             return found;
     return nullptr;
 }

@@ -68,7 +68,8 @@ private:
     AddrNodePtr FindFrom(const AddrNodePtr &node, std::wstring_view text);
     // The children of node that the next step of a lookup of text can take,
     // in list order.
-    void Candidates(CAddrNode &node, std::wstring_view text, std::vector<AddrNodePtr> &out);
+    struct Steps;
+    void Candidates(CAddrNode &node, std::wstring_view text, Steps &out);
     HRESULT ReadChildren(const AddrNodePtr &node);
     void Merge(const AddrNodePtr &node, std::vector<AddrNodePtr> &fresh);
     void AddRoot(const std::wstring &name, const std::wstring &url);

@@ -87,7 +87,7 @@ HRESULT COPCItem::Init(CItemOwner *group, const OPCITEMDEF &definition, OPCITEMR
         VARTYPE type;
         if (ItemServices::FindNode(ItemId(), type, rights)) {
             m_canonicalType = type;
-            m_accessRights = rights;
+            m_accessRights = static_cast<BYTE>(rights);
         } else {
             // Unknown to the address space: the requested type, normalized.
             m_canonicalType = NormalizedType(m_requestedType);
@@ -116,12 +116,12 @@ HRESULT COPCItem::Init(CItemOwner *group, const OPCITEMDEF &definition, OPCITEMR
 HRESULT COPCItem::SetActive(BOOL active)
 {
     CSingleLock lock(&m_lock);
-    active = active ? TRUE : FALSE;
-    if (m_active == active || !m_group)
+    bool activate = active != FALSE;
+    if (m_active == activate || !m_group)
         return S_OK;
     CSingleLock groupLock(&m_group->GroupLock());
-    m_active = active;
-    if (!active) {
+    m_active = activate;
+    if (!activate) {
         m_group->ActiveItems().Erase(this);
         if (m_group->GroupActive())
             m_lastQuality = OPC_QUALITY_OUT_OF_SERVICE;
@@ -168,7 +168,7 @@ HRESULT COPCItem::GetAttributes(OPCITEMATTRIBUTES &record, void *(*allocate)(siz
     memset(&record, 0, sizeof record);
     record.szAccessPath = CopyText(AccessPath(), allocate);
     record.szItemID = CopyText(ItemId(), allocate);
-    record.bActive = m_active;
+    record.bActive = m_active ? TRUE : FALSE;
     record.hClient = m_clientHandle;
     record.hServer = m_serverHandle;
     record.dwAccessRights = m_accessRights;
@@ -210,7 +210,7 @@ HRESULT COPCItem::Read(OPCDATASOURCE source, OPCHANDLE *client, VARIANT *value, 
             OnDataUpdate(flags, record.Value(), error, stamp);
             hr = S_OK;
         } else {
-            hr = m_valueArrived.Wait(kFirstValueWaitMs) ? S_OK : OPC_E_UNKNOWNITEMID;
+            hr = m_valueArrived.Wait(m_lock, kFirstValueWaitMs) ? S_OK : OPC_E_UNKNOWNITEMID;
         }
         CSingleLock lock(&m_lock);
         if (SUCCEEDED(hr)) {
@@ -312,7 +312,8 @@ void COPCItem::OnAttributesUpdate(const CadroAttributes &attributes)
     if (attributes.mask & 0x02)
         m_canonicalType = NetworkTypeToVarType(attributes.dataType);
     if (attributes.mask & 0x04) {
-        m_accessRights = ((attributes.access & 1) ? OPC_READABLE : 0) | ((attributes.access & 2) ? OPC_WRITEABLE : 0);
+        m_accessRights = static_cast<BYTE>(((attributes.access & 1) ? OPC_READABLE : 0) |
+                                           ((attributes.access & 2) ? OPC_WRITEABLE : 0));
         if (!(m_accessRights & OPC_READABLE))
             m_valueArrived.Set(); // a read waiting for a value stops waiting
     }
@@ -320,7 +321,8 @@ void COPCItem::OnAttributesUpdate(const CadroAttributes &attributes)
 
 void COPCItem::OnStatusUpdate(uint32_t status)
 {
-    // No lock: only the event changes.
-    if (status == 5 || status == 15)
+    if (status == 5 || status == 15) {
+        CSingleLock lock(&m_lock);
         m_valueArrived.Reset();
+    }
 }

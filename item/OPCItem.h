@@ -51,7 +51,6 @@ public:
     OPCHANDLE ClientHandle();
     void SetClientHandle(OPCHANDLE client);
     void SetRequestedType(VARTYPE type);
-    CSyncObject &Lock() { return m_lock; }
     std::wstring_view ItemId() const { return {Texts(), m_itemIdLength}; }
     std::wstring_view AccessPath() const { return {Texts() + m_itemIdLength + 1, m_accessPathLength}; }
     CActiveItemList::Links &ActiveLinks() { return m_activeLinks; }
@@ -67,7 +66,7 @@ private:
     HRESULT ToRequestedType(VARIANT *value);
     void CopyDeviceToLastReported();
 
-    CCriticalSection m_lock;
+    CSlimLock m_lock;
     // What the network writes at every update and the scan reads at every
     // period comes first, next to the lock, so that both touch few cache
     // lines of items that are not in the cache any more.
@@ -76,17 +75,17 @@ private:
     WORD m_deviceQuality = 0xC0;
     WORD m_lastQuality = 0x00;
     HRESULT m_lastReadResult = S_OK;
-    CManualResetEvent m_valueArrived{m_lock}; // created unsignalled
+    CManualResetEvent m_valueArrived; // created unsignalled; sleeps on m_lock
     CVariant m_lastValue;
     FILETIME m_lastTime = {};
     OPCHANDLE m_clientHandle = 0;
-    DWORD m_accessRights = 3;
+    OPCHANDLE m_serverHandle = 0;
     VARTYPE m_requestedType = VT_EMPTY;
     VARTYPE m_canonicalType = VT_EMPTY;
-    BOOL m_active = FALSE;
+    BYTE m_accessRights = 3; // OPC_READABLE | OPC_WRITEABLE
+    bool m_active = false;
     CItemOwner *m_group = nullptr;
     CActiveItemList::Links m_activeLinks;
-    OPCHANDLE m_serverHandle = 0;
     CadroDataItem *m_dataItem = nullptr;
     uint32_t m_itemIdLength;
     uint32_t m_accessPathLength;

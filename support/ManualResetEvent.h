@@ -5,28 +5,25 @@
 // create, set and close.
 #include "SyncObject.h"
 
-#include <atomic>
 #include <windows.h>
 
 //
-// It sleeps on its owner's lock rather than one of its own: an item has one
-// lock however many waits it serves. Wait must be called without that lock
-// held; Set and Reset may be called with it held or not.
+// It sleeps on its owner's lock rather than one of its own, and keeps no
+// pointer to it: an item has one lock however many waits it serves, and is
+// as small as it can be. Set and Reset are called with that lock held, Wait
+// without it.
 class CManualResetEvent {
 public:
-    explicit CManualResetEvent(CCriticalSection &lock) : m_lock(lock) { InitializeConditionVariable(&m_changed); }
+    CManualResetEvent() { InitializeConditionVariable(&m_changed); }
     CManualResetEvent(const CManualResetEvent &) = delete;
     CManualResetEvent &operator=(const CManualResetEvent &) = delete;
 
     void Set();
-    void Reset();
+    void Reset() { m_signalled = false; }
     // True when the event is (or becomes) signalled within timeoutMs.
-    bool Wait(DWORD timeoutMs);
+    bool Wait(CSlimLock &lock, DWORD timeoutMs);
 
 private:
-    // Read without the lock by Set, which the network calls at every value:
-    // setting a set event changes nothing and needs no lock.
-    std::atomic<bool> m_signalled{false};
-    CCriticalSection &m_lock;
     CONDITION_VARIABLE m_changed;
+    bool m_signalled = false;
 };

@@ -15,8 +15,6 @@ public:
 // that slept at once would make them wait for each other item after item.
 class CCriticalSection : public CSyncObject {
 public:
-    // Without debug information: every item has a lock, and the system's
-    // record of each would be a second allocation per item.
     CCriticalSection() { InitializeCriticalSectionEx(&m_cs, kSpinCount, CRITICAL_SECTION_NO_DEBUG_INFO); }
     static constexpr DWORD kSpinCount = 4000;
     ~CCriticalSection() override { DeleteCriticalSection(&m_cs); }
@@ -38,6 +36,40 @@ public:
 
 private:
     CRITICAL_SECTION m_cs;
+};
+
+// A slim lock for objects that exist by the ten thousand (the items): an
+// SRW lock, a pointer in size, with nothing to create or delete (a critical
+// section costs a round trip to the wineserver when it is deleted, under
+// Wine, and five times the memory). Not recursive. It spins a while before it
+// sleeps, for the same reason as the critical section above.
+class CSlimLock : public CSyncObject {
+public:
+    CSlimLock() = default;
+    CSlimLock(const CSlimLock &) = delete;
+    CSlimLock &operator=(const CSlimLock &) = delete;
+
+    BOOL Lock(DWORD = INFINITE) override
+    {
+        for (unsigned i = 0; i < kSpins; ++i) {
+            if (TryAcquireSRWLockExclusive(&m_srw))
+                return TRUE;
+            YieldProcessor();
+        }
+        AcquireSRWLockExclusive(&m_srw);
+        return TRUE;
+    }
+    BOOL Unlock() override
+    {
+        ReleaseSRWLockExclusive(&m_srw);
+        return TRUE;
+    }
+    // For condition variables (held exclusively by the sleeper).
+    SRWLOCK *Native() { return &m_srw; }
+
+private:
+    static constexpr unsigned kSpins = 1000;
+    SRWLOCK m_srw = SRWLOCK_INIT;
 };
 
 // Scoped holder: counts its own acquisitions and undoes them all when it goes
