@@ -44,9 +44,19 @@ private:
     // What only branches carry: the children in ascending order of part
     // without regard to case, and the distinct lengths of their parts, which
     // bound the probes of a lookup step.
+    //
+    // And an index of the children by their parts, so that a lookup step
+    // and a refresh find a child in constant time rather than by a search
+    // among many thousands of siblings: open addressing over the hashes of
+    // the parts folded to one case, rebuilt whenever the children change.
+    struct Slot {
+        uint32_t hash;
+        uint32_t position; // in children, plus one; 0 for an empty slot
+    };
     struct Branch {
         std::vector<AddrNodePtr> children;
         std::vector<uint32_t> partLengths;
+        std::vector<Slot> index; // empty: search the list instead
     };
 
     std::weak_ptr<CAddrNode> m_parent;

@@ -47,15 +47,58 @@ bool PartLess(const AddrNodePtr &a, const AddrNodePtr &b)
     return CompareNoCase(a->IdPart(), b->IdPart()) < 0;
 }
 
-// The child whose part equals part without regard to case (at most one: a
-// refresh keeps one of names that differ only in case); null when none.
-const AddrNodePtr *FindPart(const std::vector<AddrNodePtr> &children, std::wstring_view part)
+uint32_t PartHash(std::wstring_view part)
 {
+    uint32_t h = 2166136261u; // FNV-1a over the folded characters
+    for (wchar_t c : part)
+        h = (h ^ static_cast<uint32_t>(Fold(c))) * 16777619u;
+    return h;
+}
+
+} // namespace
+
+const AddrNodePtr *CAddrSpace::FindPart(const CAddrNode &node, std::wstring_view part)
+{
+    const CAddrNode::Branch &branch = *node.m_branch;
+    const std::vector<AddrNodePtr> &children = branch.children;
+    if (!branch.index.empty()) {
+        uint32_t hash = PartHash(part);
+        size_t mask = branch.index.size() - 1;
+        for (size_t i = hash & mask;; i = (i + 1) & mask) {
+            const CAddrNode::Slot &slot = branch.index[i];
+            if (slot.position == 0)
+                return nullptr;
+            if (slot.hash == hash && CompareNoCase(children[slot.position - 1]->IdPart(), part) == 0)
+                return &children[slot.position - 1];
+        }
+    }
     auto it = std::lower_bound(children.begin(), children.end(), part, [](const AddrNodePtr &c, std::wstring_view p) {
         return CompareNoCase(c->IdPart(), p) < 0;
     });
     return it != children.end() && CompareNoCase((*it)->IdPart(), part) == 0 ? &*it : nullptr;
 }
+
+void CAddrSpace::IndexChildren(CAddrNode &node)
+{
+    CAddrNode::Branch &branch = *node.m_branch;
+    branch.index.clear();
+    size_t count = branch.children.size();
+    if (count < 8 || count >= UINT32_MAX / 4)
+        return;
+    size_t size = 16;
+    while (size < count * 2)
+        size *= 2;
+    branch.index.assign(size, CAddrNode::Slot{0, 0});
+    for (size_t position = 0; position < count; ++position) {
+        uint32_t hash = PartHash(branch.children[position]->IdPart());
+        size_t i = hash & (size - 1);
+        while (branch.index[i].position != 0)
+            i = (i + 1) & (size - 1);
+        branch.index[i] = {hash, static_cast<uint32_t>(position + 1)};
+    }
+}
+
+namespace {
 
 // A record's name as the tree shows it: "???" without one, and without the
 // two leading backslashes of a machine.
@@ -283,7 +326,7 @@ HRESULT CAddrSpace::ReadChildren(const AddrNodePtr &node)
     std::vector<AddrNodePtr> fresh;
     BrowseRecord record = {};
     while (SUCCEEDED(browser.next(&record))) {
-        if (const AddrNodePtr *known = FindPart(children, IdPartOf(record))) {
+        if (const AddrNodePtr *known = FindPart(*node, IdPartOf(record))) {
             if ((*known)->m_seenMark != mark) {
                 // A kept node keeps its texts and subtree, and takes the
                 // member's present type and rights (a member made read-only
@@ -334,6 +377,7 @@ void CAddrSpace::Merge(const AddrNodePtr &node, std::vector<AddrNodePtr> &fresh)
         if (std::find(lengths.begin(), lengths.end(), length) == lengths.end())
             lengths.push_back(length);
     }
+    IndexChildren(*node);
 }
 
 // Pointers into a node's list of children: no lookup below a step changes
@@ -379,7 +423,7 @@ void CAddrSpace::Candidates(CAddrNode &node, std::wstring_view text, Steps &out)
         for (size_t separator = 0; separator <= 1; ++separator) {
             if (text.size() < separator + length)
                 continue;
-            const AddrNodePtr *child = FindPart(children, text.substr(separator, length));
+            const AddrNodePtr *child = FindPart(node, text.substr(separator, length));
             if (child && (*child)->IdPart() == text.substr(separator, length) &&
                 (*child)->Separator() == text.substr(0, separator))
                 out.Add(child);

@@ -69,6 +69,13 @@ private:
     // The children of node that the next step of a lookup of text can take,
     // in list order.
     struct Steps;
+    // The child whose part equals part without regard to case (at most
+    // one: a refresh keeps one of names that differ only in case); null
+    // when none. Found through the branch's index when it has one.
+    static const AddrNodePtr *FindPart(const CAddrNode &node, std::wstring_view part);
+    // Rebuilds the index of a branch's children (none for a handful of
+    // them: a search of a short list is as quick).
+    static void IndexChildren(CAddrNode &node);
     void Candidates(CAddrNode &node, std::wstring_view text, Steps &out);
     HRESULT ReadChildren(const AddrNodePtr &node);
     void Merge(const AddrNodePtr &node, std::vector<AddrNodePtr> &fresh);

@@ -453,6 +453,23 @@ TEST(AddressSpace, IndexedLookupsFindWhatTheWalkOverEverySiblingFinds)
         AddrNodePtr indexed = space->FindByItemId(id);
         EXPECT_EQ(indexed, walked) << std::string(id.begin(), id.begin() + std::min<size_t>(id.size(), 60));
     }
+    // The same with siblings enough that every branch has its hash index
+    // (a handful are searched in their list).
+    {
+        FakeNetwork crowded = net;
+        for (auto &listing : crowded.listings)
+            for (int i = 0; i < 40; ++i)
+                listing.second.push_back({L"filler" + std::to_wstring(i), L'.', true});
+        std::unique_ptr<CAddrSpace> big(CAddrSpace::Create());
+        big->AddRoots("A=\\\\x,B=\\\\x\\proc1");
+        big->SetBrowserSource(crowded.Source());
+        for (const std::wstring &id : ids) {
+            AddrNodePtr walked = WalkFrom(*big, big->Root(), id);
+            AddrNodePtr indexed = big->FindByItemId(id);
+            EXPECT_EQ(indexed, walked) << std::string(id.begin(), id.begin() + std::min<size_t>(id.size(), 60));
+            EXPECT_EQ(!indexed, !space->FindByItemId(id));
+        }
+    }
     // A few answers spelled out, so that both cannot be wrong alike.
     AddrNodePtr object = space->FindByItemId(L"\\\\x\\proc1\\Obj");
     ASSERT_TRUE(object);
