@@ -1,5 +1,6 @@
 // A group's item table: order, holes left by removals, and their compaction.
 #include "ItemTable.h"
+#include "FakeGroup.h"
 
 #include <gtest/gtest.h>
 
@@ -7,15 +8,6 @@
 #include <vector>
 
 namespace {
-class FakeGroup : public CItemOwner {
-public:
-    CSyncObject &GroupLock() override { return lock; }
-    CActiveItemList &ActiveItems() override { return active; }
-    bool GroupActive() const override { return true; }
-    CCriticalSection lock;
-    CActiveItemList active;
-};
-
 std::unique_ptr<COPCItem> MakeItem(FakeGroup &group)
 {
     OPCITEMDEF def = {};

@@ -1,4 +1,5 @@
 // COPCItem on its own: a fake group, no network (updates are fed by hand).
+#include "FakeGroup.h"
 #include "OPCCadroClient.h"
 #include "OPCItem.h"
 #include "OpcErrors.h"
@@ -9,16 +10,6 @@
 #include <string>
 
 namespace {
-class FakeGroup : public CItemOwner {
-public:
-    CSyncObject &GroupLock() override { return lock; }
-    CActiveItemList &ActiveItems() override { return active; }
-    bool GroupActive() const override { return groupActive; }
-    CCriticalSection lock;
-    CActiveItemList active;
-    bool groupActive = true;
-};
-
 OPCITEMDEF Def(const wchar_t *id, VARTYPE requested = VT_EMPTY, BOOL active = TRUE)
 {
     OPCITEMDEF d = {};
