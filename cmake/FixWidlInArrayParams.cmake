@@ -11,12 +11,7 @@
 # and frees it as the pointer it is, array included (on Windows as well).
 # It fails the build when such a parameter has no FC_RP descriptor to refer to.
 # Usage: cmake -DFILE=x_p.c -P this
-file(READ "${FILE}" text)
-string(FIND "${text}" "__MIDL_TypeFormatString =" typeStart)
-if(typeStart EQUAL -1)
-  message(FATAL_ERROR "${FILE}: no type format string")
-endif()
-string(SUBSTRING "${text}" ${typeStart} -1 types)
+include(${CMAKE_CURRENT_LIST_DIR}/ReadWidlProxy.cmake)
 
 # [in] simple references: "must free, in, simple ref", with or without
 # "must size".

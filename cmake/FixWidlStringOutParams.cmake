@@ -11,12 +11,7 @@
 # checks that every such parameter of the file now refers to a stack-allocated
 # FC_RP descriptor, and fails the build when one does not.
 # Usage: cmake -DFILE=x_p.c -P this
-file(READ "${FILE}" text)
-string(FIND "${text}" "__MIDL_TypeFormatString =" typeStart)
-if(typeStart EQUAL -1)
-  message(FATAL_ERROR "${FILE}: no type format string")
-endif()
-string(SUBSTRING "${text}" ${typeStart} -1 types)
+include(${CMAKE_CURRENT_LIST_DIR}/ReadWidlProxy.cmake)
 
 # The rewrite of the parameters that refer to type offset `from`.
 function(point_parameters_at from to)
