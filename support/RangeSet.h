@@ -1,6 +1,11 @@
 #pragma once
 // An ordered set of unsigned values kept as a singly linked list of disjoint,
 // non-adjacent ranges. Not thread-safe: callers hold the allocator's lock.
+//
+// The ranges come from slabs that the set owns, not a heap block apiece: the
+// released set of a long-running server keeps a range for every group it has
+// removed (item handles between them are never given back), and a block of
+// the heap would cost twice the range itself.
 #include <new>
 
 template <class T> class CRangeSet {
@@ -12,7 +17,12 @@ public:
     };
 
     CRangeSet() = default;
-    CRangeSet(T low, T high) { m_head = new Range{nullptr, low, high}; }
+    CRangeSet(T low, T high)
+    {
+        m_head = NewRange(nullptr, low, high);
+        if (!m_head)
+            throw std::bad_alloc();
+    }
     virtual ~CRangeSet() { Clear(); }
     CRangeSet(const CRangeSet &) = delete;
     CRangeSet &operator=(const CRangeSet &) = delete;
@@ -29,14 +39,14 @@ public:
             if (cur && prev->high + 1 == cur->low) {
                 prev->high = cur->high;
                 prev->next = cur->next;
-                delete cur;
+                FreeRange(cur);
             }
             return;
         }
         if (!cur || v < cur->low - 1) {
             // Out of memory: the value stays out of the set, which only delays
             // its reuse; the allocator never hands out a number twice.
-            Range *fresh = new (std::nothrow) Range{cur, v, v};
+            Range *fresh = NewRange(cur, v, v);
             if (fresh)
                 Link(prev, fresh);
             return;
@@ -54,7 +64,7 @@ public:
         if (v == cur->low) {
             if (cur->low == cur->high) {
                 Link(prev, cur->next);
-                delete cur;
+                FreeRange(cur);
             } else {
                 ++cur->low;
             }
@@ -63,7 +73,7 @@ public:
         } else {
             // Out of memory: keep only the lower part; the upper values are
             // lost to the set rather than handed out twice.
-            Range *upper = new (std::nothrow) Range{cur->next, static_cast<T>(v + 1), cur->high};
+            Range *upper = NewRange(cur->next, static_cast<T>(v + 1), cur->high);
             if (upper)
                 cur->next = upper;
             cur->high = v - 1;
@@ -98,14 +108,50 @@ private:
         else
             m_head = next;
     }
+    // About a page of ranges.
+    static constexpr unsigned kSlabRanges = 255;
+    struct Slab {
+        Slab *next;
+        Range ranges[kSlabRanges];
+    };
+
+    // Null when memory is short.
+    Range *NewRange(Range *next, T low, T high) noexcept
+    {
+        if (!m_free) {
+            Slab *slab = new (std::nothrow) Slab;
+            if (!slab)
+                return nullptr;
+            slab->next = m_slabs;
+            m_slabs = slab;
+            for (Range &r : slab->ranges) {
+                r.next = m_free;
+                m_free = &r;
+            }
+        }
+        Range *r = m_free;
+        m_free = r->next;
+        *r = Range{next, low, high};
+        return r;
+    }
+    void FreeRange(Range *r) noexcept
+    {
+        r->next = m_free;
+        m_free = r;
+    }
+    // Frees every range, with the slabs they live in.
     void Clear()
     {
-        while (m_head) {
-            Range *next = m_head->next;
-            delete m_head;
-            m_head = next;
+        m_head = nullptr;
+        m_free = nullptr;
+        while (m_slabs) {
+            Slab *next = m_slabs->next;
+            delete m_slabs;
+            m_slabs = next;
         }
     }
 
     Range *m_head = nullptr;
+    Range *m_free = nullptr; // ranges of the slabs not in the list
+    Slab *m_slabs = nullptr;
 };

@@ -56,6 +56,34 @@ TEST(RangeSet, RemoveSplitsShrinksAndIgnoresAbsentValues)
     EXPECT_EQ(empty.TakeLowest(), 0ul);
 }
 
+TEST(RangeSet, ManyRangesReuseTheirPlacesAcrossSlabs)
+{
+    // More ranges than one slab holds, emptied and filled again, split from
+    // one range and merged back into it.
+    CRangeSet<unsigned long> set;
+    Ranges expected;
+    for (unsigned long v = 2; v <= 2000; v += 2) {
+        set.Insert(v);
+        expected.emplace_back(v, v);
+    }
+    EXPECT_EQ(RangesOf(set), expected);
+    for (int round = 0; round < 3; ++round) {
+        for (unsigned long v = 2; v <= 2000; v += 2)
+            set.Remove(v);
+        EXPECT_TRUE(set.IsEmpty());
+        for (unsigned long v = 2000; v >= 2; v -= 2)
+            set.Insert(v);
+        EXPECT_EQ(RangesOf(set), expected);
+    }
+    CRangeSet<unsigned long> whole(1, 3000);
+    for (unsigned long v = 2; v <= 2000; v += 2)
+        whole.Remove(v);
+    EXPECT_EQ(RangesOf(whole).size(), 1001u);
+    for (unsigned long v = 2; v <= 2000; v += 2)
+        whole.Insert(v);
+    EXPECT_EQ(RangesOf(whole), (Ranges{{1, 3000}}));
+}
+
 TEST(IdMgr, HandsOutLowestAndDelaysReuse)
 {
     CIdMgr ids;
