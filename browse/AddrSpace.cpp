@@ -387,18 +387,21 @@ void CAddrSpace::Merge(const AddrNodePtr &node, std::vector<AddrNodePtr> &fresh)
 struct CAddrSpace::Steps {
     static constexpr size_t kInline = 16;
     const AddrNodePtr *inlined[kInline];
-    std::vector<const AddrNodePtr *> spilled;
+    std::vector<const AddrNodePtr *> spilled; // all of them, once there are more
     size_t size = 0;
 
     void Add(const AddrNodePtr *child)
     {
+        if (size == kInline)
+            spilled.assign(inlined, inlined + kInline);
         if (size < kInline)
             inlined[size] = child;
         else
             spilled.push_back(child);
         ++size;
     }
-    const AddrNodePtr *At(size_t i) const { return i < kInline ? inlined[i] : spilled[i - kInline]; }
+    const AddrNodePtr **begin() { return size <= kInline ? inlined : spilled.data(); }
+    const AddrNodePtr **end() { return begin() + size; }
 };
 
 void CAddrSpace::Candidates(CAddrNode &node, std::wstring_view text, Steps &out)
@@ -412,8 +415,8 @@ void CAddrSpace::Candidates(CAddrNode &node, std::wstring_view text, Steps &out)
     }
     // A child can be the next step only if the text begins with its
     // separator and part: probe the part at each length that a child's part
-    // has, with and without a separator before it (a binary search in the
-    // list, which is sorted by part without regard to case). A part without
+    // has, with and without a separator before it (through the branch's
+    // index of parts). A part without
     // text (an implicit member) matches whatever follows, and sorts first.
     for (uint32_t length : node.m_branch->partLengths) {
         if (length == 0) {
@@ -430,15 +433,7 @@ void CAddrSpace::Candidates(CAddrNode &node, std::wstring_view text, Steps &out)
         }
     }
     // In list order, as the walk over every child would try them.
-    auto inList = [](const AddrNodePtr *a, const AddrNodePtr *b) { return a < b; };
-    if (out.size <= Steps::kInline) {
-        std::sort(out.inlined, out.inlined + out.size, inList);
-    } else {
-        out.spilled.insert(out.spilled.begin(), out.inlined, out.inlined + Steps::kInline);
-        std::sort(out.spilled.begin(), out.spilled.end(), inList);
-        std::copy(out.spilled.begin(), out.spilled.begin() + Steps::kInline, out.inlined);
-        out.spilled.erase(out.spilled.begin(), out.spilled.begin() + Steps::kInline);
-    }
+    std::sort(out.begin(), out.end(), std::less<const AddrNodePtr *>());
 }
 
 AddrNodePtr CAddrSpace::FindFrom(const AddrNodePtr &node, std::wstring_view text)
@@ -458,8 +453,8 @@ AddrNodePtr CAddrSpace::FindFrom(const AddrNodePtr &node, std::wstring_view text
     }
     Steps candidates;
     Candidates(*node, rest, candidates);
-    for (size_t i = 0; i < candidates.size; ++i)
-        if (AddrNodePtr found = FindFrom(*candidates.At(i), rest))
+    for (const AddrNodePtr *child : candidates)
+        if (AddrNodePtr found = FindFrom(*child, rest))
             return found;
     return nullptr;
 }

@@ -2,47 +2,47 @@
 
 #include <algorithm>
 
-std::vector<CItemTable::Entry>::const_iterator CItemTable::Position(OPCHANDLE handle) const
+size_t CItemTable::Position(OPCHANDLE handle) const
 {
+    // Rising handles: a new one is almost always past the last.
+    if (m_entries.empty() || m_entries.back().handle < handle)
+        return m_entries.size();
     return std::lower_bound(m_entries.begin(), m_entries.end(), handle,
-                            [](const Entry &entry, OPCHANDLE h) { return entry.handle < h; });
+                            [](const Entry &entry, OPCHANDLE h) { return entry.handle < h; }) -
+           m_entries.begin();
 }
 
 COPCItem *CItemTable::Find(OPCHANDLE handle) const
 {
-    auto it = Position(handle);
-    return it != m_entries.end() && it->handle == handle ? it->item : nullptr;
+    size_t i = Position(handle);
+    return i < m_entries.size() && m_entries[i].handle == handle ? m_entries[i].item : nullptr;
 }
 
 bool CItemTable::Insert(std::unique_ptr<COPCItem> item)
 {
     OPCHANDLE handle = item->ServerHandle();
-    if (m_entries.empty() || m_entries.back().handle < handle) {
-        m_entries.push_back({handle, nullptr}); // may throw: the item is still owned here
-        m_entries.back().item = item.release();
-        return true;
-    }
-    auto it = m_entries.begin() + (Position(handle) - m_entries.cbegin());
-    if (it != m_entries.end() && it->handle == handle) {
-        if (it->item)
+    size_t i = Position(handle);
+    if (i < m_entries.size() && m_entries[i].handle == handle) {
+        if (m_entries[i].item)
             return false;
-        it->item = item.release(); // fills the hole the same handle left
+        m_entries[i].item = item.release(); // fills the hole the same handle left
         --m_holes;
         return true;
     }
-    m_entries.insert(it, {handle, nullptr})->item = item.release();
+    // May throw: the item is still owned here until the entry exists.
+    m_entries.insert(m_entries.begin() + i, {handle, nullptr})->item = item.release();
     return true;
 }
 
 bool CItemTable::Erase(OPCHANDLE handle)
 {
-    auto it = m_entries.begin() + (Position(handle) - m_entries.cbegin());
-    if (it == m_entries.end() || it->handle != handle || !it->item)
+    size_t i = Position(handle);
+    if (i == m_entries.size() || m_entries[i].handle != handle || !m_entries[i].item)
         return false;
     // The entry is a hole before the item goes: its destructor may call back
     // into the group, which must not find it any more.
-    std::unique_ptr<COPCItem> item(it->item);
-    it->item = nullptr;
+    std::unique_ptr<COPCItem> item(m_entries[i].item);
+    m_entries[i].item = nullptr;
     ++m_holes;
     item.reset();
     if (m_holes > 64 && m_holes > m_entries.size() / 2)

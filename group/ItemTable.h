@@ -43,7 +43,8 @@ private:
         OPCHANDLE handle;
         COPCItem *item; // null: a hole left by a removal
     };
-    std::vector<Entry>::const_iterator Position(OPCHANDLE handle) const;
+    // The index of the entry of handle, or where it would go.
+    size_t Position(OPCHANDLE handle) const;
     void Compact();
 
     std::vector<Entry> m_entries;

@@ -107,34 +107,29 @@ void COPCGroup::WakeRemoval()
         WakeAllConditionVariable(&m_workChanged);
 }
 
-LONG COPCGroup::AddPendingWork()
+LONG COPCGroup::AddWork()
 {
     CSingleLock lock(&m_lock);
+    InnerUnknown()->AddRef();
     return ++m_pendingWork;
 }
 
-LONG COPCGroup::ReleasePendingWork()
-{
-    CSingleLock lock(&m_lock);
-    --m_pendingWork;
-    WakeRemoval();
-    return m_pendingWork;
-}
-
-void COPCGroup::ReleaseWork()
+LONG COPCGroup::ReleaseWork()
 {
     bool handedOver;
+    LONG left;
     {
         CSingleLock lock(&m_lock);
         handedOver = m_removalsWaiting > 0;
         if (handedOver)
             ++m_handedOverReferences;
-        --m_pendingWork;
+        left = --m_pendingWork;
         WakeRemoval();
     }
     // Otherwise released after the work unit, as it may be the last.
     if (!handedOver)
         InnerUnknown()->Release();
+    return left;
 }
 
 void COPCGroup::BeginCallback(const Caller &caller)
@@ -209,15 +204,11 @@ void COPCGroup::SetActive(BOOL active)
     CUpdateScanMgr *scanner = CUpdateScanMgr::Instance();
     if (!active) {
         // A queued entry goes now; one in flight is dropped by the scanner.
-        if (scanner && scanner->Unschedule(this)) {
-            --m_pendingWork;
-            WakeRemoval();
-            InnerUnknown()->Release(); // the caller holds another reference
-        }
+        if (scanner && scanner->Unschedule(this))
+            ReleaseWork(); // never the last reference: the caller holds one
         m_items.ForEach([](COPCItem &item) { item.SetOutOfService(); });
     } else if (scanner) {
-        InnerUnknown()->AddRef();
-        ++m_pendingWork;
+        AddWork();
         scanner->Schedule(this, 0, true); // scanned at once
     }
 }

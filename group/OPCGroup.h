@@ -114,10 +114,12 @@ public:
     BOOL Scan(LONGLONG &next);
     void SetFailedScans(DWORD count);
     DWORD IncrementFailedScans();
-    // A scanner entry or a transaction lets go of its work unit and its
-    // reference to the group. While a removal waits, the reference goes to
-    // the removal, so that the removal sees the client's references alone.
-    void ReleaseWork();
+    // A scanner entry or a transaction takes a work unit and a reference to
+    // the group, and lets go of both; each returns the work units left.
+    // While a removal waits, the reference goes to the removal, so that the
+    // removal sees the client's references alone.
+    LONG AddWork();
+    LONG ReleaseWork();
 
     // IOPCItemMgt
     STDMETHODIMP AddItems(DWORD dwCount, OPCITEMDEF *pItemArray, OPCITEMRESULT **ppAddResults,
@@ -173,10 +175,6 @@ public:
         DWORD rights = 0;
     };
     HRESULT ReadForProperties(const wchar_t *itemId, PropertyRead &out);
-
-    // Scanner entries and transactions that refer to the group.
-    LONG AddPendingWork();
-    LONG ReleasePendingWork();
 
     // Removal: sets the removing flag, makes the group inactive, waits until
     // no scan and no transaction of the group is queued or running, and cuts

@@ -4,8 +4,7 @@
 
 CTransaction::CTransaction(DWORD id, COPCGroup *group, DWORD request) : m_id(id), m_group(group), m_request(request)
 {
-    m_group->InnerUnknown()->AddRef();
-    m_group->AddPendingWork();
+    m_group->AddWork();
 }
 
 CTransaction::~CTransaction()

@@ -47,12 +47,10 @@ void OPCCadroClient::Shutdown()
     }
 }
 
-CadroRealTime *OPCCadroClient::AcquireRealTime()
+ComPtr<CadroRealTime> OPCCadroClient::AcquireRealTime()
 {
     CSingleLock lock(&m_lock);
-    if (m_realTime)
-        m_realTime->AddRef();
-    return m_realTime;
+    return ComPtr<CadroRealTime>(m_realTime);
 }
 
 wchar_t *ExpandLocalMachine(const wchar_t *url, bool bareDot)
@@ -79,14 +77,13 @@ HRESULT OPCCadroClient::Subscribe(const wchar_t *url, COPCItem *item, CadroDataI
     *out = nullptr;
     // No session (the factory failed, or the services shut down): the
     // network cannot know the item.
-    CadroRealTime *realTime = AcquireRealTime();
+    ComPtr<CadroRealTime> realTime = AcquireRealTime();
     if (!realTime)
         return E_FAIL;
     SubscribeOptions options = {13, 7, 0, 0, 0};
     wchar_t *expanded = ExpandLocalMachine(url);
     HRESULT hr = realTime->Subscribe(expanded ? expanded : url, item, &options, out);
     cdd_free(expanded);
-    realTime->Release();
     return hr;
 }
 

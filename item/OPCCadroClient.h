@@ -4,6 +4,7 @@
 // receives the network's callbacks for them.
 #include "BridgeObject.h"
 #include "CadroNetwork.h"
+#include "ComPtr.h"
 #include "SyncObject.h"
 
 class COPCItem;
@@ -34,7 +35,7 @@ private:
     OPCCadroClient() = default;
 
     // The session interface for one call, or null once shut down.
-    CadroRealTime *AcquireRealTime();
+    ComPtr<CadroRealTime> AcquireRealTime();
 
     CCriticalSection m_lock;           // guards the two below
     CadroSession *m_session = nullptr; // never obtained; released if set
