@@ -29,8 +29,8 @@ public:
     // for "(implicit)"); only root children keep a text of their own.
     std::wstring_view IdPart() const
     {
-        return m_ownIdPart ? std::wstring_view(*m_ownIdPart)
-                           : std::wstring_view(m_displayName).substr(0, m_idPartLength);
+        return m_branch && m_branch->ownIdPart ? std::wstring_view(*m_branch->ownIdPart)
+                                               : std::wstring_view(m_displayName).substr(0, m_idPartLength);
     }
     std::wstring_view Separator() const { return std::wstring_view(&m_separator, m_separator ? 1 : 0); }
     VARTYPE DataType() const { return m_dataType; }
@@ -53,22 +53,24 @@ private:
         uint32_t hash;
         uint32_t position; // in children, plus one; 0 for an empty slot
     };
+    // What only branches carry sits here, so that a leaf, of which a plant
+    // has tens of thousands, is as small as it can be.
     struct Branch {
         std::vector<AddrNodePtr> children;
         std::vector<uint32_t> partLengths;
-        std::vector<Slot> index; // empty: search the list instead
+        std::vector<Slot> index;                 // empty: search the list instead
+        uint64_t refreshPass = 0;                // the call pass that last read the children
+        HRESULT refreshResult = S_OK;            // and what that read gave
+        std::unique_ptr<std::wstring> ownIdPart; // root children: the configured URL
     };
 
     std::weak_ptr<CAddrNode> m_parent;
     std::unique_ptr<Branch> m_branch; // null for a leaf
     std::wstring m_displayName;
-    std::unique_ptr<std::wstring> m_ownIdPart; // root children: the configured URL
-    uint64_t m_refreshPass = 0;                // the call pass that last read the children
-    HRESULT m_refreshResult = S_OK;            // and what that read gave
-    uint64_t m_seenMark = 0;                   // a refresh's mark on the children it was told about
+    uint64_t m_seenMark = 0; // a refresh's mark on the children it was told about
     uint32_t m_idPartLength = 0;
-    DWORD m_accessRights = 3;
     VARTYPE m_dataType = VT_EMPTY;
+    BYTE m_accessRights = 3; // OPC_READABLE | OPC_WRITEABLE
     wchar_t m_separator = 0; // the network's kind character; 0 for none
     bool m_isRoot = false;
     bool m_detached = false;

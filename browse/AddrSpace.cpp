@@ -214,9 +214,9 @@ void CAddrSpace::AddRoot(const std::wstring &name, const std::wstring &url)
     auto node = std::make_shared<CAddrNode>();
     node->m_parent = m_root;
     node->m_displayName = name;
-    node->m_ownIdPart = std::make_unique<std::wstring>(url);
     node->m_accessRights = 3;
     node->m_branch = std::make_unique<CAddrNode::Branch>();
+    node->m_branch->ownIdPart = std::make_unique<std::wstring>(url);
     m_root->m_branch->children.push_back(node);
 }
 
@@ -282,7 +282,7 @@ AddrNodePtr CAddrSpace::MakeNode(const BrowseRecord &r)
     std::wstring_view name = RecordName(r);
     bool leaf = (r.mask & kBrowseFlags) && (r.flags & 1);
     node->m_dataType = DataTypeOf(r);
-    node->m_accessRights = RightsOf(r);
+    node->m_accessRights = static_cast<BYTE>(RightsOf(r));
     node->m_separator = (r.mask & kBrowseKind) ? static_cast<wchar_t>(r.kind) : 0;
     node->m_displayName.assign(name);
     node->m_idPartLength = static_cast<uint32_t>(IdPartOf(r).size()); // always a prefix of the name
@@ -299,11 +299,12 @@ HRESULT CAddrSpace::Refresh(const AddrNodePtr &node)
     if (!node->IsBranch() || node->IsRoot())
         return S_OK;
     uint64_t pass = CCallPass::Current();
-    if (pass != 0 && node->m_refreshPass == pass)
-        return node->m_refreshResult;
+    CAddrNode::Branch &branch = *node->m_branch;
+    if (pass != 0 && branch.refreshPass == pass)
+        return branch.refreshResult;
     HRESULT hr = ReadChildren(node);
-    node->m_refreshPass = pass;
-    node->m_refreshResult = hr;
+    branch.refreshPass = pass;
+    branch.refreshResult = hr;
     return hr;
 }
 
@@ -333,7 +334,7 @@ HRESULT CAddrSpace::ReadChildren(const AddrNodePtr &node)
                 // is seen by the next call).
                 (*known)->m_seenMark = mark;
                 (*known)->m_dataType = DataTypeOf(record);
-                (*known)->m_accessRights = RightsOf(record);
+                (*known)->m_accessRights = static_cast<BYTE>(RightsOf(record));
                 ++seen;
             }
         } else {

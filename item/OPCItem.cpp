@@ -71,7 +71,7 @@ COPCItem::~COPCItem()
 HRESULT COPCItem::Init(CItemOwner *group, const OPCITEMDEF &definition, OPCITEMRESULT &result)
 {
     {
-        CSingleLock lock(&m_lock);
+        CSlimLockHolder lock(&m_lock);
         memset(&result, 0, sizeof result);
         m_group = group;
         m_clientHandle = definition.hClient;
@@ -103,7 +103,7 @@ HRESULT COPCItem::Init(CItemOwner *group, const OPCITEMDEF &definition, OPCITEMR
             return OPC_E_UNKNOWNITEMID;
         m_dataItem = dataItem;
     }
-    CSingleLock lock(&m_lock);
+    CSlimLockHolder lock(&m_lock);
     if (m_requestedType != VT_EMPTY && FAILED(IsConvertible(m_canonicalType, m_requestedType)))
         return OPC_E_BADTYPE;
     result.hServer = m_serverHandle;
@@ -115,7 +115,7 @@ HRESULT COPCItem::Init(CItemOwner *group, const OPCITEMDEF &definition, OPCITEMR
 
 HRESULT COPCItem::SetActive(BOOL active)
 {
-    CSingleLock lock(&m_lock);
+    CSlimLockHolder lock(&m_lock);
     bool activate = active != FALSE;
     if (m_active == activate || !m_group)
         return S_OK;
@@ -133,38 +133,38 @@ HRESULT COPCItem::SetActive(BOOL active)
 
 HRESULT COPCItem::SetOutOfService()
 {
-    CSingleLock lock(&m_lock);
+    CSlimLockHolder lock(&m_lock);
     m_lastQuality = OPC_QUALITY_OUT_OF_SERVICE;
     return S_OK;
 }
 
 DWORD COPCItem::AccessRights()
 {
-    CSingleLock lock(&m_lock);
+    CSlimLockHolder lock(&m_lock);
     return m_accessRights;
 }
 
 OPCHANDLE COPCItem::ClientHandle()
 {
-    CSingleLock lock(&m_lock);
+    CSlimLockHolder lock(&m_lock);
     return m_clientHandle;
 }
 
 void COPCItem::SetClientHandle(OPCHANDLE client)
 {
-    CSingleLock lock(&m_lock);
+    CSlimLockHolder lock(&m_lock);
     m_clientHandle = client;
 }
 
 void COPCItem::SetRequestedType(VARTYPE type)
 {
-    CSingleLock lock(&m_lock);
+    CSlimLockHolder lock(&m_lock);
     m_requestedType = type;
 }
 
 HRESULT COPCItem::GetAttributes(OPCITEMATTRIBUTES &record, void *(*allocate)(size_t))
 {
-    CSingleLock lock(&m_lock);
+    CSlimLockHolder lock(&m_lock);
     memset(&record, 0, sizeof record);
     record.szAccessPath = CopyText(AccessPath(), allocate);
     record.szItemID = CopyText(ItemId(), allocate);
@@ -212,7 +212,7 @@ HRESULT COPCItem::Read(OPCDATASOURCE source, OPCHANDLE *client, VARIANT *value, 
         } else {
             hr = m_valueArrived.Wait(m_lock, kFirstValueWaitMs) ? S_OK : OPC_E_UNKNOWNITEMID;
         }
-        CSingleLock lock(&m_lock);
+        CSlimLockHolder lock(&m_lock);
         if (SUCCEEDED(hr)) {
             if (m_accessRights == 0 || IsZero(stamp))
                 hr = OPC_E_UNKNOWNITEMID;
@@ -223,7 +223,7 @@ HRESULT COPCItem::Read(OPCDATASOURCE source, OPCHANDLE *client, VARIANT *value, 
     }
 
     VariantInit(value);
-    CSingleLock lock(&m_lock);
+    CSlimLockHolder lock(&m_lock);
     *client = m_clientHandle;
     HRESULT result = m_lastReadResult;
     bool inactive = !m_active || (m_group && !m_group->GroupActive());
@@ -247,7 +247,7 @@ HRESULT COPCItem::Read(OPCDATASOURCE source, OPCHANDLE *client, VARIANT *value, 
 
 HRESULT COPCItem::Write(const VARIANT &value)
 {
-    CSingleLock lock(&m_lock);
+    CSlimLockHolder lock(&m_lock);
     HRESULT hr = S_OK;
     CCadroValue record;
     if (!(m_accessRights & OPC_WRITEABLE)) {
@@ -273,7 +273,7 @@ HRESULT COPCItem::Write(const VARIANT &value)
 
 HRESULT COPCItem::CheckChanged(double, OPCHANDLE *client, VARIANT *value, WORD *quality, FILETIME *time, bool *changed)
 {
-    CSingleLock lock(&m_lock);
+    CSlimLockHolder lock(&m_lock);
     *client = m_clientHandle;
     *changed = false;
     *quality = m_deviceQuality;
@@ -293,7 +293,7 @@ HRESULT COPCItem::CheckChanged(double, OPCHANDLE *client, VARIANT *value, WORD *
 
 void COPCItem::OnDataUpdate(uint32_t flags, const CadroValue &value, int32_t errorFlag, const FILETIME &time)
 {
-    CSingleLock lock(&m_lock);
+    CSlimLockHolder lock(&m_lock);
     if (flags & kCadroHasQuality)
         m_deviceQuality = errorFlag == 0 ? OPC_QUALITY_GOOD : OPC_QUALITY_BAD;
     if (flags & kCadroHasValue) {
@@ -308,7 +308,7 @@ void COPCItem::OnDataUpdate(uint32_t flags, const CadroValue &value, int32_t err
 
 void COPCItem::OnAttributesUpdate(const CadroAttributes &attributes)
 {
-    CSingleLock lock(&m_lock);
+    CSlimLockHolder lock(&m_lock);
     if (attributes.mask & 0x02)
         m_canonicalType = NetworkTypeToVarType(attributes.dataType);
     if (attributes.mask & 0x04) {
@@ -322,7 +322,7 @@ void COPCItem::OnAttributesUpdate(const CadroAttributes &attributes)
 void COPCItem::OnStatusUpdate(uint32_t status)
 {
     if (status == 5 || status == 15) {
-        CSingleLock lock(&m_lock);
+        CSlimLockHolder lock(&m_lock);
         m_valueArrived.Reset();
     }
 }

@@ -11,7 +11,7 @@ void CManualResetEvent::Set()
 bool CManualResetEvent::Wait(CSlimLock &lock, DWORD timeoutMs)
 {
     DWORD start = GetTickCount();
-    CSingleLock held(&lock);
+    CSlimLockHolder held(&lock);
     while (!m_signalled) {
         DWORD elapsed = GetTickCount() - start;
         if (elapsed >= timeoutMs)

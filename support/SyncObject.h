@@ -41,15 +41,16 @@ private:
 // A slim lock for objects that exist by the ten thousand (the items): an
 // SRW lock, a pointer in size, with nothing to create or delete (a critical
 // section costs a round trip to the wineserver when it is deleted, under
-// Wine, and five times the memory). Not recursive. It spins a while before it
-// sleeps, for the same reason as the critical section above.
-class CSlimLock : public CSyncObject {
+// Wine, and five times the memory). Not recursive, and not a CSyncObject: a
+// table of virtual functions would add a pointer to every item. It spins a
+// while before it sleeps, for the same reason as the critical section above.
+class CSlimLock {
 public:
     CSlimLock() = default;
     CSlimLock(const CSlimLock &) = delete;
     CSlimLock &operator=(const CSlimLock &) = delete;
 
-    BOOL Lock(DWORD = INFINITE) override
+    BOOL Lock(DWORD = INFINITE)
     {
         for (unsigned i = 0; i < kSpins; ++i) {
             if (TryAcquireSRWLockExclusive(&m_srw))
@@ -59,7 +60,7 @@ public:
         AcquireSRWLockExclusive(&m_srw);
         return TRUE;
     }
-    BOOL Unlock() override
+    BOOL Unlock()
     {
         ReleaseSRWLockExclusive(&m_srw);
         return TRUE;
@@ -73,21 +74,22 @@ private:
 };
 
 // Scoped holder: counts its own acquisitions and undoes them all when it goes
-// out of scope, normally or by an exception.
-class CSingleLock {
+// out of scope, normally or by an exception. CSingleLock holds any
+// CSyncObject; a slim lock has a holder of its own type.
+template <class Lockable> class CScopedLock {
 public:
-    explicit CSingleLock(CSyncObject *object, bool lockNow = true) : m_object(object)
+    explicit CScopedLock(Lockable *object, bool lockNow = true) : m_object(object)
     {
         if (lockNow)
             Lock();
     }
-    ~CSingleLock()
+    ~CScopedLock()
     {
         while (m_count > 0)
             Unlock();
     }
-    CSingleLock(const CSingleLock &) = delete;
-    CSingleLock &operator=(const CSingleLock &) = delete;
+    CScopedLock(const CScopedLock &) = delete;
+    CScopedLock &operator=(const CScopedLock &) = delete;
 
     BOOL Lock(DWORD timeout = INFINITE)
     {
@@ -106,6 +108,9 @@ public:
     bool IsLocked() const { return m_count > 0; }
 
 private:
-    CSyncObject *m_object;
+    Lockable *m_object;
     unsigned m_count = 0;
 };
+
+using CSingleLock = CScopedLock<CSyncObject>;
+using CSlimLockHolder = CScopedLock<CSlimLock>;
