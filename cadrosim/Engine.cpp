@@ -51,33 +51,33 @@ bool ReadTextFile(const std::wstring &path, std::wstring &text)
 }
 } // namespace
 
-Subscription::Subscription(Engine &e, std::shared_ptr<Member> m, ICadroRealTimeReceiver *r, void *c)
-    : engine(e), member(std::move(m)), receiver(r), cookie(c)
+Subscription::Subscription(std::shared_ptr<Member> m, ICadroRealTimeReceiver *r, void *c)
+    : member(std::move(m)), receiver(r), cookie(c)
 {
     receiver->AddRef();
-    engine.AddUse();
+    Engine::Instance().AddUse();
 }
 
 Subscription::~Subscription()
 {
     if (receiver)
         receiver->Release();
-    engine.ReleaseUse();
+    Engine::Instance().ReleaseUse();
 }
 
 HRESULT STDMETHODCALLTYPE Subscription::Write(const CadroValue *value)
 {
-    return engine.Write(this, value);
+    return Engine::Instance().Write(this, value);
 }
 
 HRESULT STDMETHODCALLTYPE Subscription::Read(uint32_t *flags, CadroValue *value, int32_t *errorFlag, FILETIME *time)
 {
-    return engine.Read(this, flags, value, errorFlag, time);
+    return Engine::Instance().Read(this, flags, value, errorFlag, time);
 }
 
 void Subscription::LastRelease()
 {
-    engine.Unsubscribe(this);
+    Engine::Instance().Unsubscribe(this);
 }
 
 Engine &Engine::Instance()
@@ -201,7 +201,7 @@ HRESULT Engine::Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeReceiv
             receiver->StatusChange(cookie, status, 0, 0);
         return kUnknownUrl;
     }
-    auto *sub = new (std::nothrow) Subscription(*this, member, receiver, cookie);
+    auto *sub = new (std::nothrow) Subscription(member, receiver, cookie);
     if (!sub)
         return E_OUTOFMEMORY;
     Shard &shard = *member->shard;

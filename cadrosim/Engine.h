@@ -23,24 +23,23 @@ class Engine;
 
 // One subscription; it is the CadroDataItem the subscriber holds.
 struct Subscription : CSimUnknown<CadroDataItem> {
-    Subscription(Engine &engine, std::shared_ptr<Member> member, ICadroRealTimeReceiver *receiver, void *cookie);
+    Subscription(std::shared_ptr<Member> member, ICadroRealTimeReceiver *receiver, void *cookie);
     ~Subscription() override;
 
     HRESULT STDMETHODCALLTYPE Write(const CadroValue *value) override;
     HRESULT STDMETHODCALLTYPE Read(uint32_t *flags, CadroValue *value, int32_t *errorFlag, FILETIME *time) override;
     void LastRelease() override;
 
-    Engine &engine;
-    std::shared_ptr<Member> member;
-    ICadroRealTimeReceiver *receiver;
-    void *cookie;
     // Set when its holder lets go: nothing calls it any more, and it is
     // deleted once nothing refers to it.
     std::atomic<bool> dead{false};
     // Guarded by the member's shard:
     bool active = false; // receives values
     uint32_t queued = 0; // events of it in the shard's queue
-    size_t slot = 0;     // its place in the member's subscriptions
+    uint32_t slot = 0;   // its place in the member's subscriptions
+    std::shared_ptr<Member> member;
+    ICadroRealTimeReceiver *receiver;
+    void *cookie;
 };
 
 // Open: the whole answer to a subscription on a connected machine (contacted,

@@ -3,6 +3,7 @@
 // nest) and data members, with each member's value source and current value.
 // Not thread-safe: the engine guards it.
 #include "SimValue.h"
+#include "SubscriberList.h"
 
 #include <atomic>
 #include <memory>
@@ -47,7 +48,7 @@ struct Member {
     bool stalled = false;
     bool removed = false;
     bool scheduled = false;
-    std::vector<Subscription *> subscriptions; // active ones
+    SubscriberList subscriptions; // active ones
 };
 
 // Objects and members are listed in the order they were added and found

@@ -75,7 +75,6 @@ private:
     WORD m_deviceQuality = 0xC0;
     WORD m_lastQuality = 0x00;
     HRESULT m_lastReadResult = S_OK;
-    CManualResetEvent m_valueArrived; // created unsignalled; sleeps on m_lock
     CVariant m_lastValue;
     FILETIME m_lastTime = {};
     OPCHANDLE m_clientHandle = 0;
@@ -84,6 +83,7 @@ private:
     VARTYPE m_canonicalType = VT_EMPTY;
     BYTE m_accessRights = 3; // OPC_READABLE | OPC_WRITEABLE
     bool m_active = false;
+    CManualResetEvent m_valueArrived; // created unsignalled; sleeps on m_lock
     CItemOwner *m_group = nullptr;
     CActiveItemList::Links m_activeLinks;
     CadroDataItem *m_dataItem = nullptr;

@@ -3,8 +3,8 @@
 void CManualResetEvent::Set()
 {
     if (!m_signalled) {
-        m_signalled = true;
-        WakeAllConditionVariable(&m_changed);
+        m_signalled = 1;
+        WakeByAddressAll(const_cast<char *>(&m_signalled));
     }
 }
 
@@ -16,8 +16,13 @@ bool CManualResetEvent::Wait(CSlimLock &lock, DWORD timeoutMs)
         DWORD elapsed = GetTickCount() - start;
         if (elapsed >= timeoutMs)
             return false;
-        // Spurious wake-ups and time-outs both come back to the check.
-        SleepConditionVariableSRW(&m_changed, lock.Native(), timeoutMs - elapsed, 0);
+        // A Set between the unlock and the wait is not lost: the wait
+        // returns at once when the byte is no longer 0. Spurious wake-ups
+        // and time-outs both come back to the check under the lock.
+        char unsignalled = 0;
+        held.Unlock();
+        WaitOnAddress(&m_signalled, &unsignalled, sizeof unsignalled, timeoutMs - elapsed);
+        held.Lock();
     }
     return true;
 }

@@ -1,29 +1,29 @@
 #pragma once
-// A manual-reset event in user space: a flag with a condition variable. Used
-// where events are set and waited for very often; a kernel event costs a
-// round trip to the kernel (under Wine, to the wineserver) for every
-// create, set and close.
+// A manual-reset event in user space: one byte that waiters sleep on with
+// WaitOnAddress. Used where events are set and waited for very often; a
+// kernel event costs a round trip to the kernel (under Wine, to the
+// wineserver) for every create, set and close, and a condition variable
+// would add a pointer to every item.
 #include "SyncObject.h"
 
 #include <windows.h>
 
 //
-// It sleeps on its owner's lock rather than one of its own, and keeps no
-// pointer to it: an item has one lock however many waits it serves, and is
-// as small as it can be. Set and Reset are called with that lock held, Wait
-// without it.
+// The flag is guarded by its owner's lock, of which it keeps no pointer: an
+// item has one lock however many waits it serves, and is as small as it can
+// be. Set and Reset are called with that lock held, Wait without it (it
+// checks under the lock and lets go of it while it sleeps).
 class CManualResetEvent {
 public:
-    CManualResetEvent() { InitializeConditionVariable(&m_changed); }
+    CManualResetEvent() = default;
     CManualResetEvent(const CManualResetEvent &) = delete;
     CManualResetEvent &operator=(const CManualResetEvent &) = delete;
 
     void Set();
-    void Reset() { m_signalled = false; }
+    void Reset() { m_signalled = 0; }
     // True when the event is (or becomes) signalled within timeoutMs.
     bool Wait(CSlimLock &lock, DWORD timeoutMs);
 
 private:
-    CONDITION_VARIABLE m_changed;
-    bool m_signalled = false;
+    volatile char m_signalled = 0;
 };

@@ -66,7 +66,6 @@ public:
         return TRUE;
     }
     // For condition variables (held exclusively by the sleeper).
-    SRWLOCK *Native() { return &m_srw; }
 
 private:
     static constexpr unsigned kSpins = 1000;

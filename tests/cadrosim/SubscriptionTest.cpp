@@ -145,6 +145,37 @@ TEST_F(SimTest, WritesComeBackAsUpdatesAndReadOnlyMembersRefuse)
     EXPECT_EQ(num->Write(nullptr), E_POINTER);
 }
 
+TEST_F(SimTest, SubscribersOfOneMemberComeAndGoInAnyOrder)
+{
+    // The first subscriber of a member is kept in place and later ones in
+    // an array that grows: releases from the front, the middle and the end
+    // must leave exactly the others receiving.
+    std::vector<CadroDataItem *> subs;
+    std::vector<void *> cookies;
+    for (int i = 0; i < 6; ++i) {
+        subs.push_back(Subscribe(L"\\\\.\\p\\o.num"));
+        cookies.push_back(LastCookie());
+        ASSERT_TRUE(subs.back());
+    }
+    ASSERT_TRUE(recorder.WaitFor([&](auto &all) { return HasData(all, cookies[5], 1); }));
+    for (int gone : {0, 3, 5}) {
+        Drop(subs[gone]);
+        subs[gone] = nullptr;
+    }
+    EXPECT_NE(Command(L"show \\\\.\\p\\o.num").find(L"subscriptions 3\n"), std::wstring::npos);
+    CadroValue v = {};
+    v.type = kCadroNumber;
+    v.number = 64.25;
+    ASSERT_EQ(subs[1]->Write(&v), S_OK);
+    for (int kept : {1, 2, 4})
+        EXPECT_TRUE(recorder.WaitFor([&](auto &all) { return HasData(all, cookies[kept], 64.25); })) << kept;
+    for (int gone : {0, 3, 5})
+        EXPECT_FALSE(HasData(recorder.Snapshot(), cookies[gone], 64.25)) << gone;
+    subs.push_back(Subscribe(L"\\\\.\\p\\o.num")); // into a freed place
+    void *last = LastCookie();
+    EXPECT_TRUE(recorder.WaitFor([&](auto &all) { return HasData(all, last, 64.25); }));
+}
+
 TEST_F(SimTest, ReleaseEndsCallbacksBeforeItReturns)
 {
     for (int round = 0; round < 20; ++round) {

@@ -1,9 +1,11 @@
+#include "ManualResetEvent.h"
 #include "tw/hmx/osdep/OSException.h"
 #include "tw/hmx/osdep/WideToAnsi.h"
 
 #include <gtest/gtest.h>
 
 #include <string>
+#include <thread>
 
 using namespace tw::hmx;
 
@@ -104,4 +106,30 @@ TEST(Support, ExceptionsCarryMessagesCodesAndSources)
         EXPECT_STREQ(e.source(), "tw/hmx/osdep/SharedLibrary");
         EXPECT_EQ(e.line(), 161);
     }
+}
+
+TEST(Support, ManualResetEventWakesItsWaitersAndTimesOut)
+{
+    CSlimLock lock;
+    CManualResetEvent event;
+    EXPECT_FALSE(event.Wait(lock, 30)); // nothing set it
+    // A setter on another thread, which needs the lock that the waiter
+    // must let go of while it sleeps.
+    for (int round = 0; round < 20; ++round) {
+        std::thread setter([&] {
+            Sleep(round % 3);
+            CSlimLockHolder held(&lock);
+            event.Set();
+        });
+        EXPECT_TRUE(event.Wait(lock, 60000)) << round;
+        setter.join();
+        CSlimLockHolder held(&lock);
+        event.Reset();
+    }
+    EXPECT_FALSE(event.Wait(lock, 10)); // reset again
+    {
+        CSlimLockHolder held(&lock);
+        event.Set();
+    }
+    EXPECT_TRUE(event.Wait(lock, 0)); // already set: no sleep
 }
