@@ -191,7 +191,7 @@ HRESULT COPCItem::ToRequestedType(VARIANT *value)
 
 void COPCItem::CopyDeviceToLastReported()
 {
-    CopyVariant(m_lastValue.Get(), m_deviceValue.Value());
+    m_lastValue.CopyFrom(m_deviceValue);
     m_lastQuality = m_deviceQuality;
     m_lastTime = m_deviceTime;
 }
@@ -228,7 +228,7 @@ HRESULT COPCItem::Read(OPCDATASOURCE source, OPCHANDLE *client, VARIANT *value, 
     HRESULT result = m_lastReadResult;
     bool inactive = !m_active || (m_group && !m_group->GroupActive());
     if (source != OPC_DS_DEVICE && inactive) {
-        CopyVariant(m_lastValue.Get(), m_deviceValue.Value());
+        m_lastValue.CopyFrom(m_deviceValue);
         m_lastQuality = OPC_QUALITY_OUT_OF_SERVICE;
     } else {
         CopyDeviceToLastReported();
@@ -237,7 +237,8 @@ HRESULT COPCItem::Read(OPCDATASOURCE source, OPCHANDLE *client, VARIANT *value, 
     *time = m_lastTime;
     if (FAILED(result))
         return result;
-    result = VariantCopy(value, m_lastValue.Get());
+    VARIANT last = m_lastValue.View();
+    result = VariantCopy(value, &last);
     if (SUCCEEDED(result))
         result = ToRequestedType(value);
     if (FAILED(result))
@@ -283,11 +284,11 @@ HRESULT COPCItem::CheckChanged(double, OPCHANDLE *client, VARIANT *value, WORD *
     // Time stamps are not compared; the deadband has no effect without
     // engineering units. The value is copied only when it is reported: the
     // scan asks every active item at every period.
-    if (m_deviceQuality == m_lastQuality && VariantEquals(m_deviceValue.Value(), m_lastValue.Value()))
+    if (m_deviceQuality == m_lastQuality && VariantEquals(m_deviceValue.View(), m_lastValue.View()))
         return S_OK;
     *changed = true;
     CopyDeviceToLastReported();
-    CopyVariant(value, m_deviceValue.Value());
+    CopyVariant(value, m_deviceValue.View());
     return ToRequestedType(value);
 }
 
@@ -297,7 +298,10 @@ void COPCItem::OnDataUpdate(uint32_t flags, const CadroValue &value, int32_t err
     if (flags & kCadroHasQuality)
         m_deviceQuality = errorFlag == 0 ? OPC_QUALITY_GOOD : OPC_QUALITY_BAD;
     if (flags & kCadroHasValue) {
-        m_lastReadResult = CadroValueToVariant(value, m_deviceValue.Get());
+        VARIANT arrived;
+        VariantInit(&arrived);
+        m_lastReadResult = CadroValueToVariant(value, &arrived);
+        m_deviceValue.Take(arrived);
         m_valueArrived.Set();
     }
     if (flags & kCadroHasTime)
@@ -326,3 +330,6 @@ void COPCItem::OnStatusUpdate(uint32_t status)
         m_valueArrived.Reset();
     }
 }
+
+// Tens of thousands of items: keep an eye on what each one costs.
+static_assert(sizeof(void *) != 8 || sizeof(COPCItem) <= 120, "an item grew");

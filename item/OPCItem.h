@@ -11,6 +11,7 @@
 #include "CadroNetwork.h"
 #include "ItemOwner.h"
 #include "ManualResetEvent.h"
+#include "NetworkValue.h"
 #include "SyncObject.h"
 #include "ValueConversion.h"
 #include "opcda.h"
@@ -70,12 +71,12 @@ private:
     // What the network writes at every update and the scan reads at every
     // period comes first, next to the lock, so that both touch few cache
     // lines of items that are not in the cache any more.
-    CVariant m_deviceValue;
+    CNetworkValue m_deviceValue;
     FILETIME m_deviceTime = {};
     WORD m_deviceQuality = 0xC0;
     WORD m_lastQuality = 0x00;
     HRESULT m_lastReadResult = S_OK;
-    CVariant m_lastValue;
+    CNetworkValue m_lastValue;
     FILETIME m_lastTime = {};
     OPCHANDLE m_clientHandle = 0;
     OPCHANDLE m_serverHandle = 0;

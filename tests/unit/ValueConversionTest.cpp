@@ -1,4 +1,5 @@
 #include "ValueConversion.h"
+#include "NetworkValue.h"
 
 #include <gtest/gtest.h>
 
@@ -150,4 +151,38 @@ TEST(ValueConversion, ClientConversionsReportOverflowAndMismatch)
     number.number = 3;
     EXPECT_EQ(CadroValueToVariant(number, text.Get()), S_OK); // the text is freed, not overwritten
     EXPECT_EQ(V_R8(text.Get()), 3.0);
+}
+
+TEST(ValueConversion, NetworkValuesOwnTheirTextAndCopyDeeply)
+{
+    CNetworkValue device, last;
+    Var text(L"pump running");
+    device.Take(*text.Get());
+    EXPECT_EQ(V_VT(text.Get()), VT_EMPTY) << "taken over, not copied";
+    VARIANT held = device.View();
+    ASSERT_EQ(V_VT(&held), VT_BSTR);
+    EXPECT_STREQ(V_BSTR(&held), L"pump running");
+
+    ASSERT_EQ(last.CopyFrom(device), S_OK);
+    VARIANT copy = last.View();
+    EXPECT_NE(V_BSTR(&copy), V_BSTR(&held)) << "a copy of its own";
+    EXPECT_TRUE(VariantEquals(copy, held));
+    Var number(21.5);
+    device.Take(*number.Get()); // frees the text it held
+    copy = last.View();
+    EXPECT_STREQ(V_BSTR(&copy), L"pump running");
+    ASSERT_EQ(last.CopyFrom(device), S_OK); // number over text
+    copy = last.View();
+    EXPECT_EQ(V_R8(&copy), 21.5);
+    EXPECT_FALSE(VariantEquals(copy, Var(21.25).Value()));
+
+    // What does not fit in 8 bytes is refused as a failed copy is.
+    VARIANT decimal;
+    VariantInit(&decimal);
+    V_VT(&decimal) = VT_DECIMAL;
+    V_DECIMAL(&decimal).Lo64 = 7;
+    device.Take(decimal);
+    held = device.View();
+    EXPECT_EQ(V_VT(&held), VT_ERROR);
+    EXPECT_EQ(V_ERROR(&held), DISP_E_TYPEMISMATCH);
 }

@@ -1,0 +1,81 @@
+#pragma once
+// A value as the network gives it (empty, boolean, number or text) in 16
+// bytes instead of a VARIANT's 24: the type and the 8 bytes of its data. An
+// item keeps two, and a plant has tens of thousands of items.
+//
+// Every type whose data fits in those 8 bytes can be held. VT_DECIMAL and
+// VT_RECORD, which the network never gives, cannot: taking one leaves
+// VT_ERROR with DISP_E_TYPEMISMATCH, as a failed copy does.
+#include "Variant.h"
+
+#include <cstdint>
+#include <cstring>
+#include <oleauto.h>
+
+class CNetworkValue {
+public:
+    CNetworkValue() = default;
+    ~CNetworkValue() { Clear(); }
+    CNetworkValue(const CNetworkValue &) = delete;
+    CNetworkValue &operator=(const CNetworkValue &) = delete;
+
+    // A VARIANT that borrows the data: read it, copy it, never clear it.
+    VARIANT View() const
+    {
+        VARIANT v;
+        VariantInit(&v);
+        V_VT(&v) = m_type;
+        memcpy(&V_UI8(&v), &m_data, sizeof m_data);
+        return v;
+    }
+
+    // Takes over what value holds and leaves it VT_EMPTY.
+    void Take(VARIANT &value)
+    {
+        Clear();
+        VARTYPE type = V_VT(&value);
+        if (type == VT_DECIMAL || (type & ~VT_BYREF) == VT_RECORD) { // 16 bytes of data
+            VariantClear(&value);
+            m_type = VT_ERROR;
+            m_data = static_cast<uint32_t>(DISP_E_TYPEMISMATCH);
+            return;
+        }
+        m_type = type;
+        memcpy(&m_data, &V_UI8(&value), sizeof m_data);
+        VariantInit(&value);
+    }
+
+    // The copy rule of CopyVariant: a failed copy leaves VT_ERROR holding
+    // the failure code.
+    HRESULT CopyFrom(const CNetworkValue &other)
+    {
+        if (IsPlainType(other.m_type) && IsPlainType(m_type)) {
+            m_type = other.m_type;
+            m_data = other.m_data;
+            return S_OK;
+        }
+        VARIANT source = other.View(), copy;
+        VariantInit(&copy);
+        HRESULT hr = VariantCopy(&copy, &source);
+        if (FAILED(hr)) {
+            V_VT(&copy) = VT_ERROR;
+            V_ERROR(&copy) = hr;
+        }
+        Take(copy);
+        return hr;
+    }
+
+private:
+    void Clear()
+    {
+        if (!IsPlainType(m_type)) {
+            VARIANT v = View();
+            VariantClear(&v);
+        }
+        m_type = VT_EMPTY;
+        m_data = 0;
+    }
+
+    VARTYPE m_type = VT_EMPTY;
+    uint64_t m_data = 0;
+};
