@@ -129,3 +129,76 @@ TEST_F(OpcToolE2E, SubscribesThroughBothInterfaces)
     EXPECT_EQ(Lines(timed.output).size(), 1u) << timed.output; // a constant sends its first value only
     EXPECT_EQ(Opc(R"(subscribe \\.\proc1\Nothing.here --duration 5)").code, 1);
 }
+
+TEST_F(OpcToolE2E, OutputFollowsTheArgumentsAndErrorsNameTheirCause)
+{
+    const char kLimit[] = R"(\\.\proc1\Setpoints.limit)", kNothing[] = R"(\\.\proc1\Nothing.here)";
+    // A refused item between two good ones keeps its place, in text (standard
+    // error and output together) and in JSON.
+    for (const char *json : {"", " --json"}) {
+        OpcRun read = Opc(std::string("read ") + kLimit + " " + kNothing + " " + kTemperature + json);
+        EXPECT_EQ(read.code, 1);
+        auto lines = Lines(read.output);
+        ASSERT_EQ(lines.size(), 3u) << read.output;
+        EXPECT_TRUE(Has(lines[0], "Setpoints.limit")) << read.output;
+        EXPECT_TRUE(Has(lines[1], "Nothing.here") && Has(lines[1], "0xC0040007")) << read.output;
+        EXPECT_TRUE(Has(lines[2], "Setpoints.temperature")) << read.output;
+    }
+    OpcRun write = Opc(std::string("write ") + kNothing + " 1 " + kTemperature + " 30 " + kLimit + " none");
+    auto written = Lines(write.output);
+    ASSERT_EQ(written.size(), 3u) << write.output;
+    EXPECT_TRUE(Has(written[0], "Nothing.here")) << write.output;
+    EXPECT_TRUE(Has(written[1], "Setpoints.temperature = 30")) << write.output;
+    EXPECT_TRUE(Has(written[2], "\"none\" is no double value")) << write.output;
+
+    // Unknown branches and items: the server's text for OPC_E_UNKNOWNITEMID,
+    // once per item.
+    for (const char *branch : {"Network/NOWHERE", R"(\\.\nowhere)"}) {
+        OpcRun browse = Opc(std::string("browse ") + branch);
+        EXPECT_EQ(browse.code, 1);
+        EXPECT_TRUE(Has(browse.output, "0xC0040007")) << browse.output;
+        EXPECT_FALSE(Has(browse.output, "0x80004005")) << browse.output;
+    }
+    OpcRun properties = Opc(std::string("properties ") + kNothing + " " + kLimit);
+    EXPECT_EQ(properties.code, 1);
+    auto lines = Lines(properties.output);
+    ASSERT_GE(lines.size(), 2u) << properties.output;
+    EXPECT_TRUE(Has(lines[0], "Nothing.here") && Has(lines[0], "0xC0040007")) << properties.output;
+    EXPECT_TRUE(Has(lines[1], "Setpoints.limit")) << properties.output;
+    EXPECT_FALSE(Has(properties.output, "0x80004005")) << properties.output;
+
+    // Each leaf's canonical type and rights, as the server gives them.
+    OpcRun details = Opc(R"(browse \\.\proc1 --flat --details --json --filter temperature)");
+    EXPECT_EQ(details.code, 0);
+    EXPECT_TRUE(
+        Has(details.output, R"({"item":"\\\\.\\proc1\\Setpoints.temperature","type":"double","access":"read/write"})"))
+        << details.output;
+    OpcRun tree = Opc(R"(browse \\.\proc1 --details)");
+    EXPECT_TRUE(Has(tree.output, R"(\\.\proc1\Waveform.sine  double  read)")) << tree.output;
+}
+
+// Usage errors need no server, and a server that does not answer is given
+// up on. The server here hangs while it starts: a usage error found only
+// after contacting it would come late and with another exit code.
+TEST(OpcToolAlone, UsageErrorsComeFirstAndConnectingTimesOut)
+{
+    ASSERT_TRUE(WaitForNoServerProcess(20000));
+    const wchar_t kKey[] = L"Software\\Classes\\CLSID\\{0BADC0DE-0000-4000-8000-00000000A001}";
+    const std::string hanging = " --server {0BADC0DE-0000-4000-8000-00000000A001}";
+    std::wstring server = BinPath(L"hanging_server.exe");
+    ASSERT_EQ(RegSetKeyValueW(HKEY_LOCAL_MACHINE, (std::wstring(kKey) + L"\\LocalServer32").c_str(), nullptr, REG_SZ,
+                              server.c_str(), static_cast<DWORD>((server.size() + 1) * sizeof(wchar_t))),
+              ERROR_SUCCESS);
+    for (const char *wrong : {"read x --source nowhere", "read", "write x", "subscribe x --rate fast", "browse a b",
+                              "status extra", "properties", "read x --type colour", "status --timeout soon"}) {
+        OpcRun run = Opc(wrong + hanging);
+        EXPECT_EQ(run.code, 2) << wrong << ": " << run.output;
+        EXPECT_EQ(CountProcesses(L"hanging_server.exe"), 0) << wrong << " started the server";
+    }
+
+    OpcRun hung = Opc("status --timeout 2" + hanging);
+    RegDeleteTreeW(HKEY_LOCAL_MACHINE, kKey);
+    EXPECT_EQ(hung.code, 3) << hung.output;
+    EXPECT_TRUE(Has(hung.output, "did not answer within 2 s")) << hung.output;
+    EXPECT_TRUE(WaitForNoProcess(L"hanging_server.exe", 60000));
+}

@@ -10,6 +10,11 @@ const CLSID CLSID_SkylarcOPCServerE2E = {0x5b1e7a20, 0x4c3d, 0x11d3, {0x9a, 0x44
 
 int CountServerProcesses()
 {
+    return CountProcesses(L"Local.exe");
+}
+
+int CountProcesses(const wchar_t *image)
+{
     UniqueHandle snapshot(CreateToolhelp32Snapshot(TH32CS_SNAPPROCESS, 0));
     if (!snapshot)
         return -1;
@@ -17,7 +22,7 @@ int CountServerProcesses()
     entry.dwSize = sizeof entry;
     int count = 0;
     for (BOOL more = Process32FirstW(snapshot.Get(), &entry); more; more = Process32NextW(snapshot.Get(), &entry)) {
-        if (_wcsicmp(entry.szExeFile, L"Local.exe") == 0)
+        if (_wcsicmp(entry.szExeFile, image) == 0)
             ++count;
     }
     return count;
@@ -45,8 +50,13 @@ long RunCadroctl(const std::wstring &arguments, std::string &output)
 
 bool WaitForNoServerProcess(DWORD timeoutMs)
 {
+    return WaitForNoProcess(L"Local.exe", timeoutMs);
+}
+
+bool WaitForNoProcess(const wchar_t *image, DWORD timeoutMs)
+{
     DWORD start = GetTickCount();
-    while (CountServerProcesses() != 0) {
+    while (CountProcesses(image) != 0) {
         if (GetTickCount() - start > timeoutMs)
             return false;
         Sleep(100);

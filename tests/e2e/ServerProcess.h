@@ -9,8 +9,9 @@
 
 extern const CLSID CLSID_SkylarcOPCServerE2E;
 
-// Number of running processes whose image is Local.exe.
+// Number of running processes whose image is Local.exe, or image.
 int CountServerProcesses();
+int CountProcesses(const wchar_t *image);
 // The id of a running Local.exe, 0 when none.
 DWORD ServerProcessId();
 // Runs cadroctl against the running server's network only (other programs
@@ -18,6 +19,7 @@ DWORD ServerProcessId();
 long RunCadroctl(const std::wstring &arguments, std::string &output);
 // Waits up to timeoutMs for no server process to be left.
 bool WaitForNoServerProcess(DWORD timeoutMs);
+bool WaitForNoProcess(const wchar_t *image, DWORD timeoutMs);
 // Full path of a program of the build (from SKYLARC_BIN_DIR, else beside
 // this program).
 std::wstring BinPath(const wchar_t *file);

@@ -14,14 +14,17 @@ std::wstring LongName(const std::wstring &option)
         return L"server";
     if (option == L"-j")
         return L"json";
+    if (option == L"-t")
+        return L"timeout";
     return option.substr(2);
 }
 } // namespace
 
 const std::vector<std::wstring> &Arguments::ValueOptions()
 {
-    static const std::vector<std::wstring> options = {L"server", L"source", L"type",   L"rate",  L"duration",
-                                                      L"count",  L"filter", L"access", L"depth", L"deadband"};
+    static const std::vector<std::wstring> options = {L"server",   L"source",   L"type",   L"rate",
+                                                      L"duration", L"count",    L"filter", L"access",
+                                                      L"depth",    L"deadband", L"timeout"};
     return options;
 }
 

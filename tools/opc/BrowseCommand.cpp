@@ -15,8 +15,59 @@ struct Filters {
     bool Any() const { return !pattern.empty() || type != VT_EMPTY || access != 0; }
 };
 
+// A leaf's canonical type and access rights (--details).
+struct Details {
+    VARTYPE type = VT_EMPTY;
+    DWORD access = 0;
+    bool known = false;
+};
+
+std::wstring AccessName(DWORD access)
+{
+    switch (access & (OPC_READABLE | OPC_WRITEABLE)) {
+    case OPC_READABLE:
+        return L"read";
+    case OPC_WRITEABLE:
+        return L"write";
+    case OPC_READABLE | OPC_WRITEABLE:
+        return L"read/write";
+    default:
+        return L"none";
+    }
+}
+
+// The details of every identifier, from one ValidateItems call: the server
+// looks each item up once, and no item is added.
+std::vector<Details> ReadDetails(IOPCServer *server, const std::vector<std::wstring> &ids)
+{
+    std::vector<Details> details(ids.size());
+    ItemGroup group;
+    std::vector<ItemGroup::Item> items;
+    if (ids.empty() || FAILED(group.Create(server, 1000, false, 0)) || FAILED(group.Validate(ids, items)))
+        return details;
+    for (size_t i = 0; i < ids.size() && i < items.size(); ++i)
+        if (SUCCEEDED(items[i].error))
+            details[i] = {items[i].canonical, items[i].access, true};
+    return details;
+}
+
+// The details as a text column, or as JSON fields.
+std::wstring DetailsText(const Details &d)
+{
+    return d.known ? TypeName(d.type) + L"  " + AccessName(d.access) : L"";
+}
+
+void AddDetailFields(const Details &d, std::vector<std::pair<std::wstring, std::wstring>> &fields)
+{
+    if (!d.known)
+        return;
+    fields.push_back({L"type", JsonString(TypeName(d.type))});
+    fields.push_back({L"access", JsonString(AccessName(d.access))});
+}
+
 struct Node {
     std::wstring name, itemId;
+    Details details;
     bool branch = false;
     std::vector<std::unique_ptr<Node>> children;
     bool HasItems() const
@@ -25,6 +76,14 @@ struct Node {
             if (!child->branch || child->HasItems())
                 return true;
         return false;
+    }
+    void Leaves(std::vector<Node *> &out)
+    {
+        for (auto &child : children)
+            if (child->branch)
+                child->Leaves(out);
+            else
+                out.push_back(child.get());
     }
 };
 
@@ -92,8 +151,10 @@ void Print(const Node &node, const std::wstring &path, int level, bool prune, Ou
                 {L"name", JsonString(child->name)},
                 {L"path", JsonString(childPath)},
                 {L"depth", std::to_wstring(level)}};
-            if (!child->branch)
+            if (!child->branch) {
                 fields.push_back({L"item", JsonString(child->itemId)});
+                AddDetailFields(child->details, fields);
+            }
             out.Line(Output::Object(fields));
         } else {
             std::wstring indent(static_cast<size_t>(level) * 2, L' ');
@@ -102,6 +163,8 @@ void Print(const Node &node, const std::wstring &path, int level, bool prune, Ou
                 if (line.size() < 40)
                     line.resize(40, L' ');
                 line += L"  " + child->itemId;
+                if (child->details.known)
+                    line += L"  " + DetailsText(child->details);
             }
             out.Line(line);
         }
@@ -152,16 +215,22 @@ bool ReadFilters(const Arguments &args, Output &out, Filters &filters, int &dept
 }
 } // namespace
 
-int Browse(const Arguments &args, Output &out, Connection &server)
+bool CheckBrowse(const Arguments &args, Output &out)
 {
     Filters filters;
     int depth = 0;
     if (args.Positional().size() > 1) {
         out.Error(L"browse takes one branch at most");
-        return kExitUsage;
+        return false;
     }
-    if (!ReadFilters(args, out, filters, depth))
-        return kExitUsage;
+    return ReadFilters(args, out, filters, depth);
+}
+
+int Browse(const Arguments &args, Output &out, Connection &server)
+{
+    Filters filters;
+    int depth = 0;
+    ReadFilters(args, out, filters, depth);
     ComPtr<IOPCBrowseServerAddressSpace> browse;
     if (FAILED(ComPtr<IOPCServer>(server.Server()).As(browse))) {
         out.Error(L"browse: the server offers no address space to browse");
@@ -170,17 +239,40 @@ int Browse(const Arguments &args, Output &out, Connection &server)
     std::wstring branch = args.Positional().empty() ? L"" : args.Positional()[0];
     HRESULT hr = GoTo(browse.Get(), branch);
     if (FAILED(hr)) {
+        // The browse interface answers E_FAIL for a name or identifier it
+        // cannot find; what the user needs to hear is that it is unknown.
+        if (hr == E_FAIL || hr == E_INVALIDARG)
+            hr = OPC_E_UNKNOWNITEMID;
         out.Error(L"browse " + branch + L": no such branch: " + server.Describe(hr));
         return kExitFailed;
     }
     OPCNAMESPACETYPE organization = OPC_NS_HIERARCHIAL;
     browse->QueryOrganization(&organization);
+    bool details = args.Has(L"details");
     if (args.Has(L"flat") || organization == OPC_NS_FLAT) {
-        for (const std::wstring &id : Names(browse.Get(), OPC_FLAT, filters, hr))
-            out.Line(out.Json() ? Output::Object({{L"item", JsonString(id)}}) : id);
+        std::vector<std::wstring> ids = Names(browse.Get(), OPC_FLAT, filters, hr);
+        std::vector<Details> found = details ? ReadDetails(server.Server(), ids) : std::vector<Details>(ids.size());
+        for (size_t i = 0; i < ids.size(); ++i) {
+            std::vector<std::pair<std::wstring, std::wstring>> fields = {{L"item", JsonString(ids[i])}};
+            AddDetailFields(found[i], fields);
+            std::wstring line = ids[i];
+            if (found[i].known)
+                line += L"  " + DetailsText(found[i]);
+            out.Line(out.Json() ? Output::Object(fields) : line);
+        }
     } else {
         Node root;
         hr = Load(browse.Get(), filters, depth, root);
+        if (details) {
+            std::vector<Node *> leaves;
+            root.Leaves(leaves);
+            std::vector<std::wstring> ids;
+            for (Node *leaf : leaves)
+                ids.push_back(leaf->itemId);
+            std::vector<Details> found = ReadDetails(server.Server(), ids);
+            for (size_t i = 0; i < leaves.size(); ++i)
+                leaves[i]->details = found[i];
+        }
         Print(root, branch.compare(0, 2, L"\\\\") == 0 ? L"" : branch, 0, filters.Any(), out);
     }
     if (FAILED(hr)) {

@@ -1,12 +1,51 @@
 #include "Connection.h"
 
 #include "Format.h"
+#include "Handle.h"
 #include "TaskMem.h"
 #include "opccomn.h"
 
+#include <atomic>
+
 const wchar_t Connection::kDefaultServer[] = L"Tarnwell.SkylarcOPCServer";
 
-int Connection::Open(const std::wstring &name, Output &out)
+namespace {
+// The creation of a server on a thread of its own, so that the caller can
+// give up waiting. Shared with that thread, which may outlive the wait.
+struct Creation {
+    CLSID clsid;
+    IOPCServer *server = nullptr;
+    HRESULT result = E_PENDING;
+    std::atomic<long> refs{2}; // the caller's and the thread's
+
+    static Creation *New(const CLSID &clsid)
+    {
+        auto *creation = new Creation();
+        creation->clsid = clsid;
+        return creation;
+    }
+    void Release()
+    {
+        if (--refs == 0) {
+            if (server)
+                server->Release();
+            delete this;
+        }
+    }
+    static DWORD WINAPI Run(void *context)
+    {
+        auto *self = static_cast<Creation *>(context);
+        CoInitializeEx(nullptr, COINIT_MULTITHREADED);
+        self->result = CoCreateInstance(self->clsid, nullptr, CLSCTX_LOCAL_SERVER, IID_IOPCServer,
+                                        reinterpret_cast<void **>(&self->server));
+        CoUninitialize(); // the pointer lives on in the process's apartment
+        self->Release();
+        return 0;
+    }
+};
+} // namespace
+
+int Connection::Open(const std::wstring &name, double timeoutSeconds, Output &out)
 {
     CLSID clsid;
     HRESULT hr = name.size() > 0 && name[0] == L'{' ? CLSIDFromString(name.c_str(), &clsid)
@@ -15,8 +54,26 @@ int Connection::Open(const std::wstring &name, Output &out)
         out.Error(L"no OPC server is registered as \"" + name + L"\"");
         return kExitNoServer;
     }
-    hr = CoCreateInstance(clsid, nullptr, CLSCTX_LOCAL_SERVER, IID_IOPCServer,
-                          reinterpret_cast<void **>(m_server.Out()));
+    // COM waits for a server that hangs while it starts as long as the
+    // server lives; opc gives up after the timeout and leaves the creation
+    // to finish or fail on its own thread.
+    Creation *creation = Creation::New(clsid);
+    UniqueHandle thread(CreateThread(nullptr, 0, Creation::Run, creation, 0, nullptr));
+    if (!thread) {
+        creation->refs = 1;
+        Creation::Run(creation);
+    } else if (WaitForSingleObject(thread.Get(), static_cast<DWORD>(timeoutSeconds * 1000)) == WAIT_TIMEOUT) {
+        creation->Release();
+        out.Error(L"the OPC server \"" + name + L"\" did not answer within " +
+                  std::to_wstring(static_cast<long>(timeoutSeconds)) + L" s");
+        return kExitNoServer;
+    }
+    hr = creation->result;
+    if (SUCCEEDED(hr)) {
+        m_server = ComPtr<IOPCServer>::Attach(creation->server);
+        creation->server = nullptr;
+    }
+    creation->Release();
     if (FAILED(hr)) {
         out.Error(L"cannot reach the OPC server \"" + name + L"\": " + SystemErrorText(hr) + L" (" + HexCode(hr) +
                   L")");
@@ -88,6 +145,17 @@ HRESULT ItemGroup::Activate()
 
 HRESULT ItemGroup::Add(const std::vector<std::wstring> &ids, VARTYPE requested, std::vector<Item> &items)
 {
+    return AddOrValidate(ids, requested, false, items);
+}
+
+HRESULT ItemGroup::Validate(const std::vector<std::wstring> &ids, std::vector<Item> &items)
+{
+    return AddOrValidate(ids, VT_EMPTY, true, items);
+}
+
+HRESULT ItemGroup::AddOrValidate(const std::vector<std::wstring> &ids, VARTYPE requested, bool validateOnly,
+                                 std::vector<Item> &items)
+{
     std::vector<OPCITEMDEF> defs(ids.size());
     for (size_t i = 0; i < ids.size(); ++i) {
         defs[i] = {};
@@ -99,7 +167,9 @@ HRESULT ItemGroup::Add(const std::vector<std::wstring> &ids, VARTYPE requested, 
     }
     OPCITEMRESULT *rawResults = nullptr;
     HRESULT *rawErrors = nullptr;
-    HRESULT hr = m_items->AddItems(static_cast<DWORD>(defs.size()), defs.data(), &rawResults, &rawErrors);
+    DWORD count = static_cast<DWORD>(defs.size());
+    HRESULT hr = validateOnly ? m_items->ValidateItems(count, defs.data(), FALSE, &rawResults, &rawErrors)
+                              : m_items->AddItems(count, defs.data(), &rawResults, &rawErrors);
     TaskMem<OPCITEMRESULT> results(rawResults);
     TaskMem<HRESULT> errors(rawErrors);
     items.assign(ids.size(), Item());

@@ -10,13 +10,17 @@
 // Exit codes of opc.
 enum ExitCode { kExitOk = 0, kExitFailed = 1, kExitUsage = 2, kExitNoServer = 3 };
 
+// How long opc waits for a server to be created, unless --timeout says.
+constexpr double kDefaultTimeoutSeconds = 30;
+
 // The server named by a ProgID or a {CLSID}, created out of process.
 class Connection {
 public:
     static const wchar_t kDefaultServer[];
 
-    // kExitOk, or kExitNoServer with the reason written to out.
-    int Open(const std::wstring &name, Output &out);
+    // kExitOk, or kExitNoServer with the reason written to out, also when
+    // the server has not answered within timeoutSeconds.
+    int Open(const std::wstring &name, double timeoutSeconds, Output &out);
     IOPCServer *Server() const { return m_server.Get(); }
 
     // "<the server's text for code> (0x...)", the system's text when the
@@ -49,6 +53,8 @@ public:
     HRESULT Create(IOPCServer *server, DWORD rate, bool active, float deadband, DWORD *revisedRate = nullptr);
     // Adds every identifier, active, with client handles 0..n-1.
     HRESULT Add(const std::vector<std::wstring> &ids, VARTYPE requested, std::vector<Item> &items);
+    // Types and rights of the identifiers, without adding them.
+    HRESULT Validate(const std::vector<std::wstring> &ids, std::vector<Item> &items);
     template <class I> HRESULT As(ComPtr<I> &out) const { return m_items.As(out); }
     // Makes the group active (its first scan reports every item at once).
     HRESULT Activate();
@@ -56,6 +62,9 @@ public:
     static void Valid(const std::vector<Item> &items, std::vector<OPCHANDLE> &servers, std::vector<size_t> &which);
 
 private:
+    HRESULT AddOrValidate(const std::vector<std::wstring> &ids, VARTYPE requested, bool validateOnly,
+                          std::vector<Item> &items);
+
     IOPCServer *m_server = nullptr;
     OPCHANDLE m_handle = 0;
     ComPtr<IOPCItemMgt> m_items;

@@ -80,20 +80,39 @@ bool PrintProperties(IOPCItemProperties *properties, const std::wstring &id, Out
 }
 } // namespace
 
-int ShowProperties(const Arguments &args, Output &out, Connection &server)
+bool CheckProperties(const Arguments &args, Output &out)
 {
     if (args.Positional().empty()) {
         out.Error(L"properties needs at least one item (see opc properties --help)");
-        return kExitUsage;
+        return false;
     }
+    return true;
+}
+
+int ShowProperties(const Arguments &args, Output &out, Connection &server)
+{
     ComPtr<IOPCItemProperties> properties;
     if (FAILED(ComPtr<IOPCServer>(server.Server()).As(properties))) {
         out.Error(L"properties: the server offers no item properties");
         return kExitFailed;
     }
+    // The server lists the same properties for any identifier and fails
+    // each of them for an unknown one (and ValidateItems accepts what the
+    // address space lacks); adding the items to an inactive group finds the
+    // real cause, said once per item.
+    ItemGroup group;
+    std::vector<ItemGroup::Item> known;
+    if (FAILED(group.Create(server.Server(), 1000, false, 0)) || FAILED(group.Add(args.Positional(), VT_EMPTY, known)))
+        known.clear();
     bool failed = false;
-    for (const std::wstring &id : args.Positional())
-        if (!PrintProperties(properties.Get(), id, out, server))
+    for (size_t i = 0; i < args.Positional().size(); ++i) {
+        const std::wstring &id = args.Positional()[i];
+        if (i < known.size() && FAILED(known[i].error)) {
+            ReportItemError(out, server, L"properties", id, known[i].error);
             failed = true;
+        } else if (!PrintProperties(properties.Get(), id, out, server)) {
+            failed = true;
+        }
+    }
     return failed ? kExitFailed : kExitOk;
 }

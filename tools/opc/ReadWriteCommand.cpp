@@ -6,10 +6,31 @@
 #include "TaskMem.h"
 #include "Variant.h"
 
+#include <functional>
+
 namespace {
-// Adds the items; reports those the server refused. False when none was added.
+// What opc says about each item, said in the order of the arguments once
+// every answer is in (errors of AddItems, of the value, of the call).
+class ItemReports {
+public:
+    explicit ItemReports(size_t count) : m_say(count) {}
+    void Set(size_t i, std::function<void()> say) { m_say[i] = std::move(say); }
+    void Say()
+    {
+        for (auto &say : m_say)
+            if (say)
+                say();
+    }
+
+private:
+    std::vector<std::function<void()>> m_say;
+};
+
+// Adds the items and records those the server refused. False when none was
+// added (the reason is reported unless it is the items' own).
 bool AddItems(const std::vector<std::wstring> &ids, VARTYPE requested, ItemGroup &group,
-              std::vector<ItemGroup::Item> &items, const wchar_t *verb, Output &out, Connection &server, bool &failed)
+              std::vector<ItemGroup::Item> &items, const wchar_t *verb, Output &out, Connection &server,
+              ItemReports &reports, bool &failed)
 {
     HRESULT hr = group.Create(server.Server(), 1000, true, 0);
     if (SUCCEEDED(hr))
@@ -20,9 +41,11 @@ bool AddItems(const std::vector<std::wstring> &ids, VARTYPE requested, ItemGroup
         return false;
     }
     bool any = false;
-    for (const ItemGroup::Item &item : items) {
-        if (FAILED(item.error)) {
-            ReportItemError(out, server, verb, item.id, item.error);
+    for (size_t i = 0; i < items.size(); ++i) {
+        if (FAILED(items[i].error)) {
+            HRESULT error = items[i].error;
+            std::wstring id = items[i].id;
+            reports.Set(i, [&out, &server, verb, id, error] { ReportItemError(out, server, verb, id, error); });
             failed = true;
         } else {
             any = true;
@@ -63,25 +86,37 @@ bool RequestedType(const Arguments &args, Output &out, VARTYPE &type)
     return false;
 }
 
-int ReadItems(const Arguments &args, Output &out, Connection &server)
+bool CheckRead(const Arguments &args, Output &out)
 {
     VARTYPE requested;
     if (!RequestedType(args, out, requested))
-        return kExitUsage;
+        return false;
     std::wstring source = args.Value(L"source", L"cache");
     if (source != L"cache" && source != L"device") {
         out.Error(L"--source takes cache or device, not \"" + source + L"\"");
-        return kExitUsage;
+        return false;
     }
     if (args.Positional().empty()) {
         out.Error(L"read needs at least one item (see opc read --help)");
-        return kExitUsage;
+        return false;
     }
+    return true;
+}
+
+int ReadItems(const Arguments &args, Output &out, Connection &server)
+{
+    VARTYPE requested;
+    RequestedType(args, out, requested);
+    std::wstring source = args.Value(L"source", L"cache");
     ItemGroup group;
     std::vector<ItemGroup::Item> items;
+    ItemReports reports(args.Positional().size());
     bool failed = false;
-    if (!AddItems(args.Positional(), requested, group, items, L"read", out, server, failed))
+    bool any = AddItems(args.Positional(), requested, group, items, L"read", out, server, reports, failed);
+    if (!any) {
+        reports.Say();
         return kExitFailed;
+    }
     std::vector<OPCHANDLE> handles;
     std::vector<size_t> which;
     ItemGroup::Valid(items, handles, which);
@@ -95,33 +130,44 @@ int ReadItems(const Arguments &args, Output &out, Connection &server)
     TaskMem<OPCITEMSTATE> states(rawStates);
     TaskMem<HRESULT> errors(rawErrors);
     if (FAILED(hr) || !states || !errors) {
+        reports.Say();
         out.Error(L"read: " + server.Describe(FAILED(hr) ? hr : E_FAIL));
         return kExitFailed;
     }
     for (size_t i = 0; i < handles.size(); ++i) {
         CVariant value;
         *value.Get() = states[i].vDataValue; // owned from here on
-        if (FAILED(errors[i])) {
-            ReportItemError(out, server, L"read", items[which[i]].id, errors[i]);
+        const std::wstring &id = items[which[i]].id;
+        HRESULT error = errors[i];
+        if (FAILED(error)) {
+            reports.Set(which[i], [&out, &server, id, error] { ReportItemError(out, server, L"read", id, error); });
             failed = true;
             continue;
         }
-        out.Line(
-            ItemValueLine(out.Json(), items[which[i]].id, value.Value(), states[i].wQuality, states[i].ftTimeStamp));
+        std::wstring line = ItemValueLine(out.Json(), id, value.Value(), states[i].wQuality, states[i].ftTimeStamp);
+        reports.Set(which[i], [&out, line] { out.Line(line); });
     }
+    reports.Say();
     return failed ? kExitFailed : kExitOk;
+}
+
+bool CheckWrite(const Arguments &args, Output &out)
+{
+    VARTYPE type;
+    if (!RequestedType(args, out, type))
+        return false;
+    if (args.Positional().empty() || args.Positional().size() % 2 != 0) {
+        out.Error(L"write needs ITEM VALUE pairs (see opc write --help)");
+        return false;
+    }
+    return true;
 }
 
 int WriteItems(const Arguments &args, Output &out, Connection &server)
 {
     VARTYPE type;
-    if (!RequestedType(args, out, type))
-        return kExitUsage;
+    RequestedType(args, out, type);
     const auto &pairs = args.Positional();
-    if (pairs.empty() || pairs.size() % 2 != 0) {
-        out.Error(L"write needs ITEM VALUE pairs (see opc write --help)");
-        return kExitUsage;
-    }
     std::vector<std::wstring> ids, texts;
     for (size_t i = 0; i < pairs.size(); i += 2) {
         ids.push_back(pairs[i]);
@@ -129,9 +175,12 @@ int WriteItems(const Arguments &args, Output &out, Connection &server)
     }
     ItemGroup group;
     std::vector<ItemGroup::Item> items;
+    ItemReports reports(ids.size());
     bool failed = false;
-    if (!AddItems(ids, VT_EMPTY, group, items, L"write", out, server, failed))
+    if (!AddItems(ids, VT_EMPTY, group, items, L"write", out, server, reports, failed)) {
+        reports.Say();
         return kExitFailed;
+    }
 
     std::vector<OPCHANDLE> handles;
     std::vector<size_t> which;
@@ -139,18 +188,21 @@ int WriteItems(const Arguments &args, Output &out, Connection &server)
     for (size_t i = 0; i < items.size(); ++i) {
         if (FAILED(items[i].error))
             continue;
-        HRESULT hr = ToValue(texts[i], type != VT_EMPTY ? type : items[i].canonical, values[i].Get());
-        if (FAILED(hr)) {
-            out.Error(L"write " + ids[i] + L": \"" + texts[i] + L"\" is no " +
-                      TypeName(type != VT_EMPTY ? type : items[i].canonical) + L" value");
+        VARTYPE target = type != VT_EMPTY ? type : items[i].canonical;
+        if (FAILED(ToValue(texts[i], target, values[i].Get()))) {
+            std::wstring message =
+                L"write " + ids[i] + L": \"" + texts[i] + L"\" is no " + TypeName(target) + L" value";
+            reports.Set(i, [&out, message] { out.Error(message); });
             failed = true;
             continue;
         }
         handles.push_back(items[i].server);
         which.push_back(i);
     }
-    if (handles.empty())
+    if (handles.empty()) {
+        reports.Say();
         return kExitFailed;
+    }
     std::vector<VARIANT> sent;
     for (size_t i : which)
         sent.push_back(values[i].Value());
@@ -161,19 +213,24 @@ int WriteItems(const Arguments &args, Output &out, Connection &server)
         io ? io->Write(static_cast<DWORD>(handles.size()), handles.data(), sent.data(), &rawErrors) : E_NOINTERFACE;
     TaskMem<HRESULT> errors(rawErrors);
     if (FAILED(hr) || !errors) {
+        reports.Say();
         out.Error(L"write: " + server.Describe(FAILED(hr) ? hr : E_FAIL));
         return kExitFailed;
     }
     for (size_t k = 0; k < which.size(); ++k) {
         const std::wstring &id = ids[which[k]];
-        if (FAILED(errors[k])) {
-            ReportItemError(out, server, L"write", id, errors[k]);
+        HRESULT error = errors[k];
+        if (FAILED(error)) {
+            reports.Set(which[k], [&out, &server, id, error] { ReportItemError(out, server, L"write", id, error); });
             failed = true;
         } else if (out.Json()) {
-            out.Line(Output::Object({{L"item", JsonString(id)}, {L"written", ValueJson(sent[k])}}));
+            std::wstring line = Output::Object({{L"item", JsonString(id)}, {L"written", ValueJson(sent[k])}});
+            reports.Set(which[k], [&out, line] { out.Line(line); });
         } else {
-            out.Line(id + L" = " + ValueText(sent[k]));
+            std::wstring line = id + L" = " + ValueText(sent[k]);
+            reports.Set(which[k], [&out, line] { out.Line(line); });
         }
     }
+    reports.Say();
     return failed ? kExitFailed : kExitOk;
 }

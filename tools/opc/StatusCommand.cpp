@@ -23,12 +23,17 @@ const wchar_t *StateName(OPCSERVERSTATE state)
 }
 } // namespace
 
-int ShowStatus(const Arguments &args, Output &out, Connection &server)
+bool CheckStatus(const Arguments &args, Output &out)
 {
     if (!args.Positional().empty()) {
         out.Error(L"status takes no arguments");
-        return kExitUsage;
+        return false;
     }
+    return true;
+}
+
+int ShowStatus(const Arguments &, Output &out, Connection &server)
+{
     OPCSERVERSTATUS *raw = nullptr;
     HRESULT hr = server.Server()->GetStatus(&raw);
     TaskMem<OPCSERVERSTATUS> status(raw);

@@ -181,16 +181,25 @@ private:
 };
 } // namespace
 
-int Subscribe(const Arguments &args, Output &out, Connection &server)
+bool CheckSubscribe(const Arguments &args, Output &out)
 {
     VARTYPE requested;
     Limits limits;
     if (!RequestedType(args, out, requested) || !ReadLimits(args, out, limits))
-        return kExitUsage;
+        return false;
     if (args.Positional().empty()) {
         out.Error(L"subscribe needs at least one item (see opc subscribe --help)");
-        return kExitUsage;
+        return false;
     }
+    return true;
+}
+
+int Subscribe(const Arguments &args, Output &out, Connection &server)
+{
+    VARTYPE requested;
+    Limits limits;
+    RequestedType(args, out, requested);
+    ReadLimits(args, out, limits);
     ItemGroup group;
     std::vector<ItemGroup::Item> items;
     // Made active only once the sink is connected, so that the first scan,

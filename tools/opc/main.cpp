@@ -14,6 +14,7 @@ struct Command {
     const wchar_t *usage; // what follows "opc <name>" and the options
     std::vector<std::wstring> options;
     int (*run)(const Arguments &, Output &, Connection &);
+    bool (*check)(const Arguments &, Output &); // before the server is started
 };
 
 int RunListServers(const Arguments &args, Output &out, Connection &)
@@ -24,6 +25,7 @@ int RunListServers(const Arguments &args, Output &out, Connection &)
 const wchar_t kCommonOptions[] =
     L"  -s, --server NAME   the server's ProgID or {CLSID} (default Tarnwell.SkylarcOPCServer)\n"
     L"  -j, --json          one JSON object per line, for scripts\n"
+    L"  -t, --timeout SECONDS  how long to wait for the server to answer (default 30)\n"
     L"  -h, --help          this text\n";
 
 const Command kCommands[] = {
@@ -32,16 +34,19 @@ const Command kCommands[] = {
      L"\n\nLists every class of the OPC DA 1.0 and 2.0 component categories, and every ProgID\n"
      L"that carries an OPC key: ProgID, versions, vendor, CLSID and description.\n",
      {},
-     RunListServers},
+     RunListServers,
+     nullptr},
     {L"status",
      L"show a server's status",
      L"\n\nPrints the server's state, start time, current time, last update time, group\n"
      L"count, version and vendor.\n",
      {},
-     ShowStatus},
+     ShowStatus,
+     CheckStatus},
     {L"browse",
      L"browse a server's address space",
-     L" [BRANCH] [--flat] [--depth N] [--filter PATTERN] [--type TYPE] [--access read|write]\n\n"
+     L" [BRANCH] [--flat] [--depth N] [--filter PATTERN] [--type TYPE] [--access read|write]\n"
+     L"              [--details]\n\n"
      L"Prints the tree of branches and items below BRANCH (the root when absent),\n"
      L"indented, with each item's identifier. BRANCH is either an item identifier of a\n"
      L"branch (\\\\MACHINE\\process\\object) or the names to descend, separated by '/'.\n"
@@ -49,9 +54,11 @@ const Command kCommands[] = {
      L"  --depth N           descend at most N levels (1: the branch's own contents)\n"
      L"  --filter PATTERN    only items whose names match PATTERN (* ? # [ ])\n"
      L"  --type TYPE         only items whose value converts to TYPE\n"
-     L"  --access MODE       only items that can be read, or written\n",
-     {L"flat", L"depth", L"filter", L"type", L"access"},
-     Browse},
+     L"  --access MODE       only items that can be read, or written\n"
+     L"  --details           each item's canonical type and access rights\n",
+     {L"flat", L"depth", L"filter", L"type", L"access", L"details"},
+     Browse,
+     CheckBrowse},
     {L"read",
      L"read items once",
      L" ITEM... [--source cache|device] [--type TYPE]\n\n"
@@ -60,7 +67,8 @@ const Command kCommands[] = {
      L"  --type TYPE         the type to ask for (bool, int8..int64, uint8..uint64, float,\n"
      L"                      double, currency, date, string; VT_ names too)\n",
      {L"source", L"type"},
-     ReadItems},
+     ReadItems,
+     CheckRead},
     {L"write",
      L"write values to items",
      L" ITEM VALUE [ITEM VALUE...] [--type TYPE]\n\n"
@@ -68,7 +76,8 @@ const Command kCommands[] = {
      L"invariant format: a point for decimals, true or false for booleans.\n"
      L"  --type TYPE         the type to send the values as\n",
      {L"type"},
-     WriteItems},
+     WriteItems,
+     CheckWrite},
     {L"subscribe",
      L"print the changes of items as they arrive",
      L" ITEM... [--rate MS] [--duration SECONDS] [--count N] [--deadband PERCENT]\n"
@@ -83,12 +92,14 @@ const Command kCommands[] = {
      L"  --da1               receive OPC DA 1.0 data streams (IDataObject) instead of\n"
      L"                      DA 2.0 callbacks (IOPCDataCallback)\n",
      {L"rate", L"duration", L"count", L"deadband", L"type", L"da1"},
-     Subscribe},
+     Subscribe,
+     CheckSubscribe},
     {L"properties",
      L"list the properties of items",
      L" ITEM...\n\nPrints each property's id, description, type and value.\n",
      {},
-     ShowProperties},
+     ShowProperties,
+     CheckProperties},
 };
 
 void PrintUsage(Output &out)
@@ -104,7 +115,7 @@ void PrintUsage(Output &out)
     text += kCommonOptions;
     text += L"\n'opc COMMAND --help' describes a command.\n\n"
             L"Exit codes: 0 success, 1 an operation or an item failed, 2 wrong usage,\n"
-            L"3 the server is not registered or cannot be reached.";
+            L"3 the server is not registered, cannot be reached or does not answer in time.";
     out.Line(text);
 }
 
@@ -146,15 +157,22 @@ int Run()
             return kExitOk;
         }
         std::vector<std::wstring> known = c.options;
-        known.insert(known.end(), {L"server", L"json", L"help"});
+        known.insert(known.end(), {L"server", L"json", L"help", L"timeout"});
         std::wstring unknown = args.Unknown(known);
         if (!unknown.empty()) {
             out.Error(L"unknown option " + unknown + L" of " + c.name + L" (see opc " + c.name + L" --help)");
             return kExitUsage;
         }
+        if (c.check && !c.check(args, out))
+            return kExitUsage;
+        double timeout = kDefaultTimeoutSeconds;
+        if (args.Has(L"timeout") && !ParseNumber(args.Value(L"timeout"), 1, 86400, timeout)) {
+            out.Error(L"--timeout takes a number of seconds from 1 to 86400");
+            return kExitUsage;
+        }
         Connection server;
         if (c.run != RunListServers) {
-            int opened = server.Open(args.Value(L"server", Connection::kDefaultServer), out);
+            int opened = server.Open(args.Value(L"server", Connection::kDefaultServer), timeout, out);
             if (opened != kExitOk)
                 return opened;
         }
