@@ -1,11 +1,11 @@
 // Plant-size item counts, measured as a SCADA client meets them: through COM
 // from this process against the registered local server. It writes its own
-// network description (one object of N members for N = 1,000, 10,000 and
-// 100,000, and 100 objects of 1,000 members), points the simulated network
+// network description (for N = 1,000, 10,000 and 100,000: one object of N
+// members, and 100 objects of N/100 members), points the simulated network
 // at it through the registry value "Network File" for the length of the run,
 // and prints:
 // - AddItems of N distinct items, all in one object and spread over 100
-//   objects, with the time per item;
+//   objects: the first call and the best of three, with the time per item;
 // - ValidateItems of 10,000 items;
 // - cache Read of 1,000 and 10,000 items;
 // - the server's memory per item at 100,000 items (growth of its working
@@ -45,9 +45,11 @@ std::wstring OneObjectId(DWORD n, DWORD i)
     return L"\\\\.\\scale\\Flat" + std::to_wstring(n) + L".m" + std::to_wstring(i);
 }
 
-std::wstring SpreadId(DWORD i)
+// The N members of the spread layout of N are those of its 100 objects:
+// a lookup reads every member of an object it descends into.
+std::wstring SpreadId(DWORD n, DWORD i)
 {
-    return L"\\\\.\\scale\\Spread\\S" + std::to_wstring(i % kSpreadObjects) + L".m" +
+    return L"\\\\.\\scale\\Spread" + std::to_wstring(n) + L"\\S" + std::to_wstring(i % kSpreadObjects) + L".m" +
            std::to_wstring(i / kSpreadObjects);
 }
 
@@ -64,11 +66,12 @@ std::string Description()
     text += "object Fresh\n";
     for (DWORD i = 0; i < 100000; ++i)
         text += "member m" + std::to_string(i) + " value=1\n";
-    for (DWORD o = 0; o < kSpreadObjects; ++o) {
-        text += "object Spread\\S" + std::to_string(o) + "\n";
-        for (DWORD i = 0; i < 100000 / kSpreadObjects; ++i)
-            text += "member m" + std::to_string(i) + " value=2\n";
-    }
+    for (DWORD n : kCounts)
+        for (DWORD o = 0; o < kSpreadObjects; ++o) {
+            text += "object Spread" + std::to_string(n) + "\\S" + std::to_string(o) + "\n";
+            for (DWORD i = 0; i < n / kSpreadObjects; ++i)
+                text += "member m" + std::to_string(i) + " value=2\n";
+        }
     return text;
 }
 
@@ -218,23 +221,34 @@ std::vector<std::wstring> Ids(DWORD n, bool spread)
     std::vector<std::wstring> ids;
     ids.reserve(n);
     for (DWORD i = 0; i < n; ++i)
-        ids.push_back(spread ? SpreadId(i) : OneObjectId(n, i));
+        ids.push_back(spread ? SpreadId(n, i) : OneObjectId(n, i));
     return ids;
 }
 
 void AddItemsFigures(IOPCServer *server)
 {
-    printf("AddItems of N distinct items, one call, through COM:\n");
+    // The first call of each layout reads its nodes for the first time;
+    // later ones merge what the network gives into nodes that exist (a
+    // client that adds its items again after a restart of its own). The
+    // best of three is the machine's noise taken out.
+    const int runs = 3;
+    printf("AddItems of N distinct items, one call, through COM (first call, best of %d):\n", runs);
     double perItemAt1000[2] = {0, 0};
     for (DWORD n : kCounts) {
         for (int spread = 0; spread < 2; ++spread) {
-            Group group(server, L"scale");
-            double ms = group.Add(Ids(n, spread != 0));
-            double perItem = ms * 1000.0 / n;
+            std::vector<std::wstring> ids = Ids(n, spread != 0);
+            double first = 0, best = 1e12;
+            for (int run = 0; run < runs; ++run) {
+                Group group(server, L"scale");
+                double ms = group.Add(ids);
+                first = run == 0 ? ms : first;
+                best = ms < best ? ms : best;
+            }
+            double perItem = best * 1000.0 / n;
             if (n == 1000)
                 perItemAt1000[spread] = perItem;
-            printf("  N=%-7lu %-28s %9.1f ms  %6.2f us per item", static_cast<unsigned long>(n),
-                   spread ? "spread over 100 objects" : "one object of N members", ms, perItem);
+            printf("  N=%-7lu %-26s %8.1f ms %8.1f ms  %6.2f us per item", static_cast<unsigned long>(n),
+                   spread ? "spread over 100 objects" : "one object of N members", first, best, perItem);
             if (n != 1000 && perItemAt1000[spread] > 0)
                 printf("  (%.2f x the time per item at 1,000)", perItem / perItemAt1000[spread]);
             printf("\n");
