@@ -60,8 +60,7 @@ int Connection::Open(const std::wstring &name, double timeoutSeconds, Output &ou
     Creation *creation = Creation::New(clsid);
     UniqueHandle thread(CreateThread(nullptr, 0, Creation::Run, creation, 0, nullptr));
     if (!thread) {
-        creation->refs = 1;
-        Creation::Run(creation);
+        Creation::Run(creation); // gives back the thread's reference only
     } else if (WaitForSingleObject(thread.Get(), static_cast<DWORD>(timeoutSeconds * 1000)) == WAIT_TIMEOUT) {
         creation->Release();
         out.Error(L"the OPC server \"" + name + L"\" did not answer within " +
