@@ -6,6 +6,7 @@
 // Every type whose data fits in those 8 bytes can be held. VT_DECIMAL and
 // VT_RECORD, which the network never gives, cannot: taking one leaves
 // VT_ERROR with DISP_E_TYPEMISMATCH, as a failed copy does.
+#include "ValueConversion.h"
 #include "Variant.h"
 
 #include <cstdint>
@@ -20,10 +21,11 @@ public:
     CNetworkValue &operator=(const CNetworkValue &) = delete;
 
     // A VARIANT that borrows the data: read it, copy it, never clear it.
+    // Built inline (no call into the platform): the scan views every active
+    // item's values at every period.
     VARIANT View() const
     {
-        VARIANT v;
-        VariantInit(&v);
+        VARIANT v = {};
         V_VT(&v) = m_type;
         memcpy(&V_UI8(&v), &m_data, sizeof m_data);
         return v;
@@ -45,22 +47,12 @@ public:
         VariantInit(&value);
     }
 
-    // The copy rule of CopyVariant: a failed copy leaves VT_ERROR holding
-    // the failure code.
+    // By the copy rule of CopyVariant: a failed copy leaves VT_ERROR
+    // holding the failure code.
     HRESULT CopyFrom(const CNetworkValue &other)
     {
-        if (IsPlainType(other.m_type) && IsPlainType(m_type)) {
-            m_type = other.m_type;
-            m_data = other.m_data;
-            return S_OK;
-        }
-        VARIANT source = other.View(), copy;
-        VariantInit(&copy);
-        HRESULT hr = VariantCopy(&copy, &source);
-        if (FAILED(hr)) {
-            V_VT(&copy) = VT_ERROR;
-            V_ERROR(&copy) = hr;
-        }
+        VARIANT copy = {};
+        HRESULT hr = CopyVariant(&copy, other.View());
         Take(copy);
         return hr;
     }

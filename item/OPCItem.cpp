@@ -298,8 +298,7 @@ void COPCItem::OnDataUpdate(uint32_t flags, const CadroValue &value, int32_t err
     if (flags & kCadroHasQuality)
         m_deviceQuality = errorFlag == 0 ? OPC_QUALITY_GOOD : OPC_QUALITY_BAD;
     if (flags & kCadroHasValue) {
-        VARIANT arrived;
-        VariantInit(&arrived);
+        VARIANT arrived = {};
         m_lastReadResult = CadroValueToVariant(value, &arrived);
         m_deviceValue.Take(arrived);
         m_valueArrived.Set();
