@@ -21,6 +21,7 @@ double Ms(Clock::time_point from)
 
 int main(int argc, char **argv)
 {
+    CadroSim_UseEmbeddedNetwork(); // the network of the objects made in this process
     const int objects = argc > 1 ? atoi(argv[1]) : 100;
     const int membersPerObject = argc > 2 ? atoi(argv[2]) : 1000;
     std::wstring description = L"machine $HOST\nprocess bench\n";

@@ -49,6 +49,7 @@ double WorkingSetMiB()
 
 int main(int argc, char **argv)
 {
+    CadroSim_UseEmbeddedNetwork(); // the network of the objects made in this process
     const int members = argc > 1 ? atoi(argv[1]) : 1000;
     const int subscriptions = argc > 2 ? atoi(argv[2]) : 100000;
     const int period = argc > 3 ? atoi(argv[3]) : 10;

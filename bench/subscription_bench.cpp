@@ -319,6 +319,7 @@ void CompareThroughCom(const std::vector<DWORD> &counts)
 // those counts in turn (repeat a count to see how much it varies).
 int wmain(int argc, wchar_t **argv)
 {
+    CadroSim_UseEmbeddedNetwork(); // the network of the objects made in this process
     CoInitializeEx(nullptr, COINIT_MULTITHREADED);
     if (argc > 1 && wcscmp(argv[1], L"-i") == 0)
         inProcessOnly = true;

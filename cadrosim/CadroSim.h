@@ -24,6 +24,17 @@ CADROSIM_API HRESULT CadroSim_Execute(const wchar_t *command, BSTR *answer);
 // error (freed by the caller) when it does not parse.
 CADROSIM_API HRESULT CadroSim_Load(const wchar_t *description, BSTR *error);
 
+// This process serves a network of its own instead of reaching the network
+// node: for the node itself and for tests. Called before any other use.
+CADROSIM_API void CadroSim_UseEmbeddedNetwork();
+// Serves this process's network to the libraries of other processes until
+// "shutdown" or until none has been connected for idleSeconds; the process's
+// exit code (1: another node runs already).
+CADROSIM_API int CadroSim_RunNode(unsigned long idleSeconds);
+// Asks a running network node to shut down and waits for it to end: S_OK,
+// S_FALSE when none runs, E_FAIL when it did not end.
+CADROSIM_API HRESULT CadroSim_StopNode();
+
 // The control pipe of the engine in process processId.
 inline std::wstring ControlPipeName(unsigned long processId)
 {

@@ -74,7 +74,7 @@ const wchar_t kHelp[] = L"ok\n"
                         L"disconnect <machine> | reconnect <machine>\n"
                         L"stall <url> | unstall <url>\n"
                         L"show <url> | browse <url> | list-subscriptions | status\n"
-                        L"reset (back to the network's description)\n";
+                        L"reset (back to the network's description) | shutdown (a network node)\n";
 } // namespace
 
 std::wstring Engine::Execute(const std::wstring &command)
@@ -107,6 +107,17 @@ std::wstring Engine::Execute(const std::wstring &command)
     if (verb == L"reset") {
         LoadInitialNetwork();
         return m_loadError.empty() ? L"ok\n" : Error(m_loadError);
+    }
+    if (verb == L"shutdown") {
+        std::function<void()> shutdown;
+        {
+            std::lock_guard<SlimMutex> l(m_shutdownLock);
+            shutdown = m_shutdown;
+        }
+        if (!shutdown)
+            return Error(L"this network is part of its program, not a network node: it ends with the program");
+        shutdown();
+        return L"ok\n";
     }
     if (verb == L"help")
         return kHelp;

@@ -304,6 +304,12 @@ bool Engine::Browse(const std::wstring &url, std::vector<BrowseEntry> &out)
     return List(url, out);
 }
 
+void Engine::SetShutdownHandler(std::function<void()> handler)
+{
+    std::lock_guard<SlimMutex> l(m_shutdownLock);
+    m_shutdown = std::move(handler);
+}
+
 void Engine::AddBrowserReceiver(ICadroBrowserReceiver *receiver)
 {
     std::lock_guard<SlimMutex> l(m_receiversLock);

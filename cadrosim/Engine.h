@@ -133,6 +133,10 @@ public:
     // A browse session's listing: counted, for "status".
     bool Browse(const std::wstring &url, std::vector<BrowseEntry> &out);
 
+    bool HasMember(const std::wstring &url) { return FindMember(url) != nullptr; }
+    // Who ends the process when "shutdown" is asked (only a network node).
+    void SetShutdownHandler(std::function<void()> handler);
+
     void AddBrowserReceiver(ICadroBrowserReceiver *receiver);
     void RemoveBrowserReceiver(ICadroBrowserReceiver *receiver);
 
@@ -187,6 +191,8 @@ private:
     std::mt19937 m_random;
     std::atomic<long> m_subscriptionCount{0};
     std::atomic<unsigned long> m_browseCount{0};
+    SlimMutex m_shutdownLock;
+    std::function<void()> m_shutdown;
 };
 
 // Runs commands from other programs: one named pipe per engine,

@@ -2,22 +2,59 @@
 // which the five vendor-named DLLs forward to.
 #include "CadroSim.h"
 #include "Engine.h"
+#include "NodeLink.h"
+#include "NodeServer.h"
 #include "TextObject.h"
+
+#include <atomic>
 
 namespace cadrosim {
 namespace {
+
+// Where this process's network is: its own engine (the network node itself,
+// and tests that want a network of their own), or the node that the
+// libraries reach over its pipe, which is what a server process uses.
+std::atomic<bool> g_embedded{false};
+
+bool Embedded()
+{
+    return g_embedded;
+}
+
+void AddUse()
+{
+    if (Embedded())
+        Engine::Instance().AddUse();
+    else
+        NodeLink::Instance().AddUse();
+}
+
+void ReleaseUse()
+{
+    if (Embedded())
+        Engine::Instance().ReleaseUse();
+    else
+        NodeLink::Instance().ReleaseUse();
+}
+
+std::wstring LocalHostName()
+{
+    wchar_t name[MAX_COMPUTERNAME_LENGTH + 1];
+    DWORD size = MAX_COMPUTERNAME_LENGTH + 1;
+    return GetComputerNameW(name, &size) ? std::wstring(name, size) : std::wstring(L"LOCALHOST");
+}
 
 class CRealTime : public CSimUnknown<CadroRealTime> {
 public:
     explicit CRealTime(ICadroRealTimeReceiver *receiver) : m_receiver(receiver)
     {
         m_receiver->AddRef();
-        Engine::Instance().AddUse();
+        AddUse();
     }
     ~CRealTime() override
     {
         m_receiver->Release();
-        Engine::Instance().ReleaseUse();
+        ReleaseUse();
     }
 
     HRESULT STDMETHODCALLTYPE Subscribe(const wchar_t *url, void *cookie, const SubscribeOptions *options,
@@ -25,7 +62,9 @@ public:
     {
         if (!options)
             return E_POINTER;
-        return Engine::Instance().Subscribe(url, cookie, m_receiver, out);
+        if (Embedded())
+            return Engine::Instance().Subscribe(url, cookie, m_receiver, out);
+        return NodeLink::Instance().Subscribe(url, cookie, m_receiver, out);
     }
 
 private:
@@ -36,13 +75,19 @@ class CBrowser : public CSimUnknown<CadroBrowser> {
 public:
     explicit CBrowser(ICadroBrowserReceiver *receiver) : m_receiver(receiver)
     {
-        Engine::Instance().AddUse();
-        Engine::Instance().AddBrowserReceiver(m_receiver);
+        AddUse();
+        if (Embedded())
+            Engine::Instance().AddBrowserReceiver(m_receiver);
+        else
+            NodeLink::Instance().AddBrowserReceiver(m_receiver);
     }
     ~CBrowser() override
     {
-        Engine::Instance().RemoveBrowserReceiver(m_receiver);
-        Engine::Instance().ReleaseUse();
+        if (Embedded())
+            Engine::Instance().RemoveBrowserReceiver(m_receiver);
+        else
+            NodeLink::Instance().RemoveBrowserReceiver(m_receiver);
+        ReleaseUse();
     }
 
     HRESULT STDMETHODCALLTYPE Open(const wchar_t *url) override
@@ -51,7 +96,9 @@ public:
         m_next = 0;
         if (!url)
             return E_POINTER;
-        return Engine::Instance().Browse(url, m_entries) ? S_OK : HRESULT_FROM_WIN32(ERROR_NOT_FOUND);
+        bool found =
+            Embedded() ? Engine::Instance().Browse(url, m_entries) : NodeLink::Instance().Browse(url, m_entries);
+        return found ? S_OK : HRESULT_FROM_WIN32(ERROR_NOT_FOUND);
     }
 
     HRESULT STDMETHODCALLTYPE Next(uint32_t fieldMask, BrowseRecord *record) override
@@ -105,7 +152,8 @@ HRESULT CadroSim_HostName(BSTR *out)
 {
     if (!out)
         return E_POINTER;
-    *out = SysAllocString(Engine::Instance().HostName().c_str());
+    // The node runs on this machine: its host name is this one's.
+    *out = SysAllocString(Embedded() ? Engine::Instance().HostName().c_str() : LocalHostName().c_str());
     return *out ? S_OK : E_OUTOFMEMORY;
 }
 
@@ -118,7 +166,15 @@ HRESULT CadroSim_Execute(const wchar_t *command, BSTR *answer)
 {
     if (!command || !answer)
         return E_POINTER;
-    std::wstring text = Engine::Instance().Execute(command);
+    std::wstring text;
+    if (Embedded()) {
+        text = Engine::Instance().Execute(command);
+    } else {
+        // A use of its own keeps the link up for the request.
+        AddUse();
+        text = NodeLink::Instance().Execute(command);
+        ReleaseUse();
+    }
     *answer = SysAllocStringLen(text.data(), static_cast<UINT>(text.size()));
     return text.compare(0, 2, L"ok") == 0 ? S_OK : S_FALSE;
 }
@@ -128,9 +184,57 @@ HRESULT CadroSim_Load(const wchar_t *description, BSTR *error)
     if (!description)
         return E_POINTER;
     std::wstring why;
-    if (Engine::Instance().Load(description, why))
+    bool loaded;
+    if (Embedded()) {
+        loaded = Engine::Instance().Load(description, why);
+    } else {
+        AddUse();
+        loaded = NodeLink::Instance().Load(description, why);
+        ReleaseUse();
+    }
+    if (loaded)
         return S_OK;
     if (error)
         *error = SysAllocString(why.c_str());
     return E_INVALIDARG;
+}
+
+void CadroSim_UseEmbeddedNetwork()
+{
+    g_embedded = true;
+}
+
+int CadroSim_RunNode(unsigned long idleSeconds)
+{
+    g_embedded = true;
+    NodeServer *node = NodeServer::Create(Engine::Instance(), idleSeconds * 1000);
+    if (!node)
+        return 1;
+    int code = node->Run();
+    node->Release();
+    return code;
+}
+
+HRESULT CadroSim_StopNode()
+{
+    // The node's pid is not known here: its control pipe is found by name
+    // through the node pipe's server process.
+    HANDLE pipe =
+        CreateFileW(wire::NodePipeName(), GENERIC_READ | GENERIC_WRITE, 0, nullptr, OPEN_EXISTING, 0, nullptr);
+    if (pipe == INVALID_HANDLE_VALUE)
+        return S_FALSE;
+    ULONG pid = 0;
+    GetNamedPipeServerProcessId(pipe, &pid);
+    CloseHandle(pipe);
+    HANDLE process = pid ? OpenProcess(SYNCHRONIZE, FALSE, pid) : nullptr;
+    wchar_t answer[256];
+    DWORD got = 0;
+    std::wstring control = ControlPipeName(pid);
+    wchar_t command[] = L"shutdown";
+    BOOL sent =
+        CallNamedPipeW(control.c_str(), command, sizeof command - sizeof(wchar_t), answer, sizeof answer, &got, 5000);
+    DWORD waited = process ? WaitForSingleObject(process, 15000) : WAIT_FAILED;
+    if (process)
+        CloseHandle(process);
+    return sent && waited == WAIT_OBJECT_0 ? S_OK : E_FAIL;
 }

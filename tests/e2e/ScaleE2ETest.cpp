@@ -1,5 +1,6 @@
 // Plant-size AddItems across the process boundary: 20,000 distinct items of
 // one network file, every result with its member's own type and rights.
+#include "CadroSim.h"
 #include "ComPtr.h"
 #include "Handle.h"
 #include "ItemDefinitions.h"
@@ -21,11 +22,13 @@ const VARTYPE kCanonical[] = {VT_R8, VT_BOOL, VT_BSTR};
 const char *const kAccess[] = {"rw", "r", "w"};
 const DWORD kRights[] = {3, 1, 2};
 
-// Points the simulated network at a file of its own while it lives.
+// Points the simulated network at a file of its own while it lives: the
+// network node is started anew on it, and stopped after.
 class NetworkFile {
 public:
     explicit NetworkFile(const std::string &text) : m_path(BinPath(L"scale_e2e_network.txt"))
     {
+        CadroSim_StopNode();
         UniqueHandle file(CreateFileW(m_path.c_str(), GENERIC_WRITE, 0, nullptr, CREATE_ALWAYS, 0, nullptr));
         DWORD written = 0;
         m_ok = file && WriteFile(file.Get(), text.data(), static_cast<DWORD>(text.size()), &written, nullptr);
@@ -34,6 +37,7 @@ public:
     }
     ~NetworkFile()
     {
+        CadroSim_StopNode();
         RegDeleteKeyValueW(HKEY_LOCAL_MACHINE, kSimulatorKey, kNetworkFile);
         DeleteFileW(m_path.c_str());
     }

@@ -1,6 +1,9 @@
 #include "ServerProcess.h"
 
+#include "CadroSim.h"
 #include "Handle.h"
+
+#include <gtest/gtest.h>
 
 #include <tlhelp32.h>
 
@@ -28,7 +31,7 @@ int CountProcesses(const wchar_t *image)
     return count;
 }
 
-DWORD ServerProcessId()
+DWORD ProcessIdOf(const wchar_t *image)
 {
     UniqueHandle snapshot(CreateToolhelp32Snapshot(TH32CS_SNAPPROCESS, 0));
     if (!snapshot)
@@ -36,16 +39,46 @@ DWORD ServerProcessId()
     PROCESSENTRY32W entry = {};
     entry.dwSize = sizeof entry;
     for (BOOL more = Process32FirstW(snapshot.Get(), &entry); more; more = Process32NextW(snapshot.Get(), &entry))
-        if (_wcsicmp(entry.szExeFile, L"Local.exe") == 0)
+        if (_wcsicmp(entry.szExeFile, image) == 0)
             return entry.th32ProcessID;
     return 0;
 }
 
+DWORD ServerProcessId()
+{
+    return ProcessIdOf(L"Local.exe");
+}
+
+DWORD NodeProcessId()
+{
+    return ProcessIdOf(L"cadronode.exe");
+}
+
+namespace {
+// Every test meets the network as its description says, as if the node had
+// just started (it outlives the servers of earlier tests); the suite leaves
+// no node behind.
+class NodeReset : public testing::EmptyTestEventListener {
+    void OnTestStart(const testing::TestInfo &) override
+    {
+        if (DWORD pid = NodeProcessId()) {
+            std::string output;
+            RunAndCapture(L"\"" + BinPath(L"cadroctl.exe") + L"\" --pid " + std::to_wstring(pid) + L" reset", output);
+        }
+    }
+    void OnTestProgramEnd(const testing::UnitTest &) override { CadroSim_StopNode(); }
+};
+
+const bool g_nodeReset = [] {
+    testing::UnitTest::GetInstance()->listeners().Append(new NodeReset);
+    return true;
+}();
+} // namespace
+
 long RunCadroctl(const std::wstring &arguments, std::string &output)
 {
-    return RunAndCapture(L"\"" + BinPath(L"cadroctl.exe") + L"\" --pid " + std::to_wstring(ServerProcessId()) + L" " +
-                             arguments,
-                         output);
+    return RunAndCapture(
+        L"\"" + BinPath(L"cadroctl.exe") + L"\" --pid " + std::to_wstring(NodeProcessId()) + L" " + arguments, output);
 }
 
 bool WaitForNoServerProcess(DWORD timeoutMs)

@@ -12,10 +12,11 @@ extern const CLSID CLSID_SkylarcOPCServerE2E;
 // Number of running processes whose image is Local.exe, or image.
 int CountServerProcesses();
 int CountProcesses(const wchar_t *image);
-// The id of a running Local.exe, 0 when none.
+// The id of a running Local.exe, or of the network node, 0 when none.
 DWORD ServerProcessId();
-// Runs cadroctl against the running server's network only (other programs
-// of the prefix serve networks of their own).
+DWORD NodeProcessId();
+// Runs cadroctl against the network node only (test programs serve
+// networks of their own too).
 long RunCadroctl(const std::wstring &arguments, std::string &output);
 // Waits up to timeoutMs for no server process to be left.
 bool WaitForNoServerProcess(DWORD timeoutMs);

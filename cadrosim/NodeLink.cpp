@@ -1,0 +1,699 @@
+#include "NodeLink.h"
+
+#include "SimValue.h"
+
+#include <cstring>
+#include <new>
+#include <utility>
+
+namespace cadrosim {
+
+namespace {
+const HRESULT kUnknownUrl = HRESULT_FROM_WIN32(ERROR_NOT_FOUND);
+const HRESULT kNotConnected = HRESULT_FROM_WIN32(ERROR_NOT_CONNECTED);
+constexpr uint32_t kSlotBits = 22;
+constexpr uint32_t kSlotMask = (1u << kSlotBits) - 1;
+// How long a request waits for a node that is being started, and for an
+// answer: generous, since a node may be busy with a large listing.
+constexpr DWORD kStartWaitMs = 15000;
+constexpr DWORD kReplyWaitMs = 60000;
+constexpr DWORD kReconnectPauseMs = 500;
+constexpr size_t kMostKnownUrls = 4u << 20;
+
+uint64_t UrlHash(std::wstring_view url)
+{
+    uint64_t h = 1469598103934665603ull;
+    for (wchar_t c : url) {
+        h ^= static_cast<uint16_t>(c);
+        h *= 1099511628211ull;
+    }
+    return h;
+}
+
+std::wstring NodeProgramPath()
+{
+    HMODULE self = nullptr;
+    GetModuleHandleExW(GET_MODULE_HANDLE_EX_FLAG_FROM_ADDRESS | GET_MODULE_HANDLE_EX_FLAG_UNCHANGED_REFCOUNT,
+                       reinterpret_cast<LPCWSTR>(&UrlHash), &self);
+    wchar_t path[MAX_PATH * 2];
+    DWORD n = GetModuleFileNameW(self, path, MAX_PATH * 2);
+    std::wstring text(path, n < MAX_PATH * 2 ? n : 0);
+    size_t slash = text.find_last_of(L"\\/");
+    return (slash == std::wstring::npos ? std::wstring() : text.substr(0, slash + 1)) + L"cadronode.exe";
+}
+
+void StartNode()
+{
+    std::wstring command = L"\"" + NodeProgramPath() + L"\"";
+    STARTUPINFOW startup = {};
+    startup.cb = sizeof startup;
+    PROCESS_INFORMATION process = {};
+    if (CreateProcessW(nullptr, command.data(), nullptr, nullptr, FALSE, DETACHED_PROCESS | CREATE_NO_WINDOW, nullptr,
+                       nullptr, &startup, &process)) {
+        CloseHandle(process.hThread);
+        CloseHandle(process.hProcess);
+    }
+}
+} // namespace
+
+// ---- RemoteSubscription ------------------------------------------------------
+
+RemoteSubscription *RemoteSubscription::Create(NodeLink &link, const wchar_t *url, ICadroRealTimeReceiver *receiver,
+                                               void *cookie)
+{
+    size_t length = wcslen(url);
+    if (length > UINT32_MAX / 4)
+        return nullptr;
+    void *block = operator new(sizeof(RemoteSubscription), length);
+    return block ? ::new (block) RemoteSubscription(link, receiver, cookie, url, length) : nullptr;
+}
+
+void *RemoteSubscription::operator new(size_t size, size_t chars)
+{
+    return ::operator new(size + chars * sizeof(wchar_t), std::nothrow);
+}
+
+void RemoteSubscription::operator delete(void *p)
+{
+    ::operator delete(p);
+}
+
+RemoteSubscription::RemoteSubscription(NodeLink &l, ICadroRealTimeReceiver *r, void *c, const wchar_t *url,
+                                       size_t length)
+    : link(l), receiver(r), cookie(c), m_urlLength(static_cast<uint32_t>(length))
+{
+    memcpy(const_cast<wchar_t *>(Chars()), url, length * sizeof(wchar_t));
+    receiver->AddRef();
+    link.AddUse();
+}
+
+RemoteSubscription::~RemoteSubscription()
+{
+    receiver->Release();
+    link.ReleaseUse();
+}
+
+void RemoteSubscription::Delete()
+{
+    delete this;
+}
+
+HRESULT STDMETHODCALLTYPE RemoteSubscription::Write(const CadroValue *value)
+{
+    return link.Write(this, value);
+}
+
+HRESULT STDMETHODCALLTYPE RemoteSubscription::Read(uint32_t *flags, CadroValue *value, int32_t *errorFlag,
+                                                   FILETIME *time)
+{
+    return link.Read(this, flags, value, errorFlag, time);
+}
+
+void RemoteSubscription::LastRelease()
+{
+    link.Unsubscribe(this);
+}
+
+// ---- NodeLink: lifetime --------------------------------------------------------
+
+NodeLink &NodeLink::Instance()
+{
+    // Never destroyed, like the engine: its threads may outlive static
+    // destruction at process exit.
+    static NodeLink *link = new NodeLink();
+    return *link;
+}
+
+void NodeLink::AddUse()
+{
+    std::unique_lock<SlimMutex> l(m_lock);
+    if (m_uses++ == 0)
+        Start();
+}
+
+void NodeLink::ReleaseUse()
+{
+    std::unique_lock<SlimMutex> l(m_lock);
+    if (--m_uses == 0)
+        Stop(l);
+}
+
+void NodeLink::Start()
+{
+    // Threads of an earlier use that stopped from inside a callback may
+    // still be finishing: they were detached, and end on their own.
+    unsigned generation = ++m_generation;
+    m_state = State::Connecting;
+    if (!m_wake)
+        m_wake = CreateEventW(nullptr, FALSE, FALSE, nullptr);
+    m_thread = std::thread([this, generation] { Run(generation); });
+    m_writer = std::thread([this, generation] { WriteLoop(generation); });
+}
+
+void NodeLink::Stop(std::unique_lock<SlimMutex> &l)
+{
+    ++m_generation;
+    if (m_channel)
+        m_channel->Close();
+    SetEvent(m_wake);
+    std::thread thread = std::move(m_thread);
+    std::thread writer = std::move(m_writer);
+    l.unlock();
+    m_changed.notify_all();
+    m_outReady.notify_all();
+    if (thread.joinable()) {
+        if (thread.get_id() == std::this_thread::get_id())
+            thread.detach(); // the last use ended inside a callback
+        else
+            thread.join();
+    }
+    if (writer.joinable())
+        writer.join();
+    l.lock();
+    if (m_uses == 0)
+        m_state = State::Stopped;
+}
+
+// ---- NodeLink: the connection ----------------------------------------------------
+
+std::unique_ptr<PipeChannel> NodeLink::Connect(bool mayStart, unsigned generation)
+{
+    bool started = false;
+    DWORD begin = GetTickCount();
+    for (;;) {
+        HANDLE pipe = CreateFileW(wire::NodePipeName(), GENERIC_READ | GENERIC_WRITE, 0, nullptr, OPEN_EXISTING,
+                                  FILE_FLAG_OVERLAPPED, nullptr);
+        if (pipe != INVALID_HANDLE_VALUE)
+            return std::make_unique<PipeChannel>(pipe);
+        DWORD error = GetLastError();
+        if (error == ERROR_PIPE_BUSY) {
+            WaitNamedPipeW(wire::NodePipeName(), 200);
+        } else {
+            if (mayStart && !started && error == ERROR_FILE_NOT_FOUND) {
+                StartNode();
+                started = true;
+            }
+            if (!started)
+                return nullptr;
+            if (WaitForSingleObject(m_wake, 20) == WAIT_OBJECT_0)
+                return nullptr;
+        }
+        {
+            std::lock_guard<SlimMutex> l(m_lock);
+            if (m_generation != generation)
+                return nullptr;
+        }
+        if (GetTickCount() - begin > kStartWaitMs)
+            return nullptr;
+    }
+}
+
+void NodeLink::Run(unsigned generation)
+{
+    m_linkThreadId = GetCurrentThreadId();
+    for (;;) {
+        bool mayStart;
+        {
+            std::lock_guard<SlimMutex> l(m_lock);
+            if (m_generation != generation)
+                return;
+            mayStart = m_mayStartNode;
+        }
+        std::shared_ptr<PipeChannel> channel = Connect(mayStart, generation);
+        {
+            std::lock_guard<SlimMutex> l(m_lock);
+            if (m_generation != generation)
+                return;
+            if (channel) {
+                m_channel = channel;
+                m_state = State::Connected;
+                m_mayStartNode = true;
+                // Every subscription again, under the same identifiers.
+                for (RemoteSubscription *sub : m_slots)
+                    if (sub)
+                        Send(wire::Kind::Subscribe, [&](wire::Out &out) {
+                            out.U32(0);
+                            out.U32(sub->id);
+                            out.Text(sub->Url());
+                        });
+            } else if (mayStart == m_mayStartNode) {
+                m_state = State::Down;
+            } else {
+                continue; // a request needs a node now: start one
+            }
+        }
+        m_changed.notify_all();
+        m_outReady.notify_all();
+        if (channel) {
+            Serve(*channel);
+            Disconnected();
+        }
+        WaitForSingleObject(m_wake, kReconnectPauseMs);
+    }
+}
+
+void NodeLink::WriteLoop(unsigned generation)
+{
+    std::string batch;
+    for (;;) {
+        std::shared_ptr<PipeChannel> channel;
+        {
+            std::unique_lock<SlimMutex> l(m_lock);
+            m_outReady.wait(l, [&] { return m_generation != generation || (!m_out.Empty() && m_channel); });
+            if (m_generation != generation)
+                return;
+            batch.swap(m_out.Bytes());
+            channel = m_channel;
+        }
+        if (!channel->Write(batch))
+            channel->Close(); // the reader sees it and reconnects
+        batch.clear();
+    }
+}
+
+void NodeLink::Serve(PipeChannel &channel)
+{
+    std::string buffer;
+    size_t consumed = 0;
+    bool fine = true;
+    while (fine && channel.Read(buffer))
+        fine = wire::TakeFrames(buffer, consumed, [&](wire::Kind kind, wire::In in) { Dispatch(kind, in); });
+    channel.Close();
+}
+
+void NodeLink::Disconnected()
+{
+    std::vector<uint32_t> ids;
+    {
+        std::lock_guard<SlimMutex> l(m_lock);
+        m_channel.reset();
+        if (m_state == State::Connected)
+            m_state = State::Down;
+        m_out.Bytes().clear();
+        m_knownUrls.clear();
+        for (auto &entry : m_pending)
+            entry.second->done = true; // unanswered
+        m_pending.clear();
+        for (RemoteSubscription *sub : m_slots)
+            if (sub)
+                ids.push_back(sub->id);
+    }
+    m_changed.notify_all();
+    for (uint32_t id : ids)
+        CallSubscription(id, [](RemoteSubscription &sub) {
+            sub.receiver->StatusChange(sub.cookie, kCadroStatusDisconnected, 0, 0);
+        });
+}
+
+bool NodeLink::WaitConnected(std::unique_lock<SlimMutex> &l)
+{
+    // A node shut down on purpose is not started again by the link alone,
+    // but a request that needs the network starts one.
+    if (m_state == State::Down && !m_mayStartNode) {
+        m_mayStartNode = true;
+        m_state = State::Connecting;
+        SetEvent(m_wake);
+    }
+    auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(kStartWaitMs);
+    while (m_state == State::Connecting && !OnLinkThread() && std::chrono::steady_clock::now() < deadline)
+        m_changed.wait_until(l, deadline);
+    return m_state == State::Connected;
+}
+
+// ---- NodeLink: frames from the node -----------------------------------------------
+
+template <class Call> void NodeLink::CallSubscription(uint32_t id, Call call)
+{
+    RemoteSubscription *sub;
+    {
+        std::lock_guard<SlimMutex> l(m_lock);
+        sub = Lookup(id);
+        if (!sub)
+            return;
+        m_inCallback = sub;
+    }
+    call(*sub);
+    RemoteSubscription *dead;
+    {
+        std::lock_guard<SlimMutex> l(m_lock);
+        m_inCallback = nullptr;
+        dead = std::exchange(m_deleteAfterCallback, nullptr);
+    }
+    m_changed.notify_all();
+    if (dead)
+        dead->Delete();
+}
+
+void NodeLink::Dispatch(wire::Kind kind, wire::In &in)
+{
+    switch (kind) {
+    case wire::Kind::Data: {
+        uint32_t id = in.U32();
+        uint32_t flags = in.U32();
+        CadroValue value;
+        in.Value(value);
+        int32_t error = static_cast<int32_t>(in.U32());
+        uint32_t low = in.U32();
+        uint32_t high = in.U32();
+        if (in.Ok())
+            CallSubscription(id, [&](RemoteSubscription &sub) {
+                sub.receiver->OnData(sub.cookie, flags, &value, error, low, high);
+            });
+        ClearCadroValue(value);
+        return;
+    }
+    case wire::Kind::Attributes: {
+        uint32_t id = in.U32();
+        CadroAttributes a = {};
+        a.mask = in.U32();
+        a.dataType = in.U16();
+        a.access = in.U32();
+        if (in.Ok())
+            CallSubscription(id, [&](RemoteSubscription &sub) { sub.receiver->OnAttributes(sub.cookie, &a); });
+        return;
+    }
+    case wire::Kind::Status: {
+        uint32_t id = in.U32();
+        uint32_t status = in.U32();
+        if (in.Ok())
+            CallSubscription(id,
+                             [&](RemoteSubscription &sub) { sub.receiver->StatusChange(sub.cookie, status, 0, 0); });
+        return;
+    }
+    case wire::Kind::Reply: {
+        uint32_t request = in.U32();
+        {
+            std::lock_guard<SlimMutex> l(m_lock);
+            auto it = m_pending.find(request);
+            if (it == m_pending.end())
+                return;
+            it->second->reply = in.Rest();
+            it->second->answered = true;
+            it->second->done = true;
+            m_pending.erase(it);
+        }
+        m_changed.notify_all();
+        return;
+    }
+    case wire::Kind::Topology:
+        TopologyChanged();
+        return;
+    case wire::Kind::Closing: {
+        std::lock_guard<SlimMutex> l(m_lock);
+        m_mayStartNode = false; // shut down on purpose: wait for a new one
+        return;
+    }
+    default:
+        return;
+    }
+}
+
+void NodeLink::TopologyChanged()
+{
+    std::vector<ICadroBrowserReceiver *> receivers;
+    {
+        std::lock_guard<SlimMutex> l(m_lock);
+        m_knownUrls.clear();
+        receivers = m_browserReceivers;
+        for (auto *r : receivers)
+            r->AddRef();
+    }
+    for (auto *r : receivers) {
+        r->BrowseItemChanged();
+        r->Release();
+    }
+}
+
+// ---- NodeLink: requests -------------------------------------------------------------
+
+uint32_t NodeLink::Register(RemoteSubscription *sub)
+{
+    uint32_t slot;
+    if (!m_freeSlots.empty()) {
+        slot = m_freeSlots.back();
+        m_freeSlots.pop_back();
+    } else {
+        if (m_slots.size() >= kSlotMask)
+            return 0;
+        slot = static_cast<uint32_t>(m_slots.size());
+        m_slots.push_back(nullptr);
+        m_generations.push_back(0);
+    }
+    m_slots[slot] = sub;
+    // The generation tells a new subscription from an older one of the
+    // same slot whose values may still be on their way.
+    sub->id = (static_cast<uint32_t>(m_generations[slot] & 0x3ff) << kSlotBits) | (slot + 1);
+    return sub->id;
+}
+
+void NodeLink::Unregister(RemoteSubscription *sub)
+{
+    uint32_t slot = (sub->id & kSlotMask) - 1;
+    m_slots[slot] = nullptr;
+    ++m_generations[slot];
+    m_freeSlots.push_back(slot);
+}
+
+RemoteSubscription *NodeLink::Lookup(uint32_t id) const
+{
+    uint32_t slot = (id & kSlotMask) - 1;
+    if (slot >= m_slots.size() || !m_slots[slot] || m_slots[slot]->id != id)
+        return nullptr;
+    return m_slots[slot];
+}
+
+template <class Fill> bool NodeLink::Send(wire::Kind kind, Fill fill)
+{
+    if (m_state != State::Connected)
+        return false;
+    bool wake = m_out.Empty();
+    m_out.Begin(kind);
+    fill(m_out);
+    m_out.End();
+    if (wake)
+        m_outReady.notify_one();
+    return true;
+}
+
+template <class Fill> bool NodeLink::Ask(wire::Kind kind, Fill fill, std::string &reply)
+{
+    std::unique_lock<SlimMutex> l(m_lock);
+    // The link's own thread reads the answers: it cannot wait for one.
+    if (OnLinkThread() || !WaitConnected(l))
+        return false;
+    Pending pending;
+    uint32_t request = ++m_nextRequest ? m_nextRequest : ++m_nextRequest;
+    Send(kind, [&](wire::Out &out) {
+        out.U32(request);
+        fill(out);
+    });
+    m_pending[request] = &pending;
+    auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(kReplyWaitMs);
+    while (!pending.done && std::chrono::steady_clock::now() < deadline)
+        m_changed.wait_until(l, deadline);
+    m_pending.erase(request);
+    if (!pending.answered)
+        return false;
+    reply.swap(pending.reply);
+    return true;
+}
+
+HRESULT NodeLink::Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeReceiver *receiver, CadroDataItem **out)
+{
+    if (!out || !receiver || !url)
+        return E_POINTER;
+    *out = nullptr;
+    RemoteSubscription *sub = RemoteSubscription::Create(*this, url, receiver, cookie);
+    if (!sub)
+        return E_OUTOFMEMORY;
+    std::unique_lock<SlimMutex> l(m_lock);
+    bool connected = WaitConnected(l);
+    if (!Register(sub)) {
+        l.unlock();
+        sub->Delete();
+        return E_OUTOFMEMORY;
+    }
+    if (!connected) {
+        // The node is away: the subscription waits for it, as one on a
+        // disconnected machine does.
+        uint32_t id = sub->id;
+        l.unlock();
+        *out = sub;
+        CallSubscription(
+            id, [](RemoteSubscription &s) { s.receiver->StatusChange(s.cookie, kCadroStatusConnecting, 0, 0); });
+        return S_OK;
+    }
+    bool known = m_knownUrls.count(UrlHash(sub->Url())) != 0;
+    if (known || OnLinkThread()) {
+        Send(wire::Kind::Subscribe, [&](wire::Out &o) {
+            o.U32(0);
+            o.U32(sub->id);
+            o.Text(sub->Url());
+        });
+        *out = sub;
+        return S_OK;
+    }
+    l.unlock();
+    // Not confirmed by a listing: the node's answer decides.
+    std::string reply;
+    bool answered = Ask(
+        wire::Kind::Subscribe,
+        [&](wire::Out &o) {
+            o.U32(sub->id);
+            o.Text(sub->Url());
+        },
+        reply);
+    wire::In in(reply.data(), reply.size());
+    HRESULT hr = answered ? static_cast<HRESULT>(in.U32()) : S_OK;
+    if (SUCCEEDED(hr) || !in.Ok()) {
+        *out = sub; // unanswered: subscribed again when the link is back
+        return S_OK;
+    }
+    l.lock();
+    Forget(sub, l);
+    l.unlock();
+    sub->Delete();
+    return hr;
+}
+
+void NodeLink::Forget(RemoteSubscription *sub, std::unique_lock<SlimMutex> &l)
+{
+    Unregister(sub);
+    if (m_inCallback == sub && !OnLinkThread())
+        m_changed.wait(l, [&] { return m_inCallback != sub; });
+}
+
+void NodeLink::Unsubscribe(RemoteSubscription *sub)
+{
+    std::unique_lock<SlimMutex> l(m_lock);
+    uint32_t id = sub->id;
+    Send(wire::Kind::Unsubscribe, [&](wire::Out &out) { out.U32(id); });
+    Forget(sub, l);
+    if (m_inCallback == sub) {
+        m_deleteAfterCallback = sub; // released by its own callback
+        return;
+    }
+    l.unlock();
+    sub->Delete();
+}
+
+HRESULT NodeLink::Write(RemoteSubscription *sub, const CadroValue *value)
+{
+    if (!value)
+        return E_POINTER;
+    std::lock_guard<SlimMutex> l(m_lock);
+    bool sent = Send(wire::Kind::Write, [&](wire::Out &out) {
+        out.U32(sub->id);
+        out.Value(*value);
+    });
+    return sent ? S_OK : kNotConnected;
+}
+
+HRESULT NodeLink::Read(RemoteSubscription *sub, uint32_t *flags, CadroValue *value, int32_t *errorFlag, FILETIME *time)
+{
+    if (!flags || !value || !errorFlag || !time)
+        return E_POINTER;
+    *flags = 0;
+    *errorFlag = 0;
+    *time = {};
+    value->type = kCadroCleared;
+    value->number = 0;
+    std::string reply;
+    if (!Ask(
+            wire::Kind::Read, [&](wire::Out &out) { out.U32(sub->id); }, reply))
+        return kNotConnected;
+    wire::In in(reply.data(), reply.size());
+    HRESULT hr = static_cast<HRESULT>(in.U32());
+    uint32_t gotFlags = in.U32();
+    CadroValue got;
+    in.Value(got);
+    int32_t error = static_cast<int32_t>(in.U32());
+    FILETIME at = {in.U32(), in.U32()};
+    if (!in.Ok()) {
+        ClearCadroValue(got);
+        return kNotConnected;
+    }
+    *flags = gotFlags;
+    *value = got;
+    *errorFlag = error;
+    *time = at;
+    return hr;
+}
+
+bool NodeLink::Browse(const std::wstring &url, std::vector<BrowseEntry> &out)
+{
+    out.clear();
+    std::string reply;
+    if (!Ask(
+            wire::Kind::List, [&](wire::Out &o) { o.Text(url); }, reply))
+        return false;
+    wire::In in(reply.data(), reply.size());
+    bool found = in.U8() != 0;
+    uint32_t count = in.U32();
+    std::vector<uint64_t> known;
+    for (uint32_t i = 0; i < count && in.Ok(); ++i) {
+        BrowseEntry e;
+        e.name = in.Text();
+        e.kind = static_cast<wchar_t>(in.U16());
+        e.leaf = in.U8() != 0;
+        e.dataType = in.U16();
+        e.access = in.U16();
+        if (in.U8())
+            known.push_back(UrlHash(wire::MemberUrl(url, e.name)));
+        out.push_back(std::move(e));
+    }
+    if (!in.Ok()) {
+        out.clear();
+        return false;
+    }
+    std::lock_guard<SlimMutex> l(m_lock);
+    if (m_knownUrls.size() + known.size() > kMostKnownUrls)
+        m_knownUrls.clear();
+    m_knownUrls.insert(known.begin(), known.end());
+    return found;
+}
+
+std::wstring NodeLink::Execute(const std::wstring &command)
+{
+    std::string reply;
+    if (!Ask(
+            wire::Kind::Execute, [&](wire::Out &o) { o.Text(command); }, reply))
+        return L"error: the network node does not answer\n";
+    wire::In in(reply.data(), reply.size());
+    std::wstring answer = in.Text();
+    return in.Ok() ? answer : L"error: the network node's answer is garbled\n";
+}
+
+bool NodeLink::Load(const std::wstring &description, std::wstring &error)
+{
+    std::string reply;
+    if (!Ask(
+            wire::Kind::Load, [&](wire::Out &o) { o.Text(description); }, reply)) {
+        error = L"the network node does not answer";
+        return false;
+    }
+    wire::In in(reply.data(), reply.size());
+    bool loaded = in.U8() != 0;
+    error = in.Text();
+    return in.Ok() && loaded;
+}
+
+void NodeLink::AddBrowserReceiver(ICadroBrowserReceiver *receiver)
+{
+    std::lock_guard<SlimMutex> l(m_lock);
+    receiver->AddRef();
+    m_browserReceivers.push_back(receiver);
+}
+
+void NodeLink::RemoveBrowserReceiver(ICadroBrowserReceiver *receiver)
+{
+    std::lock_guard<SlimMutex> l(m_lock);
+    for (auto it = m_browserReceivers.begin(); it != m_browserReceivers.end(); ++it)
+        if (*it == receiver) {
+            m_browserReceivers.erase(it);
+            receiver->Release();
+            return;
+        }
+}
+
+} // namespace cadrosim

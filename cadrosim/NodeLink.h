@@ -1,0 +1,131 @@
+#pragma once
+// The libraries' side of the network node, one per server process and shared
+// by its sessions: one pipe to the node (started when none runs), the
+// subscriptions made through it and the requests in flight. When the pipe
+// breaks, every subscription is told that the node disconnected it; the link
+// connects again (starting a node unless the last one was shut down on
+// purpose) and subscribes again to all of them.
+#include "Network.h"
+#include "PipeChannel.h"
+#include "SlimSync.h"
+#include "Unknown.h"
+#include "Wire.h"
+
+#include <memory>
+#include <thread>
+#include <unordered_map>
+#include <unordered_set>
+#include <vector>
+
+namespace cadrosim {
+
+class NodeLink;
+
+// A subscription through the node; the CadroDataItem its holder keeps.
+class RemoteSubscription : public CSimUnknown<CadroDataItem> {
+public:
+    static RemoteSubscription *Create(NodeLink &link, const wchar_t *url, ICadroRealTimeReceiver *receiver,
+                                      void *cookie);
+    void Delete();
+
+    HRESULT STDMETHODCALLTYPE Write(const CadroValue *value) override;
+    HRESULT STDMETHODCALLTYPE Read(uint32_t *flags, CadroValue *value, int32_t *errorFlag, FILETIME *time) override;
+    void LastRelease() override;
+
+    std::wstring_view Url() const { return {Chars(), m_urlLength}; }
+
+    NodeLink &link;
+    ICadroRealTimeReceiver *receiver;
+    void *cookie;
+    uint32_t id = 0;
+
+private:
+    RemoteSubscription(NodeLink &l, ICadroRealTimeReceiver *r, void *c, const wchar_t *url, size_t length);
+    ~RemoteSubscription() override;
+    static void *operator new(size_t size, size_t chars);
+    static void operator delete(void *p);
+    // The URL is kept behind the object, in the same block.
+    const wchar_t *Chars() const { return reinterpret_cast<const wchar_t *>(this + 1); }
+    uint32_t m_urlLength;
+};
+
+class NodeLink {
+public:
+    static NodeLink &Instance();
+
+    // Library objects and subscriptions keep the link (and its threads) up.
+    void AddUse();
+    void ReleaseUse();
+
+    HRESULT Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeReceiver *receiver, CadroDataItem **out);
+    void Unsubscribe(RemoteSubscription *sub);
+    HRESULT Write(RemoteSubscription *sub, const CadroValue *value);
+    HRESULT Read(RemoteSubscription *sub, uint32_t *flags, CadroValue *value, int32_t *errorFlag, FILETIME *time);
+    bool Browse(const std::wstring &url, std::vector<BrowseEntry> &out);
+    std::wstring Execute(const std::wstring &command);
+    bool Load(const std::wstring &description, std::wstring &error);
+
+    void AddBrowserReceiver(ICadroBrowserReceiver *receiver);
+    void RemoveBrowserReceiver(ICadroBrowserReceiver *receiver);
+
+private:
+    enum class State { Stopped, Connecting, Connected, Down };
+    struct Pending {
+        bool done = false;
+        bool answered = false;
+        std::string reply;
+    };
+
+    NodeLink() = default;
+    void Start();
+    void Stop(std::unique_lock<SlimMutex> &l);
+    void Run(unsigned generation);
+    void WriteLoop(unsigned generation);
+    std::unique_ptr<PipeChannel> Connect(bool mayStart, unsigned generation);
+    void Serve(PipeChannel &channel);
+    void Dispatch(wire::Kind kind, wire::In &in);
+    void Disconnected();
+    // Out of the table, then waits for a callback on it in flight.
+    void Forget(RemoteSubscription *sub, std::unique_lock<SlimMutex> &l);
+    template <class Call> void CallSubscription(uint32_t id, Call call);
+    void TopologyChanged();
+    bool WaitConnected(std::unique_lock<SlimMutex> &l);
+    bool OnLinkThread() const { return GetCurrentThreadId() == m_linkThreadId; }
+
+    // Under m_lock.
+    uint32_t Register(RemoteSubscription *sub);
+    void Unregister(RemoteSubscription *sub);
+    RemoteSubscription *Lookup(uint32_t id) const;
+    template <class Fill> bool Send(wire::Kind kind, Fill fill);
+    // Sends a request and waits for its reply (its fields after the request
+    // number); false when the node did not answer.
+    template <class Fill> bool Ask(wire::Kind kind, Fill fill, std::string &reply);
+
+    SlimMutex m_lock;
+    SlimCondition m_changed; // state, replies, callbacks ending
+    SlimCondition m_outReady;
+    State m_state = State::Stopped;
+    long m_uses = 0;
+    unsigned m_generation = 0; // of the threads that should run; Stop() moves it on
+    bool m_mayStartNode = true;
+    std::shared_ptr<PipeChannel> m_channel;
+    wire::Out m_out;
+    std::vector<RemoteSubscription *> m_slots;
+    std::vector<uint16_t> m_generations;
+    std::vector<uint32_t> m_freeSlots;
+    uint32_t m_nextRequest = 0;
+    std::unordered_map<uint32_t, Pending *> m_pending;
+    // Member URLs that the node's listings confirmed, hashed: subscribing to
+    // one does not wait for the node's answer. Forgotten when the topology
+    // changes or the link breaks.
+    std::unordered_set<uint64_t> m_knownUrls;
+    RemoteSubscription *m_inCallback = nullptr;
+    RemoteSubscription *m_deleteAfterCallback = nullptr;
+    std::vector<ICadroBrowserReceiver *> m_browserReceivers;
+    HANDLE m_wake = nullptr; // cuts the pause between reconnections short
+    DWORD m_linkThreadId = 0;
+    std::thread m_thread;
+    std::thread m_writer;
+};
+
+} // namespace cadrosim

@@ -1,0 +1,147 @@
+#include "NodeServer.h"
+
+#include "Wire.h"
+
+#include <new>
+
+namespace cadrosim {
+
+namespace {
+constexpr DWORD kPipeBuffer = 1 << 20;
+constexpr DWORD kIdleCheckMs = 500;
+} // namespace
+
+NodeServer *NodeServer::Create(Engine &engine, DWORD idleMs)
+{
+    return new (std::nothrow) NodeServer(engine, idleMs);
+}
+
+NodeServer::NodeServer(Engine &engine, DWORD idleMs)
+    : m_engine(engine), m_idleMs(idleMs), m_stop(CreateEventW(nullptr, TRUE, FALSE, nullptr)),
+      m_sessionEnded(CreateEventW(nullptr, FALSE, FALSE, nullptr))
+{
+}
+
+NodeServer::~NodeServer()
+{
+    CloseHandle(m_stop);
+    CloseHandle(m_sessionEnded);
+}
+
+HANDLE NodeServer::NewInstance(bool first)
+{
+    return CreateNamedPipeW(wire::NodePipeName(),
+                            PIPE_ACCESS_DUPLEX | FILE_FLAG_OVERLAPPED | (first ? FILE_FLAG_FIRST_PIPE_INSTANCE : 0),
+                            PIPE_TYPE_BYTE | PIPE_READMODE_BYTE | PIPE_WAIT, PIPE_UNLIMITED_INSTANCES, kPipeBuffer,
+                            kPipeBuffer, 0, nullptr);
+}
+
+int NodeServer::Run()
+{
+    HANDLE pipe = NewInstance(true);
+    if (pipe == INVALID_HANDLE_VALUE)
+        return 1;
+    m_engine.AddUse();
+    m_engine.AddBrowserReceiver(this);
+    m_engine.SetShutdownHandler([this] { Stop(); });
+    HANDLE connected = CreateEventW(nullptr, TRUE, FALSE, nullptr);
+    DWORD idleSince = GetTickCount();
+    bool listening = false;
+    OVERLAPPED ov = {};
+    for (;;) {
+        if (!listening && pipe != INVALID_HANDLE_VALUE) {
+            ov = {};
+            ov.hEvent = connected;
+            ResetEvent(connected);
+            listening = !ConnectNamedPipe(pipe, &ov) && GetLastError() == ERROR_IO_PENDING;
+            if (!listening && GetLastError() == ERROR_PIPE_CONNECTED) {
+                listening = true;
+                SetEvent(connected);
+            }
+        }
+        HANDLE events[] = {m_stop, connected, m_sessionEnded};
+        DWORD woke = WaitForMultipleObjects(3, events, FALSE, kIdleCheckMs);
+        if (woke == WAIT_OBJECT_0)
+            break;
+        if (woke == WAIT_OBJECT_0 + 1) {
+            DWORD unused = 0;
+            listening = false;
+            if (GetOverlappedResult(pipe, &ov, &unused, FALSE)) {
+                std::lock_guard<SlimMutex> l(m_sessionsLock);
+                if (NodeSession *session = NodeSession::Start(m_engine, pipe, m_sessionEnded))
+                    m_sessions.push_back(session);
+                else
+                    CloseHandle(pipe);
+            } else {
+                CloseHandle(pipe);
+            }
+            pipe = NewInstance(false);
+        }
+        Reap(false);
+        bool idle;
+        {
+            std::lock_guard<SlimMutex> l(m_sessionsLock);
+            idle = m_sessions.empty();
+        }
+        if (!idle)
+            idleSince = GetTickCount();
+        else if (GetTickCount() - idleSince >= m_idleMs)
+            break;
+    }
+    m_engine.SetShutdownHandler(nullptr);
+    if (listening) {
+        CancelIoEx(pipe, &ov);
+        DWORD unused = 0;
+        GetOverlappedResult(pipe, &ov, &unused, TRUE);
+    }
+    if (pipe != INVALID_HANDLE_VALUE)
+        CloseHandle(pipe);
+    CloseHandle(connected);
+    Reap(true);
+    m_engine.RemoveBrowserReceiver(this);
+    m_engine.ReleaseUse();
+    return 0;
+}
+
+void NodeServer::Reap(bool all)
+{
+    std::vector<NodeSession *> done;
+    {
+        std::lock_guard<SlimMutex> l(m_sessionsLock);
+        for (auto it = m_sessions.begin(); it != m_sessions.end();) {
+            if (all)
+                (*it)->Finish();
+            if (all || (*it)->Ended()) {
+                done.push_back(*it);
+                it = m_sessions.erase(it);
+            } else {
+                ++it;
+            }
+        }
+    }
+    // A library that does not take the closing word within a few seconds
+    // is not waited for.
+    for (DWORD waited = 0; all && waited < 3000; waited += 20) {
+        bool ended = true;
+        for (NodeSession *session : done)
+            ended = ended && session->Ended();
+        if (ended)
+            break;
+        Sleep(20);
+    }
+    for (NodeSession *session : done) {
+        session->Close();
+        session->Join();
+        session->Release(); // the engine's subscriptions may hold it a little longer
+    }
+}
+
+HRESULT STDMETHODCALLTYPE NodeServer::BrowseItemChanged()
+{
+    std::lock_guard<SlimMutex> l(m_sessionsLock);
+    for (NodeSession *session : m_sessions)
+        session->TopologyChanged();
+    return S_OK;
+}
+
+} // namespace cadrosim

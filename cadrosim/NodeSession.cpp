@@ -1,0 +1,330 @@
+#include "NodeSession.h"
+
+#include "SimValue.h"
+
+#include <new>
+#include <vector>
+
+namespace cadrosim {
+
+namespace {
+// A library that reads nothing for this long is hung: its connection is
+// dropped rather than the node's memory filled (it reconnects and
+// subscribes again when it recovers).
+constexpr size_t kLargestBacklog = 256u << 20;
+
+uint32_t IdOf(void *cookie)
+{
+    return static_cast<uint32_t>(reinterpret_cast<uintptr_t>(cookie));
+}
+} // namespace
+
+NodeSession *NodeSession::Start(Engine &engine, HANDLE pipe, HANDLE ended)
+{
+    return new (std::nothrow) NodeSession(engine, pipe, ended);
+}
+
+NodeSession::NodeSession(Engine &engine, HANDLE pipe, HANDLE ended)
+    : m_engine(engine), m_channel(pipe), m_endedEvent(ended)
+{
+    m_writer = std::thread([this] { WriteLoop(); });
+    m_reader = std::thread([this] { ReadLoop(); });
+}
+
+void NodeSession::Join()
+{
+    if (m_reader.joinable())
+        m_reader.join();
+    if (m_writer.joinable())
+        m_writer.join();
+}
+
+template <class Fill> void NodeSession::Send(wire::Kind kind, Fill fill)
+{
+    std::lock_guard<SlimMutex> l(m_outLock);
+    if (m_stopWriting)
+        return;
+    bool wake = m_out.Empty();
+    m_out.Begin(kind);
+    fill(m_out);
+    m_out.End();
+    if (m_out.Bytes().size() > kLargestBacklog) {
+        m_stopWriting = true;
+        m_channel.Close();
+    }
+    if (wake)
+        m_outReady.notify_one();
+}
+
+void NodeSession::WriteLoop()
+{
+    std::string batch;
+    for (;;) {
+        {
+            std::unique_lock<SlimMutex> l(m_outLock);
+            m_outReady.wait(l, [this] { return !m_out.Empty() || m_stopWriting; });
+            if (m_out.Empty()) {
+                m_channel.Close(); // everything said: the reader ends too
+                return;
+            }
+            batch.swap(m_out.Bytes());
+        }
+        bool written = m_channel.Write(batch);
+        batch.clear();
+        if (!written) {
+            m_channel.Close();
+            std::lock_guard<SlimMutex> l(m_outLock);
+            m_stopWriting = true;
+            m_out.Bytes().clear();
+            return;
+        }
+    }
+}
+
+void NodeSession::ReadLoop()
+{
+    std::string buffer;
+    size_t consumed = 0;
+    bool fine = true;
+    while (fine && m_channel.Read(buffer))
+        fine = wire::TakeFrames(buffer, consumed, [&](wire::Kind kind, wire::In in) {
+            if (fine)
+                fine = Handle(kind, in);
+        });
+    m_channel.Close();
+    ReleaseAll();
+    {
+        std::lock_guard<SlimMutex> l(m_outLock);
+        m_stopWriting = true;
+    }
+    m_outReady.notify_all();
+    m_ended = true;
+    SetEvent(m_endedEvent);
+}
+
+void NodeSession::ReleaseAll()
+{
+    std::unordered_map<uint32_t, CadroDataItem *> subs;
+    {
+        std::lock_guard<SlimMutex> l(m_subsLock);
+        subs.swap(m_subs);
+    }
+    for (auto &entry : subs)
+        entry.second->Release();
+}
+
+bool NodeSession::Handle(wire::Kind kind, wire::In &in)
+{
+    switch (kind) {
+    case wire::Kind::Subscribe:
+        Subscribe(in);
+        break;
+    case wire::Kind::Unsubscribe:
+        Unsubscribe(in.U32());
+        break;
+    case wire::Kind::Write: {
+        uint32_t id = in.U32();
+        CadroValue value;
+        in.Value(value);
+        if (CadroDataItem *item = in.Ok() ? Find(id) : nullptr) {
+            item->Write(&value);
+            item->Release();
+        }
+        ClearCadroValue(value);
+        break;
+    }
+    case wire::Kind::Read: {
+        uint32_t request = in.U32();
+        uint32_t id = in.U32();
+        if (in.Ok())
+            Read(request, id);
+        break;
+    }
+    case wire::Kind::List: {
+        uint32_t request = in.U32();
+        std::wstring url = in.Text();
+        if (in.Ok())
+            List(request, url);
+        break;
+    }
+    case wire::Kind::Execute: {
+        uint32_t request = in.U32();
+        std::wstring command = in.Text();
+        if (!in.Ok())
+            break;
+        std::wstring answer = m_engine.Execute(command);
+        Send(wire::Kind::Reply, [&](wire::Out &out) {
+            out.U32(request);
+            out.Text(answer);
+        });
+        break;
+    }
+    case wire::Kind::Load: {
+        uint32_t request = in.U32();
+        std::wstring description = in.Text();
+        if (!in.Ok())
+            break;
+        std::wstring error;
+        bool loaded = m_engine.Load(description, error);
+        Send(wire::Kind::Reply, [&](wire::Out &out) {
+            out.U32(request);
+            out.U8(loaded ? 1 : 0);
+            out.Text(error);
+        });
+        break;
+    }
+    default:
+        return false;
+    }
+    return in.Ok();
+}
+
+void NodeSession::Subscribe(wire::In &in)
+{
+    uint32_t request = in.U32();
+    uint32_t id = in.U32();
+    std::wstring url = in.Text();
+    if (!in.Ok())
+        return;
+    CadroDataItem *item = nullptr;
+    HRESULT hr = m_engine.Subscribe(url.c_str(), reinterpret_cast<void *>(static_cast<uintptr_t>(id)), this, &item);
+    if (SUCCEEDED(hr)) {
+        CadroDataItem *previous = nullptr;
+        {
+            std::lock_guard<SlimMutex> l(m_subsLock);
+            CadroDataItem *&slot = m_subs[id];
+            previous = slot; // an id used twice: the later subscription wins
+            slot = item;
+        }
+        if (previous)
+            previous->Release();
+    }
+    if (request)
+        Send(wire::Kind::Reply, [&](wire::Out &out) {
+            out.U32(request);
+            out.U32(static_cast<uint32_t>(hr));
+        });
+}
+
+void NodeSession::Unsubscribe(uint32_t id)
+{
+    CadroDataItem *item = nullptr;
+    {
+        std::lock_guard<SlimMutex> l(m_subsLock);
+        auto it = m_subs.find(id);
+        if (it == m_subs.end())
+            return;
+        item = it->second;
+        m_subs.erase(it);
+    }
+    item->Release();
+}
+
+CadroDataItem *NodeSession::Find(uint32_t id)
+{
+    std::lock_guard<SlimMutex> l(m_subsLock);
+    auto it = m_subs.find(id);
+    if (it == m_subs.end())
+        return nullptr;
+    it->second->AddRef();
+    return it->second;
+}
+
+void NodeSession::Read(uint32_t request, uint32_t id)
+{
+    uint32_t flags = 0;
+    CadroValue value = {};
+    int32_t error = 0;
+    FILETIME time = {};
+    HRESULT hr = E_HANDLE;
+    if (CadroDataItem *item = Find(id)) {
+        hr = item->Read(&flags, &value, &error, &time);
+        item->Release();
+    }
+    Send(wire::Kind::Reply, [&](wire::Out &out) {
+        out.U32(request);
+        out.U32(static_cast<uint32_t>(hr));
+        out.U32(flags);
+        out.Value(value);
+        out.U32(static_cast<uint32_t>(error));
+        out.U32(time.dwLowDateTime);
+        out.U32(time.dwHighDateTime);
+    });
+    ClearCadroValue(value);
+}
+
+void NodeSession::List(uint32_t request, const std::wstring &url)
+{
+    std::vector<BrowseEntry> entries;
+    bool found = m_engine.Browse(url, entries);
+    Send(wire::Kind::Reply, [&](wire::Out &out) {
+        out.U32(request);
+        out.U8(found ? 1 : 0);
+        out.U32(static_cast<uint32_t>(entries.size()));
+        for (const BrowseEntry &e : entries) {
+            out.Text(e.name);
+            out.U16(e.kind);
+            out.U8(e.leaf ? 1 : 0);
+            out.U16(e.dataType);
+            out.U16(e.access);
+            // Whether the member's URL as a library would build it from this
+            // listing names it: the library may then subscribe to it without
+            // waiting for the node's answer.
+            out.U8(e.leaf && m_engine.HasMember(wire::MemberUrl(url, e.name)) ? 1 : 0);
+        }
+    });
+}
+
+void NodeSession::Finish()
+{
+    {
+        std::lock_guard<SlimMutex> l(m_outLock);
+        if (!m_stopWriting) {
+            m_out.Begin(wire::Kind::Closing);
+            m_out.End();
+            m_stopWriting = true;
+        }
+    }
+    m_outReady.notify_all();
+}
+
+void NodeSession::TopologyChanged()
+{
+    Send(wire::Kind::Topology, [](wire::Out &) {});
+}
+
+HRESULT STDMETHODCALLTYPE NodeSession::OnData(void *cookie, uint32_t flags, const CadroValue *value, int32_t errorFlag,
+                                              uint32_t timeLow, uint32_t timeHigh)
+{
+    Send(wire::Kind::Data, [&](wire::Out &out) {
+        out.U32(IdOf(cookie));
+        out.U32(flags);
+        out.Value(*value);
+        out.U32(static_cast<uint32_t>(errorFlag));
+        out.U32(timeLow);
+        out.U32(timeHigh);
+    });
+    return S_OK;
+}
+
+HRESULT STDMETHODCALLTYPE NodeSession::OnAttributes(void *cookie, const CadroAttributes *attributes)
+{
+    Send(wire::Kind::Attributes, [&](wire::Out &out) {
+        out.U32(IdOf(cookie));
+        out.U32(attributes->mask);
+        out.U16(attributes->dataType);
+        out.U32(attributes->access);
+    });
+    return S_OK;
+}
+
+HRESULT STDMETHODCALLTYPE NodeSession::StatusChange(void *cookie, uint32_t status, uint32_t, uint32_t)
+{
+    Send(wire::Kind::Status, [&](wire::Out &out) {
+        out.U32(IdOf(cookie));
+        out.U32(status);
+    });
+    return S_OK;
+}
+
+} // namespace cadrosim

@@ -1,0 +1,81 @@
+#include "PipeChannel.h"
+
+#include <algorithm>
+
+namespace cadrosim {
+
+namespace {
+constexpr DWORD kReadChunk = 256 * 1024;
+}
+
+PipeChannel::PipeChannel(HANDLE pipe)
+    : m_pipe(pipe), m_readEvent(CreateEventW(nullptr, TRUE, FALSE, nullptr)),
+      m_writeEvent(CreateEventW(nullptr, TRUE, FALSE, nullptr))
+{
+}
+
+PipeChannel::~PipeChannel()
+{
+    Close();
+    CloseHandle(m_pipe);
+    CloseHandle(m_readEvent);
+    CloseHandle(m_writeEvent);
+}
+
+void PipeChannel::Close()
+{
+    if (!m_closed.exchange(true))
+        CancelIoEx(m_pipe, nullptr);
+}
+
+bool PipeChannel::Finish(OVERLAPPED &ov, BOOL started, DWORD &bytes)
+{
+    if (!started && GetLastError() != ERROR_IO_PENDING)
+        return false;
+    // A Close() between the check and the start of the operation would miss
+    // it: the wait wakes up now and then to look.
+    while (WaitForSingleObject(ov.hEvent, 200) == WAIT_TIMEOUT) {
+        if (m_closed) {
+            CancelIoEx(m_pipe, &ov);
+            break;
+        }
+    }
+    return GetOverlappedResult(m_pipe, &ov, &bytes, TRUE) != FALSE && !m_closed;
+}
+
+bool PipeChannel::Read(std::string &buffer)
+{
+    if (m_closed || !m_readEvent)
+        return false;
+    size_t had = buffer.size();
+    buffer.resize(had + kReadChunk);
+    OVERLAPPED ov = {};
+    ov.hEvent = m_readEvent;
+    ResetEvent(m_readEvent);
+    DWORD got = 0;
+    BOOL started = ReadFile(m_pipe, &buffer[had], kReadChunk, &got, &ov);
+    bool ok = Finish(ov, started, got) || GetLastError() == ERROR_MORE_DATA;
+    buffer.resize(had + (ok ? got : 0));
+    return ok && got > 0;
+}
+
+bool PipeChannel::Write(const std::string &bytes)
+{
+    size_t done = 0;
+    while (done < bytes.size()) {
+        if (m_closed || !m_writeEvent)
+            return false;
+        OVERLAPPED ov = {};
+        ov.hEvent = m_writeEvent;
+        ResetEvent(m_writeEvent);
+        DWORD put = 0;
+        DWORD chunk = static_cast<DWORD>(std::min<size_t>(bytes.size() - done, 1u << 24));
+        BOOL started = WriteFile(m_pipe, bytes.data() + done, chunk, &put, &ov);
+        if (!Finish(ov, started, put) || put == 0)
+            return false;
+        done += put;
+    }
+    return true;
+}
+
+} // namespace cadrosim

@@ -1,0 +1,93 @@
+#include "Wire.h"
+
+#include "TextObject.h"
+
+#include <cstring>
+
+namespace cadrosim::wire {
+
+void Out::Begin(Kind kind)
+{
+    m_frameStart = m_bytes.size();
+    U32(0);
+    U8(static_cast<uint8_t>(kind));
+}
+
+void Out::End()
+{
+    uint32_t length = static_cast<uint32_t>(m_bytes.size() - m_frameStart - 4);
+    memcpy(&m_bytes[m_frameStart], &length, 4);
+}
+
+void Out::Text(std::wstring_view text)
+{
+    U32(static_cast<uint32_t>(text.size()));
+    Raw(text.data(), text.size() * sizeof(wchar_t));
+}
+
+void Out::Value(const CadroValue &value)
+{
+    U32(value.type);
+    if (value.type & kCadroTextBit) {
+        // Texts travel as wide characters whatever the object's width.
+        std::wstring chars;
+        ICadroWideText *wide = nullptr;
+        ICadroNarrowText *narrow = nullptr;
+        if (value.text &&
+            SUCCEEDED(value.text->QueryInterface(__uuidof(ICadroWideText), reinterpret_cast<void **>(&wide)))) {
+            chars = wide->Chars();
+            wide->Release();
+        } else if (value.text && SUCCEEDED(value.text->QueryInterface(__uuidof(ICadroNarrowText),
+                                                                      reinterpret_cast<void **>(&narrow)))) {
+            const char *c = narrow->Chars();
+            int n = MultiByteToWideChar(CP_ACP, 0, c, -1, nullptr, 0);
+            chars.assign(n > 0 ? n - 1 : 0, L'\0');
+            if (n > 1)
+                MultiByteToWideChar(CP_ACP, 0, c, -1, chars.data(), n);
+            narrow->Release();
+        }
+        Text(chars);
+    } else if (value.type == kCadroBoolean) {
+        U8(value.boolean);
+    } else {
+        F64(value.number);
+    }
+}
+
+std::wstring In::Text()
+{
+    uint32_t n = U32();
+    if (!m_ok || static_cast<size_t>(m_end - m_p) / sizeof(wchar_t) < n) {
+        m_ok = false;
+        m_p = m_end;
+        return {};
+    }
+    std::wstring text(n, L'\0');
+    memcpy(text.data(), m_p, n * sizeof(wchar_t));
+    m_p += n * sizeof(wchar_t);
+    return text;
+}
+
+void In::Value(CadroValue &value)
+{
+    value = {};
+    value.type = U32();
+    if (value.type & kCadroTextBit) {
+        std::wstring chars = Text();
+        if (value.type == kCadroNarrowText) {
+            int n = WideCharToMultiByte(CP_ACP, 0, chars.c_str(), -1, nullptr, 0, nullptr, nullptr);
+            std::string narrow(n > 0 ? n - 1 : 0, '\0');
+            if (n > 1)
+                WideCharToMultiByte(CP_ACP, 0, chars.c_str(), -1, narrow.data(), n, nullptr, nullptr);
+            value.text = narrow.empty() ? nullptr : NewNarrowText(narrow);
+        } else {
+            value.text = chars.empty() ? nullptr : NewWideText(chars);
+        }
+    } else if (value.type == kCadroBoolean) {
+        value.boolean = U8();
+    } else {
+        value.number = F64();
+    }
+}
+
+} // namespace cadrosim::wire

@@ -1,0 +1,128 @@
+#pragma once
+// The frames that a server process's libraries and the network node exchange
+// over the node's pipe: a 32-bit length, a kind byte and the kind's fields,
+// little-endian. Readers check every length against what arrived, so a
+// truncated or garbled frame is refused, never read past.
+#include "CadroNetwork.h"
+
+#include <cstdint>
+#include <cstring>
+#include <string>
+#include <string_view>
+
+namespace cadrosim::wire {
+
+enum class Kind : uint8_t {
+    // Library → node.
+    Subscribe = 1, // id, flags (bit 0: answer with a Reply), url
+    Unsubscribe,   // id
+    Write,         // id, value
+    Read,          // request, id
+    List,          // request, url
+    Execute,       // request, command
+    Load,          // request, description
+    // Node → library.
+    Reply = 64, // request, then what the request asked for
+    Data,       // id, flags, value, error flag, time low, time high
+    Attributes, // id, data type, access
+    Status,     // id, status
+    Topology,   // the network's topology changed
+    Closing,    // the node is shutting down on request: not to be restarted
+};
+
+// The node's pipe; one per network node of this machine.
+inline const wchar_t *NodePipeName()
+{
+    return L"\\\\.\\pipe\\CadroNode";
+}
+
+// The URL of a member listed under url: its part (the name up to the first
+// "-") after the member separator; "(implicit)" is named by url itself.
+inline std::wstring MemberUrl(const std::wstring &url, const std::wstring &name)
+{
+    if (name == L"(implicit)")
+        return url;
+    return url + L"." + name.substr(0, name.find(L'-'));
+}
+
+class Out {
+public:
+    // Starts a frame; End() writes its length.
+    void Begin(Kind kind);
+    void End();
+    void U8(uint8_t v) { Raw(&v, 1); }
+    void U16(uint16_t v) { Raw(&v, 2); }
+    void U32(uint32_t v) { Raw(&v, 4); }
+    void F64(double v) { Raw(&v, 8); }
+    void Text(std::wstring_view text);
+    void Value(const CadroValue &value);
+
+    std::string &Bytes() { return m_bytes; }
+    bool Empty() const { return m_bytes.empty(); }
+
+private:
+    void Raw(const void *p, size_t n) { m_bytes.append(static_cast<const char *>(p), n); }
+    std::string m_bytes;
+    size_t m_frameStart = 0;
+};
+
+class In {
+public:
+    In(const char *p, size_t n) : m_p(p), m_end(p + n) {}
+    uint8_t U8() { return Get<uint8_t>(); }
+    uint16_t U16() { return Get<uint16_t>(); }
+    uint32_t U32() { return Get<uint32_t>(); }
+    double F64() { return Get<double>(); }
+    std::wstring Text();
+    // A text value gets a new text object, which the caller clears.
+    void Value(CadroValue &value);
+    bool Ok() const { return m_ok; }
+    // What is left of the frame.
+    std::string Rest() const { return std::string(m_p, m_end); }
+
+private:
+    template <class T> T Get()
+    {
+        T v{};
+        if (static_cast<size_t>(m_end - m_p) < sizeof v) {
+            m_ok = false;
+            m_p = m_end;
+            return v;
+        }
+        memcpy(&v, m_p, sizeof v);
+        m_p += sizeof v;
+        return v;
+    }
+    const char *m_p;
+    const char *m_end;
+    bool m_ok = true;
+};
+
+// Splits whole frames off the front of buffer: calls handle(kind, fields)
+// for each and keeps an incomplete one for the next read. False when a frame
+// is impossible (a length too large): the peer speaks something else.
+template <class Handle> bool TakeFrames(std::string &buffer, size_t &consumed, Handle handle)
+{
+    constexpr uint32_t kLargestFrame = 1u << 30;
+    while (buffer.size() - consumed >= 5) {
+        uint32_t length;
+        memcpy(&length, buffer.data() + consumed, 4);
+        if (length == 0 || length > kLargestFrame)
+            return false;
+        if (buffer.size() - consumed - 4 < length)
+            break;
+        const char *frame = buffer.data() + consumed + 4;
+        consumed += 4 + length;
+        handle(static_cast<Kind>(frame[0]), In(frame + 1, length - 1));
+    }
+    if (consumed == buffer.size()) {
+        buffer.clear();
+        consumed = 0;
+    } else if (consumed > (1u << 20)) {
+        buffer.erase(0, consumed);
+        consumed = 0;
+    }
+    return true;
+}
+
+} // namespace cadrosim::wire
