@@ -24,6 +24,10 @@ demo() {
     show browse '\\.\proc1\Waveform'
     show subscribe '\\.\proc1\Waveform.sine' '\\.\proc1\Waveform.square' '\\.\proc1\Waveform.ramp' \
         --rate 500 --duration 6
+    # Each command starts a server of its own; the network node keeps the
+    # written value for the next one.
+    show write '\\.\proc1\Setpoints.temperature' 22.5
+    show read '\\.\proc1\Setpoints.temperature'
 }
 status=0
 demo || status=$?

@@ -1,9 +1,8 @@
 // Plant-size item counts, measured as a SCADA client meets them: through COM
 // from this process against the registered local server. It writes its own
 // network description (for N = 1,000, 10,000 and 100,000: one object of N
-// members, and 100 objects of N/100 members), points the simulated network
-// at it through the registry value "Network File" for the length of the run,
-// and prints:
+// members, and 100 objects of N/100 members), loads it into the network node
+// for the length of the run ("cadroctl load"; "reset" after), and prints:
 // - AddItems of N distinct items, all in one object and spread over 100
 //   objects: the first call and the best of three, with the time per item;
 // - ValidateItems of 10,000 items;
@@ -13,7 +12,9 @@
 //   address space still to be read, once with it read already by a
 //   ValidateItems of the same identifiers), and the time of the RemoveGroup
 //   of such a group.
-// No other server process may run meanwhile: it would serve another network.
+// - the network node's memory per subscription (the same items).
+// No other server process may run meanwhile.
+#include "CadroSim.h"
 #include "ComPtr.h"
 #include "Handle.h"
 #include "ItemDefinitions.h"
@@ -30,8 +31,6 @@
 namespace {
 using Clock = std::chrono::steady_clock;
 const CLSID kServer = {0x5b1e7a20, 0x4c3d, 0x11d3, {0x9a, 0x44, 0x00, 0xa0, 0xc9, 0xe2, 0xb7, 0xf1}};
-const wchar_t kSimulatorKey[] = L"Software\\Tarnwell\\Cadro Simulator";
-const wchar_t kNetworkFileValue[] = L"Network File";
 const DWORD kCounts[] = {1000, 10000, 100000};
 const DWORD kSpreadObjects = 100;
 
@@ -91,36 +90,6 @@ bool WriteFile(const std::wstring &path, const std::string &text)
            written == text.size();
 }
 
-// Sets the registry value for the run and puts back what was there.
-class NetworkFileSetting {
-public:
-    explicit NetworkFileSetting(const std::wstring &path)
-    {
-        DWORD size = sizeof m_previous;
-        m_hadValue = RegGetValueW(HKEY_LOCAL_MACHINE, kSimulatorKey, kNetworkFileValue, RRF_RT_REG_SZ, nullptr,
-                                  m_previous, &size) == ERROR_SUCCESS;
-        Set(path.c_str());
-    }
-    ~NetworkFileSetting()
-    {
-        if (m_hadValue)
-            Set(m_previous);
-        else
-            RegDeleteKeyValueW(HKEY_LOCAL_MACHINE, kSimulatorKey, kNetworkFileValue);
-    }
-    NetworkFileSetting(const NetworkFileSetting &) = delete;
-    NetworkFileSetting &operator=(const NetworkFileSetting &) = delete;
-
-private:
-    static void Set(const wchar_t *value)
-    {
-        RegSetKeyValueW(HKEY_LOCAL_MACHINE, kSimulatorKey, kNetworkFileValue, REG_SZ, value,
-                        static_cast<DWORD>((wcslen(value) + 1) * sizeof(wchar_t)));
-    }
-    wchar_t m_previous[MAX_PATH * 2] = {};
-    bool m_hadValue = false;
-};
-
 int CountServerProcesses()
 {
     UniqueHandle snapshot(CreateToolhelp32Snapshot(TH32CS_SNAPPROCESS, 0));
@@ -133,13 +102,13 @@ int CountServerProcesses()
     return count;
 }
 
-UniqueHandle OpenServerProcess()
+UniqueHandle OpenProcessOf(const wchar_t *image)
 {
     UniqueHandle snapshot(CreateToolhelp32Snapshot(TH32CS_SNAPPROCESS, 0));
     PROCESSENTRY32W entry = {};
     entry.dwSize = sizeof entry;
     for (BOOL more = Process32FirstW(snapshot.Get(), &entry); more; more = Process32NextW(snapshot.Get(), &entry))
-        if (_wcsicmp(entry.szExeFile, L"Local.exe") == 0)
+        if (_wcsicmp(entry.szExeFile, image) == 0)
             return UniqueHandle(OpenProcess(PROCESS_QUERY_INFORMATION | PROCESS_VM_READ, FALSE, entry.th32ProcessID));
     return UniqueHandle();
 }
@@ -303,7 +272,8 @@ void ReadFigures(IOPCServer *server)
 
 void MemoryFigures(IOPCServer *server)
 {
-    UniqueHandle process = OpenServerProcess();
+    UniqueHandle process = OpenProcessOf(L"Local.exe");
+    UniqueHandle node = OpenProcessOf(L"cadronode.exe");
     if (WorkingSetKB(process.Get()) == 0) {
         printf("server memory: the server's working set cannot be read\n");
         return;
@@ -315,9 +285,11 @@ void MemoryFigures(IOPCServer *server)
     Sleep(500);
     Group first(server, L"memory");
     double before = WorkingSetKB(process.Get());
+    double nodeBefore = WorkingSetKB(node.Get());
     first.Add(fresh);
     Sleep(500);
     double afterFresh = WorkingSetKB(process.Get());
+    double nodeAfter = WorkingSetKB(node.Get());
     // Items whose nodes a ValidateItems of the same identifiers has read
     // (and whose call buffers it has had): what the items alone cost.
     Group second(server, L"memory2");
@@ -329,6 +301,8 @@ void MemoryFigures(IOPCServer *server)
     double afterKnown = WorkingSetKB(process.Get());
     printf("server memory per item at 100,000 items: %.3f KB with the address space to read, %.3f KB with it read\n",
            (afterFresh - before) / n, (afterKnown - beforeKnown) / n);
+    // The subscriptions themselves live in the network node.
+    printf("network node memory per subscription: %.3f KB\n", (nodeAfter - nodeBefore) / n);
     printf("RemoveGroup of a group of 100,000 items: %.1f ms\n", second.Remove());
 }
 } // namespace
@@ -344,7 +318,16 @@ int main()
         printf("cannot write %ls\n", path.c_str());
         return 1;
     }
-    NetworkFileSetting setting(path);
+    // Into the network node (started when none runs) for the length of the
+    // run; then back to its configured description.
+    BSTR answer = nullptr;
+    HRESULT loaded = CadroSim_Execute((L"load \"" + path + L"\"").c_str(), &answer);
+    if (loaded != S_OK) {
+        printf("the network node did not take the description: %ls\n", answer ? answer : L"");
+        SysFreeString(answer);
+        return 1;
+    }
+    SysFreeString(answer);
     CoInitializeEx(nullptr, COINIT_MULTITHREADED);
     {
         ComPtr<IOPCServer> server;
@@ -361,5 +344,7 @@ int main()
         }
     }
     CoUninitialize();
+    CadroSim_Execute(L"reset", &answer);
+    SysFreeString(answer);
     return 0;
 }

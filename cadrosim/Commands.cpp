@@ -74,7 +74,7 @@ const wchar_t kHelp[] = L"ok\n"
                         L"disconnect <machine> | reconnect <machine>\n"
                         L"stall <url> | unstall <url>\n"
                         L"show <url> | browse <url> | list-subscriptions | status\n"
-                        L"reset (back to the network's description) | shutdown (a network node)\n";
+                        L"load <file> | reset (back to the network's description) | shutdown (a network node)\n";
 } // namespace
 
 std::wstring Engine::Execute(const std::wstring &command)
@@ -107,6 +107,14 @@ std::wstring Engine::Execute(const std::wstring &command)
     if (verb == L"reset") {
         LoadInitialNetwork();
         return m_loadError.empty() ? L"ok\n" : Error(m_loadError);
+    }
+    if (verb == L"load") {
+        if (args.size() != 1)
+            return Error(L"usage: load <network description file>");
+        std::wstring text, error;
+        if (!ReadTextFile(args[0], text))
+            return Error(L"cannot read " + args[0]);
+        return Load(text, error) ? L"ok\n" : Error(args[0] + L": " + error);
     }
     if (verb == L"shutdown") {
         std::function<void()> shutdown;

@@ -37,12 +37,13 @@ void ControlPipe::Run()
     std::wstring name = ControlPipeName(GetCurrentProcessId());
     std::vector<wchar_t> buffer(kBufferBytes / sizeof(wchar_t));
     HANDLE event = CreateEventW(nullptr, TRUE, FALSE, nullptr);
-    while (WaitForSingleObject(m_stop, 0) == WAIT_TIMEOUT) {
-        HANDLE pipe = CreateNamedPipeW(name.c_str(), PIPE_ACCESS_DUPLEX | FILE_FLAG_OVERLAPPED,
-                                       PIPE_TYPE_MESSAGE | PIPE_READMODE_MESSAGE | PIPE_WAIT, 1, kBufferBytes,
-                                       kBufferBytes, 0, nullptr);
-        if (pipe == INVALID_HANDLE_VALUE)
-            break;
+    auto newInstance = [&name] {
+        return CreateNamedPipeW(name.c_str(), PIPE_ACCESS_DUPLEX | FILE_FLAG_OVERLAPPED,
+                                PIPE_TYPE_MESSAGE | PIPE_READMODE_MESSAGE | PIPE_WAIT, 2, kBufferBytes, kBufferBytes, 0,
+                                nullptr);
+    };
+    HANDLE pipe = newInstance();
+    while (pipe != INVALID_HANDLE_VALUE && WaitForSingleObject(m_stop, 0) == WAIT_TIMEOUT) {
         OVERLAPPED ov = {};
         ov.hEvent = event;
         ResetEvent(event);
@@ -50,6 +51,9 @@ void ControlPipe::Run()
         bool connected = ConnectNamedPipe(pipe, &ov) ? true : GetLastError() == ERROR_PIPE_CONNECTED;
         if (!connected && GetLastError() == ERROR_IO_PENDING)
             connected = Await(pipe, ov, m_stop, bytes);
+        // The next caller finds an instance while this one is served: a
+        // moment without one would tell it that no network runs here.
+        HANDLE next = newInstance();
         if (connected) {
             ResetEvent(event);
             bool read = ReadFile(pipe, buffer.data(), kBufferBytes - sizeof(wchar_t), &bytes, &ov) ||
@@ -65,7 +69,10 @@ void ControlPipe::Run()
             DisconnectNamedPipe(pipe);
         }
         CloseHandle(pipe);
+        pipe = next;
     }
+    if (pipe != INVALID_HANDLE_VALUE)
+        CloseHandle(pipe);
     CloseHandle(event);
 }
 

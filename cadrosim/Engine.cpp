@@ -33,6 +33,8 @@ std::wstring NetworkFilePath()
     return L"";
 }
 
+} // namespace
+
 bool ReadTextFile(const std::wstring &path, std::wstring &text)
 {
     HANDLE file = CreateFileW(path.c_str(), GENERIC_READ, FILE_SHARE_READ, nullptr, OPEN_EXISTING, 0, nullptr);
@@ -49,7 +51,6 @@ bool ReadTextFile(const std::wstring &path, std::wstring &text)
     MultiByteToWideChar(CP_UTF8, 0, bytes.data(), static_cast<int>(bytes.size()), text.data(), n);
     return true;
 }
-} // namespace
 
 Subscription::Subscription(std::shared_ptr<Member> m, ICadroRealTimeReceiver *r, void *c)
     : member(std::move(m)), receiver(r), cookie(c)

@@ -21,6 +21,9 @@ namespace cadrosim {
 
 class Engine;
 
+// A text file in UTF-8; false when it cannot be read.
+bool ReadTextFile(const std::wstring &path, std::wstring &text);
+
 // One subscription; it is the CadroDataItem the subscriber holds.
 struct Subscription : CSimUnknown<CadroDataItem> {
     Subscription(std::shared_ptr<Member> member, ICadroRealTimeReceiver *receiver, void *cookie);

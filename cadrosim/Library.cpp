@@ -37,11 +37,16 @@ void ReleaseUse()
         NodeLink::Instance().ReleaseUse();
 }
 
-std::wstring LocalHostName()
+// Asked once per subscription (to expand "\\.\"): read from the system once,
+// since GetComputerNameW reads the registry each time.
+const std::wstring &LocalHostName()
 {
-    wchar_t name[MAX_COMPUTERNAME_LENGTH + 1];
-    DWORD size = MAX_COMPUTERNAME_LENGTH + 1;
-    return GetComputerNameW(name, &size) ? std::wstring(name, size) : std::wstring(L"LOCALHOST");
+    static const std::wstring host = [] {
+        wchar_t name[MAX_COMPUTERNAME_LENGTH + 1];
+        DWORD size = MAX_COMPUTERNAME_LENGTH + 1;
+        return GetComputerNameW(name, &size) ? std::wstring(name, size) : std::wstring(L"LOCALHOST");
+    }();
+    return host;
 }
 
 class CRealTime : public CSimUnknown<CadroRealTime> {

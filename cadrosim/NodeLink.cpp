@@ -18,6 +18,7 @@ constexpr uint32_t kSlotMask = (1u << kSlotBits) - 1;
 constexpr DWORD kStartWaitMs = 15000;
 constexpr DWORD kReplyWaitMs = 60000;
 constexpr DWORD kReconnectPauseMs = 500;
+constexpr DWORD kRestartMs = 2000;
 constexpr size_t kMostKnownUrls = 4u << 20;
 
 uint64_t UrlHash(std::wstring_view url)
@@ -44,28 +45,49 @@ std::wstring NodeProgramPath()
 
 void StartNode()
 {
+    // The node outlives whoever started it: it must not keep (or write to)
+    // the standard handles of that program, whose reader may be long gone.
+    // They are the null device, and nothing else is inherited.
+    SECURITY_ATTRIBUTES inheritable = {sizeof inheritable, nullptr, TRUE};
+    HANDLE nul = CreateFileW(L"NUL", GENERIC_READ | GENERIC_WRITE, FILE_SHARE_READ | FILE_SHARE_WRITE, &inheritable,
+                             OPEN_EXISTING, 0, nullptr);
+    if (nul == INVALID_HANDLE_VALUE)
+        return;
+    SIZE_T size = 0;
+    InitializeProcThreadAttributeList(nullptr, 1, 0, &size);
+    std::vector<char> attributes(size);
+    auto *list = reinterpret_cast<LPPROC_THREAD_ATTRIBUTE_LIST>(attributes.data());
+    bool limited =
+        size && InitializeProcThreadAttributeList(list, 1, 0, &size) &&
+        UpdateProcThreadAttribute(list, 0, PROC_THREAD_ATTRIBUTE_HANDLE_LIST, &nul, sizeof nul, nullptr, nullptr);
+    STARTUPINFOEXW startup = {};
+    startup.StartupInfo.cb = sizeof startup;
+    startup.StartupInfo.dwFlags = STARTF_USESTDHANDLES;
+    startup.StartupInfo.hStdInput = startup.StartupInfo.hStdOutput = startup.StartupInfo.hStdError = nul;
+    startup.lpAttributeList = limited ? list : nullptr;
     std::wstring command = L"\"" + NodeProgramPath() + L"\"";
-    STARTUPINFOW startup = {};
-    startup.cb = sizeof startup;
     PROCESS_INFORMATION process = {};
-    if (CreateProcessW(nullptr, command.data(), nullptr, nullptr, FALSE, DETACHED_PROCESS | CREATE_NO_WINDOW, nullptr,
-                       nullptr, &startup, &process)) {
+    DWORD flags = DETACHED_PROCESS | CREATE_NEW_PROCESS_GROUP | (limited ? EXTENDED_STARTUPINFO_PRESENT : 0);
+    if (CreateProcessW(nullptr, command.data(), nullptr, nullptr, TRUE, flags, nullptr, nullptr, &startup.StartupInfo,
+                       &process)) {
         CloseHandle(process.hThread);
         CloseHandle(process.hProcess);
     }
+    if (limited)
+        DeleteProcThreadAttributeList(list);
+    CloseHandle(nul);
 }
 } // namespace
 
 // ---- RemoteSubscription ------------------------------------------------------
 
-RemoteSubscription *RemoteSubscription::Create(NodeLink &link, const wchar_t *url, ICadroRealTimeReceiver *receiver,
-                                               void *cookie)
+RemoteSubscription *RemoteSubscription::Create(const wchar_t *url, ICadroRealTimeReceiver *receiver, void *cookie)
 {
     size_t length = wcslen(url);
     if (length > UINT32_MAX / 4)
         return nullptr;
     void *block = operator new(sizeof(RemoteSubscription), length);
-    return block ? ::new (block) RemoteSubscription(link, receiver, cookie, url, length) : nullptr;
+    return block ? ::new (block) RemoteSubscription(receiver, cookie, url, length) : nullptr;
 }
 
 void *RemoteSubscription::operator new(size_t size, size_t chars)
@@ -78,19 +100,63 @@ void RemoteSubscription::operator delete(void *p)
     ::operator delete(p);
 }
 
-RemoteSubscription::RemoteSubscription(NodeLink &l, ICadroRealTimeReceiver *r, void *c, const wchar_t *url,
-                                       size_t length)
-    : link(l), receiver(r), cookie(c), m_urlLength(static_cast<uint32_t>(length))
+RemoteSubscription::RemoteSubscription(ICadroRealTimeReceiver *r, void *c, const wchar_t *url, size_t length)
+    : receiver(r), cookie(c), m_urlLength(static_cast<uint32_t>(length))
 {
     memcpy(const_cast<wchar_t *>(Chars()), url, length * sizeof(wchar_t));
     receiver->AddRef();
-    link.AddUse();
+    NodeLink::Instance().AddUse();
 }
 
 RemoteSubscription::~RemoteSubscription()
 {
+    ClearCadroValue(m_value);
     receiver->Release();
-    link.ReleaseUse();
+    NodeLink::Instance().ReleaseUse();
+}
+
+void RemoteSubscription::Remember(uint32_t flags, const CadroValue &value, int32_t error, uint32_t low, uint32_t high)
+{
+    m_connected = true;
+    if (flags & kCadroHasValue) {
+        ClearCadroValue(m_value);
+        m_value = value;
+        if ((m_value.type & kCadroTextBit) && m_value.text)
+            m_value.text->AddRef();
+    }
+    if (flags & kCadroHasQuality)
+        m_bad = error != 0;
+    if (flags & kCadroHasTime)
+        m_time = {low, high};
+    else
+        GetSystemTimeAsFileTime(&m_time);
+}
+
+void RemoteSubscription::RememberStatus(uint32_t status)
+{
+    if (status == kCadroStatusDisconnected)
+        m_connected = false;
+    else if (status == kCadroStatusContacted)
+        m_connected = true;
+    else if (status == kCadroStatusSubscribeFailed)
+        ClearCadroValue(m_value); // the member has gone: no value to read
+}
+
+HRESULT RemoteSubscription::Recall(uint32_t *flags, CadroValue *value, int32_t *errorFlag, FILETIME *time) const
+{
+    if (!m_connected)
+        return kNotConnected;
+    if (m_value.type == kCadroNoValue) {
+        GetSystemTimeAsFileTime(time); // no value yet: the time of the query
+        return S_OK;
+    }
+    *value = m_value;
+    if ((value->type & kCadroTextBit) && value->text)
+        value->text->AddRef();
+    *flags = kCadroHasValue | kCadroHasQuality | kCadroHasTime;
+    *errorFlag = m_bad ? 1 : 0;
+    *time = m_time;
+    return S_OK;
 }
 
 void RemoteSubscription::Delete()
@@ -100,18 +166,18 @@ void RemoteSubscription::Delete()
 
 HRESULT STDMETHODCALLTYPE RemoteSubscription::Write(const CadroValue *value)
 {
-    return link.Write(this, value);
+    return NodeLink::Instance().Write(this, value);
 }
 
 HRESULT STDMETHODCALLTYPE RemoteSubscription::Read(uint32_t *flags, CadroValue *value, int32_t *errorFlag,
                                                    FILETIME *time)
 {
-    return link.Read(this, flags, value, errorFlag, time);
+    return NodeLink::Instance().Read(this, flags, value, errorFlag, time);
 }
 
 void RemoteSubscription::LastRelease()
 {
-    link.Unsubscribe(this);
+    NodeLink::Instance().Unsubscribe(this);
 }
 
 // ---- NodeLink: lifetime --------------------------------------------------------
@@ -147,28 +213,27 @@ void NodeLink::Start()
     if (!m_wake)
         m_wake = CreateEventW(nullptr, FALSE, FALSE, nullptr);
     m_thread = std::thread([this, generation] { Run(generation); });
-    m_writer = std::thread([this, generation] { WriteLoop(generation); });
 }
 
 void NodeLink::Stop(std::unique_lock<SlimMutex> &l)
 {
     ++m_generation;
-    if (m_channel)
-        m_channel->Close();
-    SetEvent(m_wake);
+    std::shared_ptr<PipeChannel> channel = m_channel;
     std::thread thread = std::move(m_thread);
-    std::thread writer = std::move(m_writer);
     l.unlock();
+    // What was said last (a write, unsubscriptions) reaches the node before
+    // the pipe closes.
+    m_queue.Stop(true);
+    if (channel)
+        channel->Close();
+    SetEvent(m_wake);
     m_changed.notify_all();
-    m_outReady.notify_all();
     if (thread.joinable()) {
         if (thread.get_id() == std::this_thread::get_id())
             thread.detach(); // the last use ended inside a callback
         else
             thread.join();
     }
-    if (writer.joinable())
-        writer.join();
     l.lock();
     if (m_uses == 0)
         m_state = State::Stopped;
@@ -178,8 +243,9 @@ void NodeLink::Stop(std::unique_lock<SlimMutex> &l)
 
 std::unique_ptr<PipeChannel> NodeLink::Connect(bool mayStart, unsigned generation)
 {
-    bool started = false;
     DWORD begin = GetTickCount();
+    DWORD lastStart = 0;
+    bool started = false;
     for (;;) {
         HANDLE pipe = CreateFileW(wire::NodePipeName(), GENERIC_READ | GENERIC_WRITE, 0, nullptr, OPEN_EXISTING,
                                   FILE_FLAG_OVERLAPPED, nullptr);
@@ -189,11 +255,16 @@ std::unique_ptr<PipeChannel> NodeLink::Connect(bool mayStart, unsigned generatio
         if (error == ERROR_PIPE_BUSY) {
             WaitNamedPipeW(wire::NodePipeName(), 200);
         } else {
-            if (mayStart && !started && error == ERROR_FILE_NOT_FOUND) {
+            // A node that is still shutting down makes a new one give way:
+            // started again while none appears.
+            if (mayStart && error == ERROR_FILE_NOT_FOUND && (!started || GetTickCount() - lastStart > kRestartMs)) {
                 StartNode();
                 started = true;
+                lastStart = GetTickCount();
             }
-            if (!started)
+            // No node and none to be started: give up at once. Any other
+            // refusal (an instance of a node that is closing) passes.
+            if (!started && error == ERROR_FILE_NOT_FOUND)
                 return nullptr;
             if (WaitForSingleObject(m_wake, 20) == WAIT_OBJECT_0)
                 return nullptr;
@@ -226,6 +297,7 @@ void NodeLink::Run(unsigned generation)
                 return;
             if (channel) {
                 m_channel = channel;
+                m_queue.Attach(channel);
                 m_state = State::Connected;
                 m_mayStartNode = true;
                 // Every subscription again, under the same identifiers.
@@ -238,36 +310,17 @@ void NodeLink::Run(unsigned generation)
                         });
             } else if (mayStart == m_mayStartNode) {
                 m_state = State::Down;
+                m_lastFailure = GetTickCount();
             } else {
                 continue; // a request needs a node now: start one
             }
         }
         m_changed.notify_all();
-        m_outReady.notify_all();
         if (channel) {
             Serve(*channel);
             Disconnected();
         }
         WaitForSingleObject(m_wake, kReconnectPauseMs);
-    }
-}
-
-void NodeLink::WriteLoop(unsigned generation)
-{
-    std::string batch;
-    for (;;) {
-        std::shared_ptr<PipeChannel> channel;
-        {
-            std::unique_lock<SlimMutex> l(m_lock);
-            m_outReady.wait(l, [&] { return m_generation != generation || (!m_out.Empty() && m_channel); });
-            if (m_generation != generation)
-                return;
-            batch.swap(m_out.Bytes());
-            channel = m_channel;
-        }
-        if (!channel->Write(batch))
-            channel->Close(); // the reader sees it and reconnects
-        batch.clear();
     }
 }
 
@@ -287,29 +340,32 @@ void NodeLink::Disconnected()
     {
         std::lock_guard<SlimMutex> l(m_lock);
         m_channel.reset();
+        m_queue.Detach();
         if (m_state == State::Connected)
             m_state = State::Down;
-        m_out.Bytes().clear();
         m_knownUrls.clear();
         for (auto &entry : m_pending)
             entry.second->done = true; // unanswered
         m_pending.clear();
+        // Told once, however often a connection fails before the node is
+        // back.
         for (RemoteSubscription *sub : m_slots)
-            if (sub)
+            if (sub && sub->Connected())
                 ids.push_back(sub->id);
     }
     m_changed.notify_all();
     for (uint32_t id : ids)
-        CallSubscription(id, [](RemoteSubscription &sub) {
-            sub.receiver->StatusChange(sub.cookie, kCadroStatusDisconnected, 0, 0);
-        });
+        CallSubscription(
+            id, [](RemoteSubscription &sub) { sub.receiver->StatusChange(sub.cookie, kCadroStatusDisconnected, 0, 0); },
+            [](RemoteSubscription &sub) { sub.RememberStatus(kCadroStatusDisconnected); });
 }
 
 bool NodeLink::WaitConnected(std::unique_lock<SlimMutex> &l)
 {
     // A node shut down on purpose is not started again by the link alone,
-    // but a request that needs the network starts one.
-    if (m_state == State::Down && !m_mayStartNode) {
+    // but a request that needs the network starts one; and a request does
+    // not wait for the link's next attempt, unless one failed just now.
+    if (m_state == State::Down && (!m_mayStartNode || GetTickCount() - m_lastFailure > kRestartMs)) {
         m_mayStartNode = true;
         m_state = State::Connecting;
         SetEvent(m_wake);
@@ -322,7 +378,7 @@ bool NodeLink::WaitConnected(std::unique_lock<SlimMutex> &l)
 
 // ---- NodeLink: frames from the node -----------------------------------------------
 
-template <class Call> void NodeLink::CallSubscription(uint32_t id, Call call)
+template <class Call, class Note> void NodeLink::CallSubscription(uint32_t id, Call call, Note note)
 {
     RemoteSubscription *sub;
     {
@@ -330,6 +386,7 @@ template <class Call> void NodeLink::CallSubscription(uint32_t id, Call call)
         sub = Lookup(id);
         if (!sub)
             return;
+        note(*sub);
         m_inCallback = sub;
     }
     call(*sub);
@@ -339,7 +396,7 @@ template <class Call> void NodeLink::CallSubscription(uint32_t id, Call call)
         m_inCallback = nullptr;
         dead = std::exchange(m_deleteAfterCallback, nullptr);
     }
-    m_changed.notify_all();
+    m_callbackDone.notify_all();
     if (dead)
         dead->Delete();
 }
@@ -356,9 +413,9 @@ void NodeLink::Dispatch(wire::Kind kind, wire::In &in)
         uint32_t low = in.U32();
         uint32_t high = in.U32();
         if (in.Ok())
-            CallSubscription(id, [&](RemoteSubscription &sub) {
-                sub.receiver->OnData(sub.cookie, flags, &value, error, low, high);
-            });
+            CallSubscription(
+                id, [&](RemoteSubscription &sub) { sub.receiver->OnData(sub.cookie, flags, &value, error, low, high); },
+                [&](RemoteSubscription &sub) { sub.Remember(flags, value, error, low, high); });
         ClearCadroValue(value);
         return;
     }
@@ -376,8 +433,9 @@ void NodeLink::Dispatch(wire::Kind kind, wire::In &in)
         uint32_t id = in.U32();
         uint32_t status = in.U32();
         if (in.Ok())
-            CallSubscription(id,
-                             [&](RemoteSubscription &sub) { sub.receiver->StatusChange(sub.cookie, status, 0, 0); });
+            CallSubscription(
+                id, [&](RemoteSubscription &sub) { sub.receiver->StatusChange(sub.cookie, status, 0, 0); },
+                [&](RemoteSubscription &sub) { sub.RememberStatus(status); });
         return;
     }
     case wire::Kind::Reply: {
@@ -464,15 +522,7 @@ RemoteSubscription *NodeLink::Lookup(uint32_t id) const
 
 template <class Fill> bool NodeLink::Send(wire::Kind kind, Fill fill)
 {
-    if (m_state != State::Connected)
-        return false;
-    bool wake = m_out.Empty();
-    m_out.Begin(kind);
-    fill(m_out);
-    m_out.End();
-    if (wake)
-        m_outReady.notify_one();
-    return true;
+    return m_state == State::Connected && m_queue.Push(kind, fill);
 }
 
 template <class Fill> bool NodeLink::Ask(wire::Kind kind, Fill fill, std::string &reply)
@@ -488,6 +538,11 @@ template <class Fill> bool NodeLink::Ask(wire::Kind kind, Fill fill, std::string
         fill(out);
     });
     m_pending[request] = &pending;
+    // Written by this thread, without the link's lock: the link's thread
+    // must go on reading meanwhile.
+    l.unlock();
+    m_queue.Flush();
+    l.lock();
     auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(kReplyWaitMs);
     while (!pending.done && std::chrono::steady_clock::now() < deadline)
         m_changed.wait_until(l, deadline);
@@ -503,7 +558,7 @@ HRESULT NodeLink::Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeRece
     if (!out || !receiver || !url)
         return E_POINTER;
     *out = nullptr;
-    RemoteSubscription *sub = RemoteSubscription::Create(*this, url, receiver, cookie);
+    RemoteSubscription *sub = RemoteSubscription::Create(url, receiver, cookie);
     if (!sub)
         return E_OUTOFMEMORY;
     std::unique_lock<SlimMutex> l(m_lock);
@@ -560,7 +615,7 @@ void NodeLink::Forget(RemoteSubscription *sub, std::unique_lock<SlimMutex> &l)
 {
     Unregister(sub);
     if (m_inCallback == sub && !OnLinkThread())
-        m_changed.wait(l, [&] { return m_inCallback != sub; });
+        m_callbackDone.wait(l, [&] { return m_inCallback != sub; });
 }
 
 void NodeLink::Unsubscribe(RemoteSubscription *sub)
@@ -581,7 +636,8 @@ HRESULT NodeLink::Write(RemoteSubscription *sub, const CadroValue *value)
 {
     if (!value)
         return E_POINTER;
-    std::lock_guard<SlimMutex> l(m_lock);
+    std::unique_lock<SlimMutex> l(m_lock);
+    WaitConnected(l);
     bool sent = Send(wire::Kind::Write, [&](wire::Out &out) {
         out.U32(sub->id);
         out.Value(*value);
@@ -598,26 +654,10 @@ HRESULT NodeLink::Read(RemoteSubscription *sub, uint32_t *flags, CadroValue *val
     *time = {};
     value->type = kCadroCleared;
     value->number = 0;
-    std::string reply;
-    if (!Ask(
-            wire::Kind::Read, [&](wire::Out &out) { out.U32(sub->id); }, reply))
+    std::unique_lock<SlimMutex> l(m_lock);
+    if (!WaitConnected(l))
         return kNotConnected;
-    wire::In in(reply.data(), reply.size());
-    HRESULT hr = static_cast<HRESULT>(in.U32());
-    uint32_t gotFlags = in.U32();
-    CadroValue got;
-    in.Value(got);
-    int32_t error = static_cast<int32_t>(in.U32());
-    FILETIME at = {in.U32(), in.U32()};
-    if (!in.Ok()) {
-        ClearCadroValue(got);
-        return kNotConnected;
-    }
-    *flags = gotFlags;
-    *value = got;
-    *errorFlag = error;
-    *time = at;
-    return hr;
+    return sub->Recall(flags, value, errorFlag, time);
 }
 
 bool NodeLink::Browse(const std::wstring &url, std::vector<BrowseEntry> &out)

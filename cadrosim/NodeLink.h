@@ -5,11 +5,9 @@
 // breaks, every subscription is told that the node disconnected it; the link
 // connects again (starting a node unless the last one was shut down on
 // purpose) and subscribes again to all of them.
+#include "FrameQueue.h"
 #include "Network.h"
-#include "PipeChannel.h"
-#include "SlimSync.h"
 #include "Unknown.h"
-#include "Wire.h"
 
 #include <memory>
 #include <thread>
@@ -24,8 +22,7 @@ class NodeLink;
 // A subscription through the node; the CadroDataItem its holder keeps.
 class RemoteSubscription : public CSimUnknown<CadroDataItem> {
 public:
-    static RemoteSubscription *Create(NodeLink &link, const wchar_t *url, ICadroRealTimeReceiver *receiver,
-                                      void *cookie);
+    static RemoteSubscription *Create(const wchar_t *url, ICadroRealTimeReceiver *receiver, void *cookie);
     void Delete();
 
     HRESULT STDMETHODCALLTYPE Write(const CadroValue *value) override;
@@ -34,19 +31,30 @@ public:
 
     std::wstring_view Url() const { return {Chars(), m_urlLength}; }
 
-    NodeLink &link;
+    // Under the link's lock: the member's value as the node last sent it.
+    // The node sends every change to every subscription, so a read is
+    // answered from it without asking the node.
+    void Remember(uint32_t flags, const CadroValue &value, int32_t error, uint32_t low, uint32_t high);
+    void RememberStatus(uint32_t status);
+    HRESULT Recall(uint32_t *flags, CadroValue *value, int32_t *errorFlag, FILETIME *time) const;
+    bool Connected() const { return m_connected; }
+
     ICadroRealTimeReceiver *receiver;
     void *cookie;
     uint32_t id = 0;
 
 private:
-    RemoteSubscription(NodeLink &l, ICadroRealTimeReceiver *r, void *c, const wchar_t *url, size_t length);
+    RemoteSubscription(ICadroRealTimeReceiver *r, void *c, const wchar_t *url, size_t length);
     ~RemoteSubscription() override;
     static void *operator new(size_t size, size_t chars);
     static void operator delete(void *p);
     // The URL is kept behind the object, in the same block.
     const wchar_t *Chars() const { return reinterpret_cast<const wchar_t *>(this + 1); }
     uint32_t m_urlLength;
+    CadroValue m_value = {}; // kCadroNoValue until the first value
+    FILETIME m_time = {};
+    bool m_bad = false;
+    bool m_connected = true;
 };
 
 class NodeLink {
@@ -80,14 +88,19 @@ private:
     void Start();
     void Stop(std::unique_lock<SlimMutex> &l);
     void Run(unsigned generation);
-    void WriteLoop(unsigned generation);
     std::unique_ptr<PipeChannel> Connect(bool mayStart, unsigned generation);
     void Serve(PipeChannel &channel);
     void Dispatch(wire::Kind kind, wire::In &in);
     void Disconnected();
     // Out of the table, then waits for a callback on it in flight.
     void Forget(RemoteSubscription *sub, std::unique_lock<SlimMutex> &l);
-    template <class Call> void CallSubscription(uint32_t id, Call call);
+    // Calls the subscription's receiver, unless it has gone; first, under
+    // the lock, note(sub) when given.
+    template <class Call, class Note> void CallSubscription(uint32_t id, Call call, Note note);
+    template <class Call> void CallSubscription(uint32_t id, Call call)
+    {
+        CallSubscription(id, call, [](RemoteSubscription &) {});
+    }
     void TopologyChanged();
     bool WaitConnected(std::unique_lock<SlimMutex> &l);
     bool OnLinkThread() const { return GetCurrentThreadId() == m_linkThreadId; }
@@ -102,14 +115,15 @@ private:
     template <class Fill> bool Ask(wire::Kind kind, Fill fill, std::string &reply);
 
     SlimMutex m_lock;
-    SlimCondition m_changed; // state, replies, callbacks ending
-    SlimCondition m_outReady;
+    SlimCondition m_changed;      // the state, and replies
+    SlimCondition m_callbackDone; // a callback has returned (woken often: apart)
     State m_state = State::Stopped;
     long m_uses = 0;
     unsigned m_generation = 0; // of the threads that should run; Stop() moves it on
     bool m_mayStartNode = true;
+    DWORD m_lastFailure = 0; // when an attempt to connect last failed
     std::shared_ptr<PipeChannel> m_channel;
-    wire::Out m_out;
+    FrameQueue m_queue;
     std::vector<RemoteSubscription *> m_slots;
     std::vector<uint16_t> m_generations;
     std::vector<uint32_t> m_freeSlots;
@@ -125,7 +139,6 @@ private:
     HANDLE m_wake = nullptr; // cuts the pause between reconnections short
     DWORD m_linkThreadId = 0;
     std::thread m_thread;
-    std::thread m_writer;
 };
 
 } // namespace cadrosim

@@ -38,9 +38,20 @@ HANDLE NodeServer::NewInstance(bool first)
 
 int NodeServer::Run()
 {
-    HANDLE pipe = NewInstance(true);
-    if (pipe == INVALID_HANDLE_VALUE)
+    // One node per machine: libraries that find none may start several at
+    // once. The name is held for the node's life (the pipe's own "first
+    // instance" flag is not honoured everywhere).
+    HANDLE single = CreateMutexW(nullptr, FALSE, L"Local\\CadroNode");
+    if (!single || GetLastError() == ERROR_ALREADY_EXISTS) {
+        if (single)
+            CloseHandle(single);
         return 1;
+    }
+    HANDLE pipe = NewInstance(true);
+    if (pipe == INVALID_HANDLE_VALUE) {
+        CloseHandle(single);
+        return 1;
+    }
     m_engine.AddUse();
     m_engine.AddBrowserReceiver(this);
     m_engine.SetShutdownHandler([this] { Stop(); });
@@ -100,6 +111,7 @@ int NodeServer::Run()
     Reap(true);
     m_engine.RemoveBrowserReceiver(this);
     m_engine.ReleaseUse();
+    CloseHandle(single);
     return 0;
 }
 
@@ -120,8 +132,8 @@ void NodeServer::Reap(bool all)
         }
     }
     // A library that does not take the closing word within a few seconds
-    // is not waited for.
-    for (DWORD waited = 0; all && waited < 3000; waited += 20) {
+    // (a busy one may have a backlog to read first) is not waited for.
+    for (DWORD waited = 0; all && waited < 10000; waited += 20) {
         bool ended = true;
         for (NodeSession *session : done)
             ended = ended && session->Ended();

@@ -25,9 +25,9 @@ NodeSession *NodeSession::Start(Engine &engine, HANDLE pipe, HANDLE ended)
 }
 
 NodeSession::NodeSession(Engine &engine, HANDLE pipe, HANDLE ended)
-    : m_engine(engine), m_channel(pipe), m_endedEvent(ended)
+    : m_engine(engine), m_channel(std::make_shared<PipeChannel>(pipe)), m_endedEvent(ended), m_queue(kLargestBacklog)
 {
-    m_writer = std::thread([this] { WriteLoop(); });
+    m_queue.Attach(m_channel);
     m_reader = std::thread([this] { ReadLoop(); });
 }
 
@@ -35,50 +35,12 @@ void NodeSession::Join()
 {
     if (m_reader.joinable())
         m_reader.join();
-    if (m_writer.joinable())
-        m_writer.join();
 }
 
-template <class Fill> void NodeSession::Send(wire::Kind kind, Fill fill)
+template <class Fill> void NodeSession::Reply(Fill fill)
 {
-    std::lock_guard<SlimMutex> l(m_outLock);
-    if (m_stopWriting)
-        return;
-    bool wake = m_out.Empty();
-    m_out.Begin(kind);
-    fill(m_out);
-    m_out.End();
-    if (m_out.Bytes().size() > kLargestBacklog) {
-        m_stopWriting = true;
-        m_channel.Close();
-    }
-    if (wake)
-        m_outReady.notify_one();
-}
-
-void NodeSession::WriteLoop()
-{
-    std::string batch;
-    for (;;) {
-        {
-            std::unique_lock<SlimMutex> l(m_outLock);
-            m_outReady.wait(l, [this] { return !m_out.Empty() || m_stopWriting; });
-            if (m_out.Empty()) {
-                m_channel.Close(); // everything said: the reader ends too
-                return;
-            }
-            batch.swap(m_out.Bytes());
-        }
-        bool written = m_channel.Write(batch);
-        batch.clear();
-        if (!written) {
-            m_channel.Close();
-            std::lock_guard<SlimMutex> l(m_outLock);
-            m_stopWriting = true;
-            m_out.Bytes().clear();
-            return;
-        }
-    }
+    m_queue.Push(wire::Kind::Reply, fill);
+    m_queue.Flush();
 }
 
 void NodeSession::ReadLoop()
@@ -86,18 +48,14 @@ void NodeSession::ReadLoop()
     std::string buffer;
     size_t consumed = 0;
     bool fine = true;
-    while (fine && m_channel.Read(buffer))
+    while (fine && m_channel->Read(buffer))
         fine = wire::TakeFrames(buffer, consumed, [&](wire::Kind kind, wire::In in) {
             if (fine)
                 fine = Handle(kind, in);
         });
-    m_channel.Close();
+    m_channel->Close();
     ReleaseAll();
-    {
-        std::lock_guard<SlimMutex> l(m_outLock);
-        m_stopWriting = true;
-    }
-    m_outReady.notify_all();
+    m_queue.Stop(false);
     m_ended = true;
     SetEvent(m_endedEvent);
 }
@@ -133,13 +91,6 @@ bool NodeSession::Handle(wire::Kind kind, wire::In &in)
         ClearCadroValue(value);
         break;
     }
-    case wire::Kind::Read: {
-        uint32_t request = in.U32();
-        uint32_t id = in.U32();
-        if (in.Ok())
-            Read(request, id);
-        break;
-    }
     case wire::Kind::List: {
         uint32_t request = in.U32();
         std::wstring url = in.Text();
@@ -153,7 +104,7 @@ bool NodeSession::Handle(wire::Kind kind, wire::In &in)
         if (!in.Ok())
             break;
         std::wstring answer = m_engine.Execute(command);
-        Send(wire::Kind::Reply, [&](wire::Out &out) {
+        Reply([&](wire::Out &out) {
             out.U32(request);
             out.Text(answer);
         });
@@ -166,7 +117,7 @@ bool NodeSession::Handle(wire::Kind kind, wire::In &in)
             break;
         std::wstring error;
         bool loaded = m_engine.Load(description, error);
-        Send(wire::Kind::Reply, [&](wire::Out &out) {
+        Reply([&](wire::Out &out) {
             out.U32(request);
             out.U8(loaded ? 1 : 0);
             out.Text(error);
@@ -200,7 +151,7 @@ void NodeSession::Subscribe(wire::In &in)
             previous->Release();
     }
     if (request)
-        Send(wire::Kind::Reply, [&](wire::Out &out) {
+        Reply([&](wire::Out &out) {
             out.U32(request);
             out.U32(static_cast<uint32_t>(hr));
         });
@@ -230,34 +181,11 @@ CadroDataItem *NodeSession::Find(uint32_t id)
     return it->second;
 }
 
-void NodeSession::Read(uint32_t request, uint32_t id)
-{
-    uint32_t flags = 0;
-    CadroValue value = {};
-    int32_t error = 0;
-    FILETIME time = {};
-    HRESULT hr = E_HANDLE;
-    if (CadroDataItem *item = Find(id)) {
-        hr = item->Read(&flags, &value, &error, &time);
-        item->Release();
-    }
-    Send(wire::Kind::Reply, [&](wire::Out &out) {
-        out.U32(request);
-        out.U32(static_cast<uint32_t>(hr));
-        out.U32(flags);
-        out.Value(value);
-        out.U32(static_cast<uint32_t>(error));
-        out.U32(time.dwLowDateTime);
-        out.U32(time.dwHighDateTime);
-    });
-    ClearCadroValue(value);
-}
-
 void NodeSession::List(uint32_t request, const std::wstring &url)
 {
     std::vector<BrowseEntry> entries;
     bool found = m_engine.Browse(url, entries);
-    Send(wire::Kind::Reply, [&](wire::Out &out) {
+    Reply([&](wire::Out &out) {
         out.U32(request);
         out.U8(found ? 1 : 0);
         out.U32(static_cast<uint32_t>(entries.size()));
@@ -277,26 +205,19 @@ void NodeSession::List(uint32_t request, const std::wstring &url)
 
 void NodeSession::Finish()
 {
-    {
-        std::lock_guard<SlimMutex> l(m_outLock);
-        if (!m_stopWriting) {
-            m_out.Begin(wire::Kind::Closing);
-            m_out.End();
-            m_stopWriting = true;
-        }
-    }
-    m_outReady.notify_all();
+    m_queue.Push(wire::Kind::Closing, [](wire::Out &) {});
+    m_queue.CloseWhenWritten();
 }
 
 void NodeSession::TopologyChanged()
 {
-    Send(wire::Kind::Topology, [](wire::Out &) {});
+    m_queue.Push(wire::Kind::Topology, [](wire::Out &) {});
 }
 
 HRESULT STDMETHODCALLTYPE NodeSession::OnData(void *cookie, uint32_t flags, const CadroValue *value, int32_t errorFlag,
                                               uint32_t timeLow, uint32_t timeHigh)
 {
-    Send(wire::Kind::Data, [&](wire::Out &out) {
+    m_queue.Push(wire::Kind::Data, [&](wire::Out &out) {
         out.U32(IdOf(cookie));
         out.U32(flags);
         out.Value(*value);
@@ -309,7 +230,7 @@ HRESULT STDMETHODCALLTYPE NodeSession::OnData(void *cookie, uint32_t flags, cons
 
 HRESULT STDMETHODCALLTYPE NodeSession::OnAttributes(void *cookie, const CadroAttributes *attributes)
 {
-    Send(wire::Kind::Attributes, [&](wire::Out &out) {
+    m_queue.Push(wire::Kind::Attributes, [&](wire::Out &out) {
         out.U32(IdOf(cookie));
         out.U32(attributes->mask);
         out.U16(attributes->dataType);
@@ -320,7 +241,7 @@ HRESULT STDMETHODCALLTYPE NodeSession::OnAttributes(void *cookie, const CadroAtt
 
 HRESULT STDMETHODCALLTYPE NodeSession::StatusChange(void *cookie, uint32_t status, uint32_t, uint32_t)
 {
-    Send(wire::Kind::Status, [&](wire::Out &out) {
+    m_queue.Push(wire::Kind::Status, [&](wire::Out &out) {
         out.U32(IdOf(cookie));
         out.U32(status);
     });

@@ -4,8 +4,7 @@
 // gathered into batches (whatever came while the last batch was written goes
 // out in one write).
 #include "Engine.h"
-#include "PipeChannel.h"
-#include "Wire.h"
+#include "FrameQueue.h"
 
 #include <thread>
 #include <unordered_map>
@@ -21,7 +20,7 @@ public:
     // (the session then lets go of its subscriptions).
     void Finish();
     // Ends the connection at once.
-    void Close() { m_channel.Close(); }
+    void Close() { m_channel->Close(); }
     bool Ended() const { return m_ended; }
     // Waits for its threads; after Ended().
     void Join();
@@ -36,29 +35,23 @@ public:
 private:
     NodeSession(Engine &engine, HANDLE pipe, HANDLE ended);
     void ReadLoop();
-    void WriteLoop();
     bool Handle(wire::Kind kind, wire::In &in);
     void Subscribe(wire::In &in);
     void Unsubscribe(uint32_t id);
-    void Read(uint32_t request, uint32_t id);
     void List(uint32_t request, const std::wstring &url);
     CadroDataItem *Find(uint32_t id);
-    // Adds one frame to the next batch; fill writes its fields.
-    template <class Fill> void Send(wire::Kind kind, Fill fill);
+    // A reply: written by the reading thread itself, at once.
+    template <class Fill> void Reply(Fill fill);
     void ReleaseAll();
 
     Engine &m_engine;
-    PipeChannel m_channel;
+    std::shared_ptr<PipeChannel> m_channel;
     HANDLE m_endedEvent;
     std::atomic<bool> m_ended{false};
     SlimMutex m_subsLock;
     std::unordered_map<uint32_t, CadroDataItem *> m_subs;
-    SlimMutex m_outLock;
-    SlimCondition m_outReady;
-    wire::Out m_out;
-    bool m_stopWriting = false;
+    FrameQueue m_queue;
     std::thread m_reader;
-    std::thread m_writer;
 };
 
 } // namespace cadrosim

@@ -17,7 +17,6 @@ enum class Kind : uint8_t {
     Subscribe = 1, // id, flags (bit 0: answer with a Reply), url
     Unsubscribe,   // id
     Write,         // id, value
-    Read,          // request, id
     List,          // request, url
     Execute,       // request, command
     Load,          // request, description

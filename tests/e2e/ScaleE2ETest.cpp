@@ -1,6 +1,5 @@
 // Plant-size AddItems across the process boundary: 20,000 distinct items of
 // one network file, every result with its member's own type and rights.
-#include "CadroSim.h"
 #include "ComPtr.h"
 #include "Handle.h"
 #include "ItemDefinitions.h"
@@ -13,8 +12,6 @@
 #include <vector>
 
 namespace {
-const wchar_t kSimulatorKey[] = L"Software\\Tarnwell\\Cadro Simulator";
-const wchar_t kNetworkFile[] = L"Network File";
 
 // Member i: its type and access follow i, so each result can be checked.
 const char *const kTypes[] = {"number", "bool", "wtext"};
@@ -22,28 +19,34 @@ const VARTYPE kCanonical[] = {VT_R8, VT_BOOL, VT_BSTR};
 const char *const kAccess[] = {"rw", "r", "w"};
 const DWORD kRights[] = {3, 1, 2};
 
-// Points the simulated network at a file of its own while it lives: the
-// network node is started anew on it, and stopped after.
+// A network of the test's own, loaded into the network node while it lives;
+// then the node goes back to its configured description.
 class NetworkFile {
 public:
     explicit NetworkFile(const std::string &text) : m_path(BinPath(L"scale_e2e_network.txt"))
     {
-        CadroSim_StopNode();
         UniqueHandle file(CreateFileW(m_path.c_str(), GENERIC_WRITE, 0, nullptr, CREATE_ALWAYS, 0, nullptr));
         DWORD written = 0;
         m_ok = file && WriteFile(file.Get(), text.data(), static_cast<DWORD>(text.size()), &written, nullptr);
-        RegSetKeyValueW(HKEY_LOCAL_MACHINE, kSimulatorKey, kNetworkFile, REG_SZ, m_path.c_str(),
-                        static_cast<DWORD>((m_path.size() + 1) * sizeof(wchar_t)));
     }
     ~NetworkFile()
     {
-        CadroSim_StopNode();
-        RegDeleteKeyValueW(HKEY_LOCAL_MACHINE, kSimulatorKey, kNetworkFile);
+        std::string output;
+        RunCadroctl(L"reset", output);
         DeleteFileW(m_path.c_str());
     }
     NetworkFile(const NetworkFile &) = delete;
     NetworkFile &operator=(const NetworkFile &) = delete;
     bool Ok() const { return m_ok; }
+    // Into the node, which a server has started (or is starting).
+    long Load()
+    {
+        std::string output;
+        long code = -1;
+        for (int i = 0; i < 100 && code != 0; ++i, Sleep(100))
+            code = RunCadroctl(L"load \"" + m_path + L"\"", output);
+        return code;
+    }
 
 private:
     std::wstring m_path;
@@ -68,6 +71,7 @@ TEST(ScaleE2E, AddItemsOfTwentyThousandDistinctItemsGivesEachItsTypeAndRights)
         ASSERT_EQ(CoCreateInstance(CLSID_SkylarcOPCServerE2E, nullptr, CLSCTX_LOCAL_SERVER, IID_IOPCServer,
                                    reinterpret_cast<void **>(server.Out())),
                   S_OK);
+        ASSERT_EQ(network.Load(), 0);
         OPCHANDLE group = 0;
         DWORD rate = 0;
         ComPtr<IOPCItemMgt> items;

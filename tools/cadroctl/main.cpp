@@ -1,6 +1,6 @@
-// cadroctl: drives the simulated Cadro network of running programs (the OPC
-// server, tests) through their control pipes: publish values, change the
-// topology, inject faults, look at subscriptions.
+// cadroctl: drives the simulated Cadro network of running programs (the
+// network node, tests) through their control pipes: publish values, change
+// the topology, inject faults, look at subscriptions.
 #include "CadroSim.h"
 
 #include <tlhelp32.h>
@@ -39,13 +39,19 @@ const Help kHelp[] = {
     {L"list-subscriptions", L"list-subscriptions", L"Lists the data members that have subscribers, with counts."},
     {L"status", L"status", L"Shows the host, the network description in use and the machines' connections."},
     {L"reset", L"reset", L"Loads the network's description again: values, members and connections as described."},
+    {L"load", L"load <file>",
+     L"Replaces the network with the one a description file gives (subscriptions keep their old\n"
+     L"  members until they subscribe again); 'reset' goes back to the configured description."},
+    {L"shutdown", L"shutdown",
+     L"Ends the network node (cadronode). Servers see their subscriptions disconnected; the next one\n"
+     L"  that needs the network starts a new node."},
 };
 
 void PrintUsage()
 {
     wprintf(L"usage: cadroctl [--pid <process id>] <command> [arguments]\n\n"
-            L"Drives the simulated Cadro network of every running program that serves one (the OPC\n"
-            L"server among them) through its control pipe, or of one process with --pid.\n\n"
+            L"Drives the simulated Cadro network of every running program that serves one (the\n"
+            L"network node cadronode among them) through its control pipe, or of one process with --pid.\n\n"
             L"commands:\n");
     for (const Help &h : kHelp)
         wprintf(L"  %ls\n", h.usage);

@@ -1,0 +1,91 @@
+#include "FrameQueue.h"
+
+namespace cadrosim {
+
+void FrameQueue::Attach(std::shared_ptr<PipeChannel> channel)
+{
+    std::lock_guard<SlimMutex> l(m_lock);
+    m_out.Bytes().clear();
+    m_channel = std::move(channel);
+    m_stopping = false;
+    m_closeWhenWritten = false;
+    if (!m_thread.joinable())
+        m_thread = std::thread([this] { WriteLoop(); });
+}
+
+void FrameQueue::Detach()
+{
+    std::lock_guard<SlimMutex> l(m_lock);
+    m_channel.reset();
+    m_out.Bytes().clear();
+}
+
+void FrameQueue::Stop(bool drain)
+{
+    std::thread thread;
+    {
+        std::unique_lock<SlimMutex> l(m_lock);
+        if (!drain)
+            m_out.Bytes().clear();
+        m_stopping = true;
+        thread = std::move(m_thread);
+    }
+    m_ready.notify_all();
+    if (thread.joinable())
+        thread.join();
+}
+
+void FrameQueue::Flush()
+{
+    std::unique_lock<SlimMutex> l(m_lock);
+    if (m_writing)
+        return;
+    m_writing = true;
+    Drain(l);
+}
+
+void FrameQueue::Drain(std::unique_lock<SlimMutex> &l)
+{
+    std::string batch;
+    while (!m_out.Empty() && m_channel) {
+        std::shared_ptr<PipeChannel> channel = m_channel;
+        batch.swap(m_out.Bytes());
+        l.unlock();
+        if (!channel->Write(batch))
+            channel->Close(); // the reading side sees it and ends the connection
+        batch.clear();
+        l.lock();
+    }
+    m_writing = false;
+    if (m_closeWhenWritten && m_channel)
+        m_channel->Close();
+    m_idle.notify_all();
+}
+
+void FrameQueue::CloseWhenWritten()
+{
+    // Never writes from this thread: the other end may not be reading.
+    std::lock_guard<SlimMutex> l(m_lock);
+    m_closeWhenWritten = true;
+    if (m_channel && m_out.Empty() && !m_writing)
+        m_channel->Close();
+}
+
+void FrameQueue::WriteLoop()
+{
+    std::unique_lock<SlimMutex> l(m_lock);
+    for (;;) {
+        m_ready.wait(l, [this] { return m_stopping || (!m_out.Empty() && m_channel && !m_writing); });
+        if (m_stopping) {
+            // What is left is written unless a flush is writing it already.
+            m_idle.wait(l, [this] { return !m_writing; });
+            m_writing = true;
+            Drain(l);
+            return;
+        }
+        m_writing = true;
+        Drain(l);
+    }
+}
+
+} // namespace cadrosim

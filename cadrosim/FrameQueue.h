@@ -1,0 +1,74 @@
+#pragma once
+// Frames on their way into a pipe. Frames that nobody waits for are written
+// by the queue's own thread, in batches of whatever gathered during the
+// previous write; a thread that waits for an answer writes its request
+// itself (Flush), which spares the hand-over to the writing thread.
+#include "PipeChannel.h"
+#include "SlimSync.h"
+#include "Wire.h"
+
+#include <memory>
+#include <mutex>
+#include <thread>
+
+namespace cadrosim {
+
+class FrameQueue {
+public:
+    // A queue that holds more than limit bytes closes its pipe: the reader
+    // at the other end is hung.
+    explicit FrameQueue(size_t limit = SIZE_MAX) : m_limit(limit) {}
+    ~FrameQueue() { Stop(false); }
+    FrameQueue(const FrameQueue &) = delete;
+    FrameQueue &operator=(const FrameQueue &) = delete;
+
+    // Starts writing into channel (frames queued before are dropped).
+    void Attach(std::shared_ptr<PipeChannel> channel);
+    // Stops writing and drops what is queued.
+    void Detach();
+    // Ends the writing thread; with drain, what is queued is written first.
+    void Stop(bool drain);
+
+    // Queues one frame; false (and nothing queued) without a pipe.
+    template <class Fill> bool Push(wire::Kind kind, Fill fill)
+    {
+        std::lock_guard<SlimMutex> l(m_lock);
+        if (!m_channel)
+            return false;
+        bool wake = m_out.Empty();
+        m_out.Begin(kind);
+        fill(m_out);
+        m_out.End();
+        if (m_out.Bytes().size() > m_limit) {
+            m_channel->Close();
+            m_out.Bytes().clear();
+            return false;
+        }
+        if (wake)
+            m_ready.notify_one();
+        return true;
+    }
+    // Writes what is queued from this thread, unless a write is under way
+    // (which then takes it along).
+    void Flush();
+    // Closes the pipe once everything queued has been written.
+    void CloseWhenWritten();
+
+private:
+    void WriteLoop();
+    // Under l: writes batches until the queue is empty; m_writing is ours.
+    void Drain(std::unique_lock<SlimMutex> &l);
+
+    size_t m_limit;
+    SlimMutex m_lock;
+    SlimCondition m_ready;
+    SlimCondition m_idle;
+    wire::Out m_out;
+    std::shared_ptr<PipeChannel> m_channel;
+    bool m_writing = false;
+    bool m_stopping = false;
+    bool m_closeWhenWritten = false;
+    std::thread m_thread;
+};
+
+} // namespace cadrosim
