@@ -1,0 +1,86 @@
+// The frames between the libraries and the network node: what one side
+// writes the other reads back, and a peer that sends garbage or half a frame
+// is never read past.
+#include "Wire.h"
+
+#include <gtest/gtest.h>
+
+#include <cstring>
+#include <vector>
+
+using namespace cadrosim;
+
+TEST(Wire, FramesRoundTripAndBadOnesAreRefused)
+{
+    wire::Out out;
+    out.Begin(wire::Kind::Subscribe);
+    out.U32(7);
+    out.U32(0x00400001);
+    out.Text(L"\\\\HOST\\proc1\\Setpoints.temperature");
+    out.End();
+    out.Begin(wire::Kind::Data);
+    CadroValue number = {};
+    number.type = kCadroNumber;
+    number.number = 22.5;
+    out.Value(number);
+    out.End();
+    std::string bytes = out.Bytes();
+
+    // Delivered one byte at a time, the frames come out whole and in order.
+    std::string buffer;
+    size_t consumed = 0;
+    std::vector<wire::Kind> kinds;
+    std::wstring url;
+    double value = 0;
+    for (char c : bytes) {
+        buffer.push_back(c);
+        ASSERT_TRUE(wire::TakeFrames(buffer, consumed, [&](wire::Kind kind, wire::In in) {
+            kinds.push_back(kind);
+            if (kind == wire::Kind::Subscribe) {
+                EXPECT_EQ(in.U32(), 7u);
+                EXPECT_EQ(in.U32(), 0x00400001u);
+                url = in.Text();
+            } else {
+                CadroValue v;
+                in.Value(v);
+                value = v.number;
+            }
+            EXPECT_TRUE(in.Ok());
+        }));
+    }
+    EXPECT_EQ(kinds, (std::vector<wire::Kind>{wire::Kind::Subscribe, wire::Kind::Data}));
+    EXPECT_EQ(url, L"\\\\HOST\\proc1\\Setpoints.temperature");
+    EXPECT_EQ(value, 22.5);
+    EXPECT_TRUE(buffer.empty());
+
+    // A text whose length runs past the frame, and fields read past its end.
+    wire::Out lying;
+    lying.Begin(wire::Kind::List);
+    lying.U32(1);
+    lying.U32(1000000); // characters announced, none sent
+    lying.End();
+    buffer = lying.Bytes();
+    consumed = 0;
+    bool handled = false;
+    ASSERT_TRUE(wire::TakeFrames(buffer, consumed, [&](wire::Kind, wire::In in) {
+        handled = true;
+        EXPECT_EQ(in.U32(), 1u);
+        EXPECT_TRUE(in.Text().empty());
+        EXPECT_FALSE(in.Ok());
+        EXPECT_EQ(in.U32(), 0u); // and stays refused
+    }));
+    EXPECT_TRUE(handled);
+
+    // A length no peer of ours would send: the connection is given up.
+    std::string garbage = "\xff\xff\xff\x7f"
+                          "abc";
+    consumed = 0;
+    EXPECT_FALSE(wire::TakeFrames(garbage, consumed, [](wire::Kind, wire::In) { FAIL(); }));
+    std::string empty("\0\0\0\0x", 5);
+    consumed = 0;
+    EXPECT_FALSE(wire::TakeFrames(empty, consumed, [](wire::Kind, wire::In) { FAIL(); }));
+
+    // The member URLs a listing lets a library subscribe to without asking.
+    EXPECT_EQ(wire::MemberUrl(L"\\\\H\\p\\Obj", L"cosine-Cosine wave"), L"\\\\H\\p\\Obj.cosine");
+    EXPECT_EQ(wire::MemberUrl(L"\\\\H\\p\\Obj", L"(implicit)"), L"\\\\H\\p\\Obj");
+}
