@@ -179,7 +179,6 @@ void ClearCadroValue(CadroValue &record)
     record.number = 0;
 }
 
-namespace {
 bool TextOf(const CadroValue &record, std::wstring &out)
 {
     out.clear();
@@ -204,7 +203,6 @@ bool TextOf(const CadroValue &record, std::wstring &out)
     narrow->Release();
     return true;
 }
-} // namespace
 
 bool FromCadroValue(const CadroValue &record, uint32_t memberType, SimValue &out)
 {

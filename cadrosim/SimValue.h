@@ -32,6 +32,9 @@ SimValue FromNumber(uint32_t type, double n);
 // with ClearCadroValue.
 bool ToCadroValue(const SimValue &value, CadroValue &record);
 void ClearCadroValue(CadroValue &record);
+// The characters of a text record (narrow ones widened); false when its
+// object is not the text its type says.
+bool TextOf(const CadroValue &record, std::wstring &out);
 // Converts a written record into the member's type; false when it cannot.
 bool FromCadroValue(const CadroValue &record, uint32_t memberType, SimValue &out);
 

@@ -1,5 +1,6 @@
 #include "Wire.h"
 
+#include "SimValue.h"
 #include "TextObject.h"
 
 #include <cstring>
@@ -31,21 +32,7 @@ void Out::Value(const CadroValue &value)
     if (value.type & kCadroTextBit) {
         // Texts travel as wide characters whatever the object's width.
         std::wstring chars;
-        ICadroWideText *wide = nullptr;
-        ICadroNarrowText *narrow = nullptr;
-        if (value.text &&
-            SUCCEEDED(value.text->QueryInterface(__uuidof(ICadroWideText), reinterpret_cast<void **>(&wide)))) {
-            chars = wide->Chars();
-            wide->Release();
-        } else if (value.text && SUCCEEDED(value.text->QueryInterface(__uuidof(ICadroNarrowText),
-                                                                      reinterpret_cast<void **>(&narrow)))) {
-            const char *c = narrow->Chars();
-            int n = MultiByteToWideChar(CP_ACP, 0, c, -1, nullptr, 0);
-            chars.assign(n > 0 ? n - 1 : 0, L'\0');
-            if (n > 1)
-                MultiByteToWideChar(CP_ACP, 0, c, -1, chars.data(), n);
-            narrow->Release();
-        }
+        TextOf(value, chars);
         Text(chars);
     } else if (value.type == kCadroBoolean) {
         U8(value.boolean);
