@@ -11,13 +11,6 @@ constexpr unsigned kShardCount = 2;
 const HRESULT kUnknownUrl = HRESULT_FROM_WIN32(ERROR_NOT_FOUND);
 const HRESULT kNotConnected = HRESULT_FROM_WIN32(ERROR_NOT_CONNECTED);
 
-std::wstring LocalHostName()
-{
-    wchar_t name[MAX_COMPUTERNAME_LENGTH + 1];
-    DWORD size = MAX_COMPUTERNAME_LENGTH + 1;
-    return GetComputerNameW(name, &size) ? std::wstring(name, size) : std::wstring(L"LOCALHOST");
-}
-
 // The description a user named: environment variable CADRO_NETWORK_FILE, else
 // the registry value "Network File" of HKLM\Software\Tarnwell\Cadro Simulator.
 std::wstring NetworkFilePath()
@@ -34,6 +27,18 @@ std::wstring NetworkFilePath()
 }
 
 } // namespace
+
+// Asked once per subscription (to expand "\\.\"): read from the system once,
+// since GetComputerNameW reads the registry each time.
+const std::wstring &LocalHostName()
+{
+    static const std::wstring host = [] {
+        wchar_t name[MAX_COMPUTERNAME_LENGTH + 1];
+        DWORD size = MAX_COMPUTERNAME_LENGTH + 1;
+        return GetComputerNameW(name, &size) ? std::wstring(name, size) : std::wstring(L"LOCALHOST");
+    }();
+    return host;
+}
 
 bool ReadTextFile(const std::wstring &path, std::wstring &text)
 {

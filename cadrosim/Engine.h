@@ -21,6 +21,8 @@ namespace cadrosim {
 
 class Engine;
 
+// This machine's name, read once.
+const std::wstring &LocalHostName();
 // A text file in UTF-8; false when it cannot be read.
 bool ReadTextFile(const std::wstring &path, std::wstring &text);
 

@@ -37,18 +37,6 @@ void ReleaseUse()
         NodeLink::Instance().ReleaseUse();
 }
 
-// Asked once per subscription (to expand "\\.\"): read from the system once,
-// since GetComputerNameW reads the registry each time.
-const std::wstring &LocalHostName()
-{
-    static const std::wstring host = [] {
-        wchar_t name[MAX_COMPUTERNAME_LENGTH + 1];
-        DWORD size = MAX_COMPUTERNAME_LENGTH + 1;
-        return GetComputerNameW(name, &size) ? std::wstring(name, size) : std::wstring(L"LOCALHOST");
-    }();
-    return host;
-}
-
 class CRealTime : public CSimUnknown<CadroRealTime> {
 public:
     explicit CRealTime(ICadroRealTimeReceiver *receiver) : m_receiver(receiver)
@@ -157,8 +145,8 @@ HRESULT CadroSim_HostName(BSTR *out)
 {
     if (!out)
         return E_POINTER;
-    // The node runs on this machine: its host name is this one's.
-    *out = SysAllocString(Embedded() ? Engine::Instance().HostName().c_str() : LocalHostName().c_str());
+    // The engine, here or in the node, runs on this machine.
+    *out = SysAllocString(LocalHostName().c_str());
     return *out ? S_OK : E_OUTOFMEMORY;
 }
 
