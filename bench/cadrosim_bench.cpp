@@ -2,13 +2,21 @@
 // object of many constant members (10,000 and 100,000), then 100,000
 // concurrent subscriptions and the rate of value updates delivered to a
 // receiver that does nothing.
+//
+// Usage: cadrosim_bench [--node] [members] [subscriptions] [period-ms]
+// With --node the network is the network node's (started when none runs),
+// reached over its pipe as a server process reaches it; the processor time
+// of this process and of the node is printed per update.
 #include "CadroSim.h"
+#include "ProcessTimes.h"
 
 #include <psapi.h>
+#include <tlhelp32.h>
 
 #include <atomic>
 #include <chrono>
 #include <cstdio>
+#include <cstring>
 #include <string>
 #include <vector>
 
@@ -45,11 +53,31 @@ double WorkingSetMiB()
     GetProcessMemoryInfo(GetCurrentProcess(), &pmc, sizeof pmc);
     return pmc.WorkingSetSize / (1024.0 * 1024.0);
 }
+
+DWORD NodeProcessId()
+{
+    HANDLE snapshot = CreateToolhelp32Snapshot(TH32CS_SNAPPROCESS, 0);
+    PROCESSENTRY32W entry = {};
+    entry.dwSize = sizeof entry;
+    DWORD pid = 0;
+    for (BOOL more = Process32FirstW(snapshot, &entry); more && !pid; more = Process32NextW(snapshot, &entry))
+        if (_wcsicmp(entry.szExeFile, L"cadronode.exe") == 0)
+            pid = entry.th32ProcessID;
+    CloseHandle(snapshot);
+    return pid;
+}
+
 } // namespace
 
 int main(int argc, char **argv)
 {
-    CadroSim_UseEmbeddedNetwork(); // the network of the objects made in this process
+    const bool node = argc > 1 && strcmp(argv[1], "--node") == 0;
+    if (node) {
+        --argc;
+        ++argv;
+    } else {
+        CadroSim_UseEmbeddedNetwork(); // the network of the objects made in this process
+    }
     const int members = argc > 1 ? atoi(argv[1]) : 1000;
     const int subscriptions = argc > 2 ? atoi(argv[2]) : 100000;
     const int period = argc > 3 ? atoi(argv[3]) : 10;
@@ -73,8 +101,24 @@ int main(int argc, char **argv)
     CadroRealTime *realTime = nullptr;
     if (!NewCadroRealTime(0, &receiver, &realTime))
         return 1;
+    if (node) {
+        // A request and its answer: what a subscription that nobody listed
+        // before waits for.
+        const int requests = 1000;
+        start = Clock::now();
+        for (int i = 0; i < requests; ++i) {
+            BSTR answer = nullptr;
+            CadroSim_Execute(L"no-such-command", &answer);
+            SysFreeString(answer);
+        }
+        printf("round trip to the node: %.1f us\n", Seconds(start) * 1e6 / requests);
+    }
     SubscribeOptions options = {13, 7, 0, 0, 0};
+    // Through the node each of these subscriptions waits for the node's
+    // answer (nothing listed the object first): 100,000 would take minutes.
     for (int count : {10000, quietMembers}) {
+        if (node && count > 10000)
+            break;
         std::vector<CadroDataItem *> quiet(count);
         start = Clock::now();
         for (int i = 0; i < count; ++i) {
@@ -110,20 +154,34 @@ int main(int argc, char **argv)
            subscriptions / subscribeSeconds, WorkingSetMiB() - baseMiB);
 
     Sleep(1000); // every subscription active and delivering
+    HANDLE nodeProcess = node ? OpenProcess(PROCESS_QUERY_LIMITED_INFORMATION, FALSE, NodeProcessId()) : nullptr;
     for (int run = 0; run < 3; ++run) {
         unsigned long long before = receiver.updates.load();
+        double selfBefore = ProcessCpuSeconds(GetCurrentProcess()), nodeBefore = ProcessCpuSeconds(nodeProcess);
         start = Clock::now();
         Sleep(2000);
         double seconds = Seconds(start);
         unsigned long long delivered = receiver.updates.load() - before;
-        printf("deliver:    %llu updates in %.2f s = %.0f updates per second (demand %.0f)\n", delivered, seconds,
+        printf("deliver:    %llu updates in %.2f s = %.0f updates per second (demand %.0f)", delivered, seconds,
                delivered / seconds, 1000.0 / period * subscriptions);
+        if (node && delivered)
+            printf(", processor per update: %.3f us here, %.3f us in the node",
+                   (ProcessCpuSeconds(GetCurrentProcess()) - selfBefore) * 1e6 / delivered,
+                   (ProcessCpuSeconds(nodeProcess) - nodeBefore) * 1e6 / delivered);
+        printf("\n");
     }
+    if (nodeProcess)
+        CloseHandle(nodeProcess);
 
     start = Clock::now();
     for (CadroDataItem *item : items)
         item->Release();
     printf("release:    %d in %.3f s\n", subscriptions, Seconds(start));
     realTime->Release();
+    if (node) {
+        BSTR answer = nullptr;
+        CadroSim_Execute(L"reset", &answer); // the node's own network again
+        SysFreeString(answer);
+    }
     return 0;
 }

@@ -16,6 +16,7 @@
 #include "GroupState.h"
 #include "Handle.h"
 #include "OPCGroup.h"
+#include "ProcessTimes.h"
 #include "opcda.h"
 
 #include <algorithm>
@@ -101,18 +102,6 @@ Group MakeGroup(IOPCServer *server, DWORD rate, const wchar_t *id, DWORD count, 
     return g;
 }
 
-// Processor time (kernel and user) a process has used so far, in seconds.
-double CpuSeconds(HANDLE process)
-{
-    FILETIME created, exited, kernel, user;
-    if (!process || !GetProcessTimes(process, &created, &exited, &kernel, &user))
-        return 0;
-    auto seconds = [](const FILETIME &t) {
-        return ((static_cast<ULONGLONG>(t.dwHighDateTime) << 32) | t.dwLowDateTime) / 1e7;
-    };
-    return seconds(kernel) + seconds(user);
-}
-
 struct Delivery {
     unsigned long long items = 0;
     double seconds = 0;
@@ -128,12 +117,12 @@ void MeasureWindow(CountingSink *sink, HANDLE process, DWORD warmUpMs, DWORD win
 {
     Sleep(warmUpMs);
     unsigned long long before = sink->items;
-    double cpuBefore = CpuSeconds(process);
+    double cpuBefore = ProcessCpuSeconds(process);
     auto start = Clock::now();
     Sleep(windowMs);
     d.items += sink->items - before;
     d.seconds += std::chrono::duration<double>(Clock::now() - start).count();
-    d.cpuSeconds += CpuSeconds(process) - cpuBefore;
+    d.cpuSeconds += ProcessCpuSeconds(process) - cpuBefore;
 }
 
 // Our side: an active group of n items that all change every 10 ms scan
@@ -366,10 +355,10 @@ int wmain(int argc, wchar_t **argv)
         group = static_cast<COPCGroup *>(state.Get());
         // What the network's updates cost the process meanwhile: the group is
         // not scanned, every item gets a value every 10 ms.
-        double cpu0 = CpuSeconds(GetCurrentProcess());
+        double cpu0 = ProcessCpuSeconds(GetCurrentProcess());
         Sleep(2000);
         printf("network update of an item, processor time: %.1f ns (%lu items every 10 ms)\n",
-               (CpuSeconds(GetCurrentProcess()) - cpu0) * 1e9 / (200.0 * n), static_cast<unsigned long>(n));
+               (ProcessCpuSeconds(GetCurrentProcess()) - cpu0) * 1e9 / (200.0 * n), static_cast<unsigned long>(n));
         double changedNs = 0;
         for (int i = 0; i < 50; ++i) {
             Sleep(15);

@@ -5,7 +5,7 @@ namespace cadrosim {
 void FrameQueue::Attach(std::shared_ptr<PipeChannel> channel)
 {
     std::lock_guard<SlimMutex> l(m_lock);
-    m_out.Bytes().clear();
+    m_out.Clear();
     m_channel = std::move(channel);
     m_stopping = false;
     m_closeWhenWritten = false;
@@ -13,11 +13,38 @@ void FrameQueue::Attach(std::shared_ptr<PipeChannel> channel)
         m_thread = std::thread([this] { WriteLoop(); });
 }
 
+bool FrameQueue::Queued(bool wake)
+{
+    if (m_out.Size() > m_limit) {
+        m_channel->Close();
+        m_out.Clear();
+        return false;
+    }
+    if (wake)
+        m_ready.notify_one();
+    return true;
+}
+
+bool FrameQueue::PushId(wire::Kind kind, std::string_view fields, uint32_t id)
+{
+    std::lock_guard<SlimMutex> l(m_lock);
+    if (!m_channel)
+        return false;
+    if (m_out.ExtendLast(kind, fields, id))
+        return Queued(false);
+    bool wake = m_out.Empty();
+    m_out.Begin(kind);
+    m_out.Raw(fields.data(), fields.size());
+    m_out.U32(id);
+    m_out.End();
+    return Queued(wake);
+}
+
 void FrameQueue::Detach()
 {
     std::lock_guard<SlimMutex> l(m_lock);
     m_channel.reset();
-    m_out.Bytes().clear();
+    m_out.Clear();
 }
 
 void FrameQueue::Stop(bool drain)
@@ -26,7 +53,7 @@ void FrameQueue::Stop(bool drain)
     {
         std::unique_lock<SlimMutex> l(m_lock);
         if (!drain)
-            m_out.Bytes().clear();
+            m_out.Clear();
         m_stopping = true;
         thread = std::move(m_thread);
     }
@@ -49,7 +76,7 @@ void FrameQueue::Drain(std::unique_lock<SlimMutex> &l)
     std::string batch;
     while (!m_out.Empty() && m_channel) {
         std::shared_ptr<PipeChannel> channel = m_channel;
-        batch.swap(m_out.Bytes());
+        m_out.Take(batch);
         l.unlock();
         if (!channel->Write(batch))
             channel->Close(); // the reading side sees it and ends the connection

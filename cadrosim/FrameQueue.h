@@ -39,15 +39,12 @@ public:
         m_out.Begin(kind);
         fill(m_out);
         m_out.End();
-        if (m_out.Bytes().size() > m_limit) {
-            m_channel->Close();
-            m_out.Bytes().clear();
-            return false;
-        }
-        if (wake)
-            m_ready.notify_one();
-        return true;
+        return Queued(wake);
     }
+    // Queues id under fields as a frame of kind, one of ids that share
+    // them: added to the last frame queued when that has the same fields (a
+    // value delivered to many subscriptions travels once).
+    bool PushId(wire::Kind kind, std::string_view fields, uint32_t id);
     // Writes what is queued from this thread, unless a write is under way
     // (which then takes it along).
     void Flush();
@@ -55,6 +52,9 @@ public:
     void CloseWhenWritten();
 
 private:
+    // Under the lock, after a frame was added: wakes the writer, or closes a
+    // pipe whose reader has fallen too far behind.
+    bool Queued(bool wake);
     void WriteLoop();
     // Under l: writes batches until the queue is empty; m_writing is ours.
     void Drain(std::unique_lock<SlimMutex> &l);

@@ -405,17 +405,20 @@ void NodeLink::Dispatch(wire::Kind kind, wire::In &in)
 {
     switch (kind) {
     case wire::Kind::Data: {
-        uint32_t id = in.U32();
         uint32_t flags = in.U32();
         CadroValue value;
         in.Value(value);
         int32_t error = static_cast<int32_t>(in.U32());
         uint32_t low = in.U32();
         uint32_t high = in.U32();
-        if (in.Ok())
-            CallSubscription(
-                id, [&](RemoteSubscription &sub) { sub.receiver->OnData(sub.cookie, flags, &value, error, low, high); },
-                [&](RemoteSubscription &sub) { sub.Remember(flags, value, error, low, high); });
+        while (in.Ok() && !in.AtEnd()) {
+            uint32_t id = in.U32();
+            if (in.Ok())
+                CallSubscription(
+                    id,
+                    [&](RemoteSubscription &sub) { sub.receiver->OnData(sub.cookie, flags, &value, error, low, high); },
+                    [&](RemoteSubscription &sub) { sub.Remember(flags, value, error, low, high); });
+        }
         ClearCadroValue(value);
         return;
     }

@@ -217,14 +217,16 @@ void NodeSession::TopologyChanged()
 HRESULT STDMETHODCALLTYPE NodeSession::OnData(void *cookie, uint32_t flags, const CadroValue *value, int32_t errorFlag,
                                               uint32_t timeLow, uint32_t timeHigh)
 {
-    m_queue.Push(wire::Kind::Data, [&](wire::Out &out) {
-        out.U32(IdOf(cookie));
-        out.U32(flags);
-        out.Value(*value);
-        out.U32(static_cast<uint32_t>(errorFlag));
-        out.U32(timeLow);
-        out.U32(timeHigh);
-    });
+    // A member's new value goes to its subscriptions one after the other:
+    // they share one frame, which carries the value once.
+    thread_local wire::Out fields;
+    fields.Clear();
+    fields.U32(flags);
+    fields.Value(*value);
+    fields.U32(static_cast<uint32_t>(errorFlag));
+    fields.U32(timeLow);
+    fields.U32(timeHigh);
+    m_queue.PushId(wire::Kind::Data, fields.View(), IdOf(cookie));
     return S_OK;
 }
 

@@ -20,6 +20,32 @@ void Out::End()
     memcpy(&m_bytes[m_frameStart], &length, 4);
 }
 
+bool Out::ExtendLast(Kind kind, std::string_view fields, uint32_t id)
+{
+    // The fields describe their own length (a value says its type), so a
+    // frame whose first bytes equal them has exactly these fields.
+    if (m_frameStart == SIZE_MAX || m_bytes.size() < m_frameStart + 5 + fields.size() ||
+        static_cast<uint8_t>(m_bytes[m_frameStart + 4]) != static_cast<uint8_t>(kind) ||
+        m_bytes.compare(m_frameStart + 5, fields.size(), fields) != 0)
+        return false;
+    U32(id);
+    End();
+    return true;
+}
+
+void Out::Clear()
+{
+    m_bytes.clear();
+    m_frameStart = SIZE_MAX;
+}
+
+void Out::Take(std::string &into)
+{
+    into.clear();
+    into.swap(m_bytes);
+    m_frameStart = SIZE_MAX;
+}
+
 void Out::Text(std::wstring_view text)
 {
     U32(static_cast<uint32_t>(text.size()));

@@ -22,7 +22,7 @@ enum class Kind : uint8_t {
     Load,          // request, description
     // Node → library.
     Reply = 64, // request, then what the request asked for
-    Data,       // id, flags, value, error flag, time low, time high
+    Data,       // flags, value, error flag, time low, time high, then ids to the end
     Attributes, // id, data type, access
     Status,     // id, status
     Topology,   // the network's topology changed
@@ -55,14 +55,22 @@ public:
     void F64(double v) { Raw(&v, 8); }
     void Text(std::wstring_view text);
     void Value(const CadroValue &value);
+    void Raw(const void *p, size_t n) { m_bytes.append(static_cast<const char *>(p), n); }
 
-    std::string &Bytes() { return m_bytes; }
+    // Adds id to the last frame when it is a frame of kind that starts with
+    // fields (a frame of ids that share them); false when it is not.
+    bool ExtendLast(Kind kind, std::string_view fields, uint32_t id);
+
+    size_t Size() const { return m_bytes.size(); }
+    std::string_view View() const { return m_bytes; }
     bool Empty() const { return m_bytes.empty(); }
+    void Clear();
+    // Hands the bytes over, leaving this empty.
+    void Take(std::string &into);
 
 private:
-    void Raw(const void *p, size_t n) { m_bytes.append(static_cast<const char *>(p), n); }
     std::string m_bytes;
-    size_t m_frameStart = 0;
+    size_t m_frameStart = SIZE_MAX; // of the last frame begun, while it is here
 };
 
 class In {
@@ -76,6 +84,7 @@ public:
     // A text value gets a new text object, which the caller clears.
     void Value(CadroValue &value);
     bool Ok() const { return m_ok; }
+    bool AtEnd() const { return m_p == m_end; }
     // What is left of the frame.
     std::string Rest() const { return std::string(m_p, m_end); }
 

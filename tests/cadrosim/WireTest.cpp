@@ -18,13 +18,27 @@ TEST(Wire, FramesRoundTripAndBadOnesAreRefused)
     out.U32(0x00400001);
     out.Text(L"\\\\HOST\\proc1\\Setpoints.temperature");
     out.End();
-    out.Begin(wire::Kind::Data);
+    // A value for two subscriptions travels once, in one frame of both ids;
+    // another value, or a frame after the batch was handed over, starts anew.
     CadroValue number = {};
     number.type = kCadroNumber;
     number.number = 22.5;
-    out.Value(number);
+    wire::Out fields;
+    fields.Value(number);
+    EXPECT_FALSE(out.ExtendLast(wire::Kind::Data, fields.View(), 1)); // the last frame is a Subscribe
+    out.Begin(wire::Kind::Data);
+    out.Raw(fields.View().data(), fields.View().size());
+    out.U32(1);
     out.End();
-    std::string bytes = out.Bytes();
+    EXPECT_TRUE(out.ExtendLast(wire::Kind::Data, fields.View(), 2));
+    wire::Out other;
+    number.number = 22.25;
+    other.Value(number);
+    EXPECT_FALSE(out.ExtendLast(wire::Kind::Data, other.View(), 3));
+    std::string bytes;
+    out.Take(bytes);
+    number.number = 22.5;
+    EXPECT_FALSE(out.ExtendLast(wire::Kind::Data, fields.View(), 3));
 
     // Delivered one byte at a time, the frames come out whole and in order.
     std::string buffer;
@@ -32,6 +46,7 @@ TEST(Wire, FramesRoundTripAndBadOnesAreRefused)
     std::vector<wire::Kind> kinds;
     std::wstring url;
     double value = 0;
+    std::vector<uint32_t> ids;
     for (char c : bytes) {
         buffer.push_back(c);
         ASSERT_TRUE(wire::TakeFrames(buffer, consumed, [&](wire::Kind kind, wire::In in) {
@@ -44,6 +59,8 @@ TEST(Wire, FramesRoundTripAndBadOnesAreRefused)
                 CadroValue v;
                 in.Value(v);
                 value = v.number;
+                while (in.Ok() && !in.AtEnd())
+                    ids.push_back(in.U32());
             }
             EXPECT_TRUE(in.Ok());
         }));
@@ -51,6 +68,7 @@ TEST(Wire, FramesRoundTripAndBadOnesAreRefused)
     EXPECT_EQ(kinds, (std::vector<wire::Kind>{wire::Kind::Subscribe, wire::Kind::Data}));
     EXPECT_EQ(url, L"\\\\HOST\\proc1\\Setpoints.temperature");
     EXPECT_EQ(value, 22.5);
+    EXPECT_EQ(ids, (std::vector<uint32_t>{1, 2}));
     EXPECT_TRUE(buffer.empty());
 
     // A text whose length runs past the frame, and fields read past its end.
@@ -59,7 +77,7 @@ TEST(Wire, FramesRoundTripAndBadOnesAreRefused)
     lying.U32(1);
     lying.U32(1000000); // characters announced, none sent
     lying.End();
-    buffer = lying.Bytes();
+    lying.Take(buffer);
     consumed = 0;
     bool handled = false;
     ASSERT_TRUE(wire::TakeFrames(buffer, consumed, [&](wire::Kind, wire::In in) {

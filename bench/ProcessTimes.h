@@ -1,0 +1,8 @@
+#pragma once
+// Processor time of a process, for the benchmarks' figures per item.
+#include <windows.h>
+
+// Kernel and user time a process has used so far, in seconds; 0 when it is
+// not found. Read from the system's process list: under Wine,
+// GetProcessTimes answers with the calling process's times for any handle.
+double ProcessCpuSeconds(HANDLE process);
