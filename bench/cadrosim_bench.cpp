@@ -92,7 +92,7 @@ int main(int argc, char **argv)
     BSTR error = nullptr;
     auto start = Clock::now();
     if (CadroSim_Load(description.c_str(), &error) != S_OK) {
-        fwprintf(stderr, L"load failed: %ls\n", error);
+        fwprintf(stderr, L"load failed after %.1f s: %ls\n", Seconds(start), error);
         return 1;
     }
     printf("network: %d + %d members loaded in %.3f s\n", members, quietMembers, Seconds(start));
@@ -164,10 +164,12 @@ int main(int argc, char **argv)
         unsigned long long delivered = receiver.updates.load() - before;
         printf("deliver:    %llu updates in %.2f s = %.0f updates per second (demand %.0f)", delivered, seconds,
                delivered / seconds, 1000.0 / period * subscriptions);
-        if (node && delivered)
-            printf(", processor per update: %.3f us here, %.3f us in the node",
-                   (ProcessCpuSeconds(GetCurrentProcess()) - selfBefore) * 1e6 / delivered,
-                   (ProcessCpuSeconds(nodeProcess) - nodeBefore) * 1e6 / delivered);
+        if (delivered) {
+            printf(", processor per update: %.3f us here",
+                   (ProcessCpuSeconds(GetCurrentProcess()) - selfBefore) * 1e6 / delivered);
+            if (node)
+                printf(", %.3f us in the node", (ProcessCpuSeconds(nodeProcess) - nodeBefore) * 1e6 / delivered);
+        }
         printf("\n");
     }
     if (nodeProcess)

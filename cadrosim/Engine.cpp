@@ -152,9 +152,9 @@ void Engine::AssignShards()
     });
 }
 
-double Engine::ElapsedMs() const
+double Engine::ElapsedMs(std::chrono::steady_clock::time_point now) const
 {
-    return std::chrono::duration<double, std::milli>(std::chrono::steady_clock::now() - m_epoch).count();
+    return std::chrono::duration<double, std::milli>(now - m_epoch).count();
 }
 
 void Engine::AddUse()

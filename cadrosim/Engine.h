@@ -94,7 +94,15 @@ private:
     // Between units: deletes, with the lock released, the subscriptions
     // released from inside callbacks that nothing refers to any more.
     void Sweep(std::unique_lock<SlimMutex> &l);
-    void Tick(std::unique_lock<SlimMutex> &l, const std::shared_ptr<Member> &member, Clock::time_point at);
+    // The clocks of the moment a batch of ticks began, read once for all
+    // of them: under Wine each reading is a call into the system's side.
+    struct Moment {
+        Clock::time_point now;
+        double elapsedMs;
+        FILETIME time;
+    };
+    void Tick(std::unique_lock<SlimMutex> &l, const std::shared_ptr<Member> &member, Clock::time_point at,
+              const Moment &moment);
     void Dispatch(std::unique_lock<SlimMutex> &l, Event e);
     // Runs callbacks with the lock released (always inside a unit).
     template <class F> void Deliver(std::unique_lock<SlimMutex> &l, F callbacks);
@@ -110,6 +118,7 @@ private:
     std::deque<Event> m_events;
     std::priority_queue<Due, std::vector<Due>, std::greater<Due>> m_heap;
     std::vector<Subscription *> m_graveyard;
+    std::vector<Subscription *> m_targets; // of the tick under way
     // Units of work of the shard's thread begun and ended: a release from
     // another thread waits only for the unit in flight when it detached
     // (which may still read the subscription after a batch of callbacks),
@@ -152,7 +161,8 @@ public:
     bool Load(const std::wstring &description, std::wstring &error);
 
     const std::wstring &HostName() const { return m_host; }
-    double ElapsedMs() const;
+    double ElapsedMs() const { return ElapsedMs(std::chrono::steady_clock::now()); }
+    double ElapsedMs(std::chrono::steady_clock::time_point now) const;
     unsigned NextShard() { return m_nextShard++ % m_shards.size(); }
     std::mt19937 &Random() { return m_random; }
 

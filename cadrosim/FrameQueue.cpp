@@ -73,7 +73,9 @@ void FrameQueue::Flush()
 
 void FrameQueue::Drain(std::unique_lock<SlimMutex> &l)
 {
-    std::string batch;
+    // Only one drain runs at a time (m_writing): the batch's buffer is kept
+    // from one to the next, and goes back to the queue at each exchange.
+    std::string &batch = m_batch;
     while (!m_out.Empty() && m_channel) {
         std::shared_ptr<PipeChannel> channel = m_channel;
         m_out.Take(batch);

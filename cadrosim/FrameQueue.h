@@ -64,6 +64,7 @@ private:
     SlimCondition m_ready;
     SlimCondition m_idle;
     wire::Out m_out;
+    std::string m_batch; // being written
     std::shared_ptr<PipeChannel> m_channel;
     bool m_writing = false;
     bool m_stopping = false;

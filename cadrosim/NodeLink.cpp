@@ -329,8 +329,11 @@ void NodeLink::Serve(PipeChannel &channel)
     std::string buffer;
     size_t consumed = 0;
     bool fine = true;
-    while (fine && channel.Read(buffer))
+    while (fine && channel.Read(buffer)) {
         fine = wire::TakeFrames(buffer, consumed, [&](wire::Kind kind, wire::In in) { Dispatch(kind, in); });
+        DeliverData();
+    }
+    DeliverData();
     channel.Close();
 }
 
@@ -387,41 +390,65 @@ template <class Call, class Note> void NodeLink::CallSubscription(uint32_t id, C
         if (!sub)
             return;
         note(*sub);
-        m_inCallback = sub;
+        sub->Pin();
     }
-    call(*sub);
-    RemoteSubscription *dead;
+    sub->Deliver(call, m_callWaiters, m_lock, m_callReturned);
+    sub->Unpin();
+}
+
+void NodeLink::TakeData(wire::In &in)
+{
+    DataFields f;
+    f.flags = in.U32();
+    in.Value(f.value);
+    f.error = static_cast<int32_t>(in.U32());
+    f.low = in.U32();
+    f.high = in.U32();
+    auto index = static_cast<uint32_t>(m_batchFields.size());
+    m_batchFields.push_back(f);
+    while (in.Ok() && !in.AtEnd()) {
+        uint32_t id = in.U32();
+        if (in.Ok())
+            m_batchIds.emplace_back(id, index);
+    }
+}
+
+void NodeLink::DeliverData()
+{
+    if (m_batchFields.empty())
+        return;
     {
         std::lock_guard<SlimMutex> l(m_lock);
-        m_inCallback = nullptr;
-        dead = std::exchange(m_deleteAfterCallback, nullptr);
+        for (auto [id, index] : m_batchIds)
+            if (RemoteSubscription *sub = Lookup(id)) {
+                const DataFields &f = m_batchFields[index];
+                sub->Remember(f.flags, f.value, f.error, f.low, f.high);
+                sub->Pin();
+                m_batchSubs.emplace_back(sub, index);
+            }
     }
-    m_callbackDone.notify_all();
-    if (dead)
-        dead->Delete();
+    for (auto [sub, index] : m_batchSubs) {
+        const DataFields &f = m_batchFields[index];
+        sub->Deliver(
+            [&](RemoteSubscription &s) { s.receiver->OnData(s.cookie, f.flags, &f.value, f.error, f.low, f.high); },
+            m_callWaiters, m_lock, m_callReturned);
+        sub->Unpin();
+    }
+    for (DataFields &f : m_batchFields)
+        ClearCadroValue(f.value);
+    m_batchFields.clear();
+    m_batchIds.clear();
+    m_batchSubs.clear();
 }
 
 void NodeLink::Dispatch(wire::Kind kind, wire::In &in)
 {
-    switch (kind) {
-    case wire::Kind::Data: {
-        uint32_t flags = in.U32();
-        CadroValue value;
-        in.Value(value);
-        int32_t error = static_cast<int32_t>(in.U32());
-        uint32_t low = in.U32();
-        uint32_t high = in.U32();
-        while (in.Ok() && !in.AtEnd()) {
-            uint32_t id = in.U32();
-            if (in.Ok())
-                CallSubscription(
-                    id,
-                    [&](RemoteSubscription &sub) { sub.receiver->OnData(sub.cookie, flags, &value, error, low, high); },
-                    [&](RemoteSubscription &sub) { sub.Remember(flags, value, error, low, high); });
-        }
-        ClearCadroValue(value);
+    if (kind == wire::Kind::Data) {
+        TakeData(in);
         return;
     }
+    DeliverData(); // what came before this frame, first
+    switch (kind) {
     case wire::Kind::Attributes: {
         uint32_t id = in.U32();
         CadroAttributes a = {};
@@ -610,15 +637,21 @@ HRESULT NodeLink::Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeRece
     l.lock();
     Forget(sub, l);
     l.unlock();
-    sub->Delete();
+    sub->Unpin();
     return hr;
 }
 
 void NodeLink::Forget(RemoteSubscription *sub, std::unique_lock<SlimMutex> &l)
 {
     Unregister(sub);
-    if (m_inCallback == sub && !OnLinkThread())
-        m_callbackDone.wait(l, [&] { return m_inCallback != sub; });
+    sub->Forgotten();
+    // The link's thread never waits: the call under way elsewhere keeps the
+    // object pinned, and a call of its own is further up its stack.
+    if (OnLinkThread())
+        return;
+    ++m_callWaiters;
+    m_callReturned.wait(l, [&] { return sub->Returned(); });
+    --m_callWaiters;
 }
 
 void NodeLink::Unsubscribe(RemoteSubscription *sub)
@@ -627,12 +660,8 @@ void NodeLink::Unsubscribe(RemoteSubscription *sub)
     uint32_t id = sub->id;
     Send(wire::Kind::Unsubscribe, [&](wire::Out &out) { out.U32(id); });
     Forget(sub, l);
-    if (m_inCallback == sub) {
-        m_deleteAfterCallback = sub; // released by its own callback
-        return;
-    }
     l.unlock();
-    sub->Delete();
+    sub->Unpin(); // deleted now, or by the last delivery that holds it
 }
 
 HRESULT NodeLink::Write(RemoteSubscription *sub, const CadroValue *value)

@@ -43,6 +43,37 @@ public:
     void *cookie;
     uint32_t id = 0;
 
+    // The link's handles on the object: one for its place in the table
+    // (until its holder lets go) and one for each delivery that will call
+    // it. The last to go deletes it.
+    void Pin() { m_pins.fetch_add(1, std::memory_order_relaxed); }
+    void Unpin()
+    {
+        if (m_pins.fetch_sub(1) == 1)
+            Delete();
+    }
+    // Calls the receiver through call, unless the holder has let go. A
+    // holder that lets go meanwhile waits for the call to return (Forgotten).
+    template <class Call> void Deliver(Call call, std::atomic<int> &waiters, SlimMutex &lock, SlimCondition &returned)
+    {
+        m_calling.fetch_add(1);
+        m_callingThread = GetCurrentThreadId();
+        if (!m_forgotten.load())
+            call(*this);
+        m_calling.fetch_sub(1);
+        if (waiters.load() != 0) {
+            // Under the lock, so that a holder between its check and its
+            // sleep cannot miss the wake.
+            lock.lock();
+            lock.unlock();
+            returned.notify_all();
+        }
+    }
+    // Under the lock: no more calls; false when one is under way on
+    // another thread (wait for Returned() then).
+    void Forgotten() { m_forgotten.store(true); }
+    bool Returned() const { return m_calling.load() == 0 || m_callingThread == GetCurrentThreadId(); }
+
 private:
     RemoteSubscription(ICadroRealTimeReceiver *r, void *c, const wchar_t *url, size_t length);
     ~RemoteSubscription() override;
@@ -53,8 +84,12 @@ private:
     uint32_t m_urlLength;
     CadroValue m_value = {}; // kCadroNoValue until the first value
     FILETIME m_time = {};
+    std::atomic<uint16_t> m_calling{0};
+    std::atomic<bool> m_forgotten{false};
     bool m_bad = false;
     bool m_connected = true;
+    DWORD m_callingThread = 0;
+    std::atomic<uint32_t> m_pins{1};
 };
 
 class NodeLink {
@@ -91,8 +126,14 @@ private:
     std::unique_ptr<PipeChannel> Connect(bool mayStart, unsigned generation);
     void Serve(PipeChannel &channel);
     void Dispatch(wire::Kind kind, wire::In &in);
+    // Values arrive in batches: each id's subscription is looked up and its
+    // value remembered under one hold of the lock per batch, then the
+    // receivers are called without it.
+    void TakeData(wire::In &in);
+    void DeliverData();
     void Disconnected();
-    // Out of the table, then waits for a callback on it in flight.
+    // Out of the table, then waits for a call to it under way on another
+    // thread; the caller then unpins it.
     void Forget(RemoteSubscription *sub, std::unique_lock<SlimMutex> &l);
     // Calls the subscription's receiver, unless it has gone; first, under
     // the lock, note(sub) when given.
@@ -116,7 +157,8 @@ private:
 
     SlimMutex m_lock;
     SlimCondition m_changed;      // the state, and replies
-    SlimCondition m_callbackDone; // a callback has returned (woken often: apart)
+    SlimCondition m_callReturned; // a call to a forgotten subscription returned
+    std::atomic<int> m_callWaiters{0};
     State m_state = State::Stopped;
     long m_uses = 0;
     unsigned m_generation = 0; // of the threads that should run; Stop() moves it on
@@ -133,8 +175,16 @@ private:
     // one does not wait for the node's answer. Forgotten when the topology
     // changes or the link breaks.
     std::unordered_set<uint64_t> m_knownUrls;
-    RemoteSubscription *m_inCallback = nullptr;
-    RemoteSubscription *m_deleteAfterCallback = nullptr;
+    struct DataFields {
+        uint32_t flags;
+        CadroValue value;
+        int32_t error;
+        uint32_t low, high;
+    };
+    // The batch of values being delivered; the link's thread's alone.
+    std::vector<DataFields> m_batchFields;
+    std::vector<std::pair<uint32_t, uint32_t>> m_batchIds; // id, index of its fields
+    std::vector<std::pair<RemoteSubscription *, uint32_t>> m_batchSubs;
     std::vector<ICadroBrowserReceiver *> m_browserReceivers;
     HANDLE m_wake = nullptr; // cuts the pause between reconnections short
     DWORD m_linkThreadId = 0;

@@ -219,14 +219,18 @@ HRESULT STDMETHODCALLTYPE NodeSession::OnData(void *cookie, uint32_t flags, cons
 {
     // A member's new value goes to its subscriptions one after the other:
     // they share one frame, which carries the value once.
-    thread_local wire::Out fields;
-    fields.Clear();
-    fields.U32(flags);
-    fields.Value(*value);
-    fields.U32(static_cast<uint32_t>(errorFlag));
-    fields.U32(timeLow);
-    fields.U32(timeHigh);
-    m_queue.PushId(wire::Kind::Data, fields.View(), IdOf(cookie));
+    wire::PackedFields packed;
+    if (packed.Pack(flags, *value, errorFlag, timeLow, timeHigh)) {
+        m_queue.PushId(wire::Kind::Data, packed.View(), IdOf(cookie));
+    } else {
+        wire::Out fields;
+        fields.U32(flags);
+        fields.Value(*value);
+        fields.U32(static_cast<uint32_t>(errorFlag));
+        fields.U32(timeLow);
+        fields.U32(timeHigh);
+        m_queue.PushId(wire::Kind::Data, fields.View(), IdOf(cookie));
+    }
     return S_OK;
 }
 

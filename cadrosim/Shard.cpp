@@ -15,6 +15,10 @@ void Attributes(const Member &m, CadroAttributes &a)
     a.access = m.access;
 }
 
+constexpr auto kTickSlack = std::chrono::milliseconds(1);
+// Events (subscriptions, writes) are not kept waiting behind a long batch.
+constexpr int kMostTicksInARow = 4096;
+
 void Split(const FILETIME &ft, uint32_t &low, uint32_t &high)
 {
     low = ft.dwLowDateTime;
@@ -156,11 +160,22 @@ void Shard::Run(unsigned generation)
             }
             continue;
         }
-        if (!m_heap.empty() && m_heap.top().at <= Clock::now()) {
-            Due due = m_heap.top();
-            m_heap.pop();
-            Unit([&] { Tick(l, due.member, due.at); });
-            Sweep(l);
+        // Members due within the next millisecond tick now, together, on
+        // one reading of the clocks: many members of short periods would
+        // otherwise wake the thread for each tick, microseconds apart.
+        Moment moment;
+        moment.now = Clock::now();
+        if (!m_heap.empty() && m_heap.top().at <= moment.now + kTickSlack) {
+            moment.elapsedMs = m_engine.ElapsedMs(moment.now);
+            GetSystemTimeAsFileTime(&moment.time);
+            for (int n = 0; n < kMostTicksInARow && !m_heap.empty() && m_heap.top().at <= moment.now + kTickSlack &&
+                            m_events.empty() && m_generation == generation;
+                 ++n) {
+                Due due = m_heap.top();
+                m_heap.pop();
+                Unit([&] { Tick(l, due.member, due.at, moment); });
+                Sweep(l);
+            }
             continue;
         }
         if (m_heap.empty())
@@ -170,7 +185,8 @@ void Shard::Run(unsigned generation)
     }
 }
 
-void Shard::Tick(std::unique_lock<SlimMutex> &l, const std::shared_ptr<Member> &member, Clock::time_point at)
+void Shard::Tick(std::unique_lock<SlimMutex> &l, const std::shared_ptr<Member> &member, Clock::time_point at,
+                 const Moment &moment)
 {
     Member &m = *member;
     if (m.removed || m.subscriptions.empty()) {
@@ -178,18 +194,19 @@ void Shard::Tick(std::unique_lock<SlimMutex> &l, const std::shared_ptr<Member> &
         return;
     }
     auto next = at + std::chrono::milliseconds(m.source.period);
-    auto now = Clock::now();
-    m_heap.push({next < now ? now + std::chrono::milliseconds(m.source.period) : next, member});
+    m_heap.push({next < moment.now ? moment.now + std::chrono::milliseconds(m.source.period) : next, member});
     if (m.stalled || !m.machine->connected)
         return;
-    m.value = NextValue(m, m_engine.ElapsedMs(), m_engine.Random());
+    m.value = NextValue(m, moment.elapsedMs, m_engine.Random());
     m.hasValue = true;
-    GetSystemTimeAsFileTime(&m.time);
+    m.time = moment.time;
 
     CadroValue value = {};
     ToCadroValue(m.value, value);
-    std::vector<Subscription *> targets;
-    targets.reserve(m.subscriptions.size());
+    // The list is the shard's, kept between ticks: an allocation per tick
+    // costs more than the tick when the shards meet in the process's heap.
+    std::vector<Subscription *> &targets = m_targets;
+    targets.clear();
     for (Subscription *sub : m.subscriptions)
         if (sub->active)
             targets.push_back(sub);

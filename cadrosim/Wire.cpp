@@ -41,6 +41,7 @@ void Out::Clear()
 
 void Out::Take(std::string &into)
 {
+    // The buffers change places: into's goes on collecting frames here.
     into.clear();
     into.swap(m_bytes);
     m_frameStart = SIZE_MAX;

@@ -73,6 +73,39 @@ private:
     size_t m_frameStart = SIZE_MAX; // of the last frame begun, while it is here
 };
 
+// A Data frame's fields (flags, value, error flag, time) for a value that
+// is not a text: the bytes Out writes, packed on the stack.
+class PackedFields {
+public:
+    // False for a text value, which Out must write.
+    bool Pack(uint32_t flags, const CadroValue &value, int32_t error, uint32_t low, uint32_t high)
+    {
+        if (value.type & kCadroTextBit)
+            return false;
+        m_size = 0;
+        Put(flags);
+        Put(value.type);
+        if (value.type == kCadroBoolean)
+            Put(static_cast<uint8_t>(value.boolean));
+        else
+            Put(value.number);
+        Put(static_cast<uint32_t>(error));
+        Put(low);
+        Put(high);
+        return true;
+    }
+    std::string_view View() const { return {m_bytes, m_size}; }
+
+private:
+    template <class T> void Put(T v)
+    {
+        memcpy(m_bytes + m_size, &v, sizeof v);
+        m_size += sizeof v;
+    }
+    char m_bytes[32];
+    size_t m_size = 0;
+};
+
 class In {
 public:
     In(const char *p, size_t n) : m_p(p), m_end(p + n) {}

@@ -40,6 +40,22 @@ TEST(Wire, FramesRoundTripAndBadOnesAreRefused)
     number.number = 22.5;
     EXPECT_FALSE(out.ExtendLast(wire::Kind::Data, fields.View(), 3));
 
+    // Fields packed on the stack are the bytes that Out writes.
+    wire::PackedFields packed;
+    ASSERT_TRUE(packed.Pack(7, number, 1, 2, 3));
+    wire::Out written;
+    written.U32(7);
+    written.Value(number);
+    written.U32(1);
+    written.U32(2);
+    written.U32(3);
+    EXPECT_EQ(packed.View(), written.View());
+    CadroValue yes = {};
+    yes.type = kCadroBoolean;
+    yes.boolean = 1;
+    ASSERT_TRUE(packed.Pack(7, yes, 0, 0, 0));
+    EXPECT_EQ(packed.View().size(), 4u + 4 + 1 + 12);
+
     // Delivered one byte at a time, the frames come out whole and in order.
     std::string buffer;
     size_t consumed = 0;
