@@ -47,17 +47,21 @@ int NodeServer::Run()
             CloseHandle(single);
         return 1;
     }
+    // The network is up before the pipe appears: a library that finds the
+    // pipe finds a node ready to answer.
+    m_engine.AddUse();
     HANDLE pipe = NewInstance(true);
     if (pipe == INVALID_HANDLE_VALUE) {
+        m_engine.ReleaseUse();
         CloseHandle(single);
         return 1;
     }
-    m_engine.AddUse();
     m_engine.AddBrowserReceiver(this);
     m_engine.SetShutdownHandler([this] { Stop(); });
     HANDLE connected = CreateEventW(nullptr, TRUE, FALSE, nullptr);
     DWORD idleSince = GetTickCount();
     bool listening = false;
+    bool connectedBefore = false; // the library came before the wait for it
     OVERLAPPED ov = {};
     for (;;) {
         if (!listening && pipe != INVALID_HANDLE_VALUE) {
@@ -66,7 +70,10 @@ int NodeServer::Run()
             ResetEvent(connected);
             listening = !ConnectNamedPipe(pipe, &ov) && GetLastError() == ERROR_IO_PENDING;
             if (!listening && GetLastError() == ERROR_PIPE_CONNECTED) {
+                // Nothing is pending on ov then: its result would be this
+                // "error", and the library would lose its connection.
                 listening = true;
+                connectedBefore = true;
                 SetEvent(connected);
             }
         }
@@ -77,7 +84,9 @@ int NodeServer::Run()
         if (woke == WAIT_OBJECT_0 + 1) {
             DWORD unused = 0;
             listening = false;
-            if (GetOverlappedResult(pipe, &ov, &unused, FALSE)) {
+            bool accepted = connectedBefore || GetOverlappedResult(pipe, &ov, &unused, FALSE);
+            connectedBefore = false;
+            if (accepted) {
                 std::lock_guard<SlimMutex> l(m_sessionsLock);
                 if (NodeSession *session = NodeSession::Start(m_engine, pipe, m_sessionEnded))
                     m_sessions.push_back(session);
@@ -100,7 +109,7 @@ int NodeServer::Run()
             break;
     }
     m_engine.SetShutdownHandler(nullptr);
-    if (listening) {
+    if (listening && !connectedBefore) {
         CancelIoEx(pipe, &ov);
         DWORD unused = 0;
         GetOverlappedResult(pipe, &ov, &unused, TRUE);
