@@ -57,7 +57,7 @@ public:
     template <class Call> void Deliver(Call call, std::atomic<int> &waiters, SlimMutex &lock, SlimCondition &returned)
     {
         m_calling.fetch_add(1);
-        m_callingThread = GetCurrentThreadId();
+        m_callingThread.store(GetCurrentThreadId(), std::memory_order_relaxed);
         if (!m_forgotten.load())
             call(*this);
         m_calling.fetch_sub(1);
@@ -69,10 +69,14 @@ public:
             returned.notify_all();
         }
     }
-    // Under the lock: no more calls; false when one is under way on
-    // another thread (wait for Returned() then).
+    // Under the lock: no calls from now on. Returned() tells when a call
+    // already under way is over (one of this thread's own, further up its
+    // stack, does not count).
     void Forgotten() { m_forgotten.store(true); }
-    bool Returned() const { return m_calling.load() == 0 || m_callingThread == GetCurrentThreadId(); }
+    bool Returned() const
+    {
+        return m_calling.load() == 0 || m_callingThread.load(std::memory_order_relaxed) == GetCurrentThreadId();
+    }
 
 private:
     RemoteSubscription(ICadroRealTimeReceiver *r, void *c, const wchar_t *url, size_t length);
@@ -88,7 +92,7 @@ private:
     std::atomic<bool> m_forgotten{false};
     bool m_bad = false;
     bool m_connected = true;
-    DWORD m_callingThread = 0;
+    std::atomic<DWORD> m_callingThread{0};
     std::atomic<uint32_t> m_pins{1};
 };
 
