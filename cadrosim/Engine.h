@@ -127,6 +127,8 @@ private:
     uint64_t m_unitsFinished = 0;
     unsigned m_generation = 0;
     DWORD m_threadId = 0;
+    bool m_busy = false;   // events came since the thread last slept
+    bool m_dozing = false; // a post does not wake it: it looks again soon
     std::thread m_thread;
 };
 

@@ -346,7 +346,7 @@ void NodeLink::Disconnected()
         m_queue.Detach();
         if (m_state == State::Connected)
             m_state = State::Down;
-        m_knownUrls.clear();
+        m_knownUrls.Clear();
         for (auto &entry : m_pending)
             entry.second->done = true; // unanswered
         m_pending.clear();
@@ -501,7 +501,7 @@ void NodeLink::TopologyChanged()
     std::vector<ICadroBrowserReceiver *> receivers;
     {
         std::lock_guard<SlimMutex> l(m_lock);
-        m_knownUrls.clear();
+        m_knownUrls.Clear();
         receivers = m_browserReceivers;
         for (auto *r : receivers)
             r->AddRef();
@@ -608,7 +608,7 @@ HRESULT NodeLink::Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeRece
             id, [](RemoteSubscription &s) { s.receiver->StatusChange(s.cookie, kCadroStatusConnecting, 0, 0); });
         return S_OK;
     }
-    bool known = m_knownUrls.count(UrlHash(sub->Url())) != 0;
+    bool known = m_knownUrls.Contains(UrlHash(sub->Url()));
     if (known || OnLinkThread()) {
         Send(wire::Kind::Subscribe, [&](wire::Out &o) {
             o.U32(0);
@@ -719,9 +719,10 @@ bool NodeLink::Browse(const std::wstring &url, std::vector<BrowseEntry> &out)
         return false;
     }
     std::lock_guard<SlimMutex> l(m_lock);
-    if (m_knownUrls.size() + known.size() > kMostKnownUrls)
-        m_knownUrls.clear();
-    m_knownUrls.insert(known.begin(), known.end());
+    if (m_knownUrls.Size() + known.size() > kMostKnownUrls)
+        m_knownUrls.Clear();
+    for (uint64_t hash : known)
+        m_knownUrls.Insert(hash);
     return found;
 }
 

@@ -6,13 +6,13 @@
 // connects again (starting a node unless the last one was shut down on
 // purpose) and subscribes again to all of them.
 #include "FrameQueue.h"
+#include "HashSet64.h"
 #include "Network.h"
 #include "Unknown.h"
 
 #include <memory>
 #include <thread>
 #include <unordered_map>
-#include <unordered_set>
 #include <vector>
 
 namespace cadrosim {
@@ -178,7 +178,7 @@ private:
     // Member URLs that the node's listings confirmed, hashed: subscribing to
     // one does not wait for the node's answer. Forgotten when the topology
     // changes or the link breaks.
-    std::unordered_set<uint64_t> m_knownUrls;
+    HashSet64 m_knownUrls;
     struct DataFields {
         uint32_t flags;
         CadroValue value;

@@ -18,6 +18,7 @@ void Attributes(const Member &m, CadroAttributes &a)
 constexpr auto kTickSlack = std::chrono::milliseconds(1);
 // Events (subscriptions, writes) are not kept waiting behind a long batch.
 constexpr int kMostTicksInARow = 4096;
+constexpr auto kDoze = std::chrono::microseconds(500);
 
 void Split(const FILETIME &ft, uint32_t &low, uint32_t &high)
 {
@@ -55,7 +56,7 @@ void Shard::Post(Subscription *sub, EventKind kind, uint32_t status)
     ++sub->queued;
     // The thread sleeps only on an empty queue: waking it for every event
     // would cost a system call each.
-    bool wake = m_events.empty();
+    bool wake = m_events.empty() && !m_dozing;
     m_events.push_back({sub, kind, status});
     if (wake)
         m_wake.notify_one();
@@ -146,6 +147,7 @@ void Shard::Run(unsigned generation)
             m_events.pop_front();
             Subscription *sub = e.sub;
             --sub->queued;
+            m_busy = true;
             if (!sub->dead) {
                 Unit([&] { Dispatch(l, e); });
                 // Subscriptions released by their own callbacks go once the
@@ -176,6 +178,18 @@ void Shard::Run(unsigned generation)
                 Unit([&] { Tick(l, due.member, due.at, moment); });
                 Sweep(l);
             }
+            continue;
+        }
+        if (m_busy) {
+            // After events the thread dozes a moment before it sleeps:
+            // events posted meanwhile (a client subscribing to thousands of
+            // members) wait for the doze's end together instead of waking
+            // it one by one, each wake a system call on both sides.
+            m_busy = false;
+            m_dozing = true;
+            auto until = moment.now + kDoze;
+            m_wake.wait_until(l, m_heap.empty() || until < m_heap.top().at ? until : m_heap.top().at);
+            m_dozing = false;
             continue;
         }
         if (m_heap.empty())

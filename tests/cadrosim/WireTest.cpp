@@ -2,6 +2,7 @@
 // writes the other reads back, and a peer that sends garbage or half a frame
 // is never read past.
 #include "Wire.h"
+#include "HashSet64.h"
 
 #include <gtest/gtest.h>
 
@@ -117,4 +118,23 @@ TEST(Wire, FramesRoundTripAndBadOnesAreRefused)
     // The member URLs a listing lets a library subscribe to without asking.
     EXPECT_EQ(wire::MemberUrl(L"\\\\H\\p\\Obj", L"cosine-Cosine wave"), L"\\\\H\\p\\Obj.cosine");
     EXPECT_EQ(wire::MemberUrl(L"\\\\H\\p\\Obj", L"(implicit)"), L"\\\\H\\p\\Obj");
+}
+
+// The set of member URLs that listings confirmed, by hash: what went in is
+// found through growth, nothing else is, and clearing forgets all.
+TEST(Wire, ConfirmedUrlSetKeepsWhatWentInThroughGrowth)
+{
+    HashSet64 set;
+    EXPECT_FALSE(set.Contains(0));
+    for (uint64_t i = 0; i < 5000; ++i)
+        set.Insert(i * 0x9E3779B97F4A7C15ull); // includes 0
+    set.Insert(0x9E3779B97F4A7C15ull);         // again
+    EXPECT_EQ(set.Size(), 5000u);
+    for (uint64_t i = 0; i < 5000; ++i)
+        ASSERT_TRUE(set.Contains(i * 0x9E3779B97F4A7C15ull)) << i;
+    EXPECT_FALSE(set.Contains(5000 * 0x9E3779B97F4A7C15ull));
+    EXPECT_FALSE(set.Contains(12345));
+    set.Clear();
+    EXPECT_EQ(set.Size(), 0u);
+    EXPECT_FALSE(set.Contains(0x9E3779B97F4A7C15ull));
 }
