@@ -99,8 +99,13 @@ public:
         if (!record)
             return E_POINTER;
         *record = {};
-        if (m_next >= m_entries.size())
+        if (m_next >= m_entries.size()) {
+            // A listing of a large object is not kept until the next one:
+            // the browser lives as long as its address space.
+            std::vector<BrowseEntry>().swap(m_entries);
+            m_next = 0;
             return HRESULT_FROM_WIN32(ERROR_NO_MORE_ITEMS);
+        }
         const BrowseEntry &e = m_entries[m_next++];
         record->mask = fieldMask & kBrowseFieldMask;
         if (fieldMask & kBrowseName)
