@@ -1,6 +1,7 @@
 // The network node seen from outside: values outlive the processes that
-// wrote them, several processes share one network, and a node that dies is
-// reported to every subscription and started again, which then resume.
+// wrote them, several processes (two servers among them) share one network,
+// and a node that dies is reported to every subscription and started again,
+// which then resume.
 #include "ChildProcess.h"
 #include "ComPtr.h"
 #include "Handle.h"
@@ -124,6 +125,59 @@ TEST(NodeE2E, AKilledNodeIsReportedToEverySubscriptionWhichResumesOnTheNextNode)
     std::string resumed = From(afterKill, "status 17");
     EXPECT_TRUE(Has(resumed, "value 21.5")) << printed; // the new node's first value
     EXPECT_TRUE(Has(resumed, "value 77")) << printed;
+
+    point->Unadvise(cookie);
+    point.Reset();
+    container.Reset();
+    items.Reset();
+    server.Reset();
+    EXPECT_TRUE(WaitForNoServerProcess(20000));
+    CoDisconnectObject(&sink, 0);
+}
+
+TEST(NodeE2E, TwoServerProcessesSeeOnePublish)
+{
+    ComPtr<IOPCServer> server;
+    ASSERT_EQ(CoCreateInstance(CLSID_SkylarcOPCServerE2E, nullptr, CLSCTX_LOCAL_SERVER, IID_IOPCServer,
+                               reinterpret_cast<void **>(server.Out())),
+              S_OK);
+    OPCHANDLE group = 0;
+    DWORD rate = 0;
+    ComPtr<IOPCItemMgt> items;
+    ASSERT_EQ(server->AddGroup(L"first", TRUE, 50, 0, nullptr, nullptr, 0, &group, &rate, IID_IOPCItemMgt,
+                               reinterpret_cast<IUnknown **>(items.Out())),
+              S_OK);
+    TestSink sink;
+    ComPtr<IConnectionPointContainer> container;
+    ComPtr<IConnectionPoint> point;
+    DWORD cookie = 0;
+    ASSERT_EQ(items.As(container), S_OK);
+    ASSERT_EQ(container->FindConnectionPoint(IID_IOPCDataCallback, point.Out()), S_OK);
+    ASSERT_EQ(point->Advise(&sink, &cookie), S_OK);
+    OPCITEMDEF def = {};
+    def.szItemID = const_cast<wchar_t *>(kTemperature);
+    def.bActive = TRUE;
+    OPCITEMRESULT *results = nullptr;
+    HRESULT *errors = nullptr;
+    ASSERT_EQ(items->AddItems(1, &def, &results, &errors), S_OK);
+    CoTaskMemFree(results);
+    CoTaskMemFree(errors);
+    ASSERT_TRUE(sink.WaitFor([](auto &calls) { return HasDataChange(calls, 21.5); }));
+
+    // The server's objects in a process of their own, with their own
+    // libraries on the same node: one publish reaches both servers.
+    auto second = std::async(std::launch::async, [] {
+        std::string output;
+        RunAndCapture(L"\"" + BinPath(L"second_server.exe") + L"\" " + kTemperature + L" 40 55", output, 60000);
+        return output;
+    });
+    Sleep(3000);
+    std::string out;
+    EXPECT_EQ(RunCadroctl(L"publish \\\\.\\proc1\\Setpoints.temperature 55", out), 0) << out;
+    EXPECT_TRUE(sink.WaitFor([](auto &calls) { return HasDataChange(calls, 55); }));
+    std::string printed = second.get();
+    EXPECT_TRUE(Has(printed, "added 0x00000000")) << printed;
+    EXPECT_TRUE(Has(printed, "value 55")) << printed;
 
     point->Unadvise(cookie);
     point.Reset();
