@@ -2,6 +2,7 @@
 
 #include "SimValue.h"
 
+#include <algorithm>
 #include <cstring>
 #include <new>
 #include <utility>
@@ -86,13 +87,14 @@ RemoteSubscription *RemoteSubscription::Create(const wchar_t *url, ICadroRealTim
     size_t length = wcslen(url);
     if (length > UINT32_MAX / 4)
         return nullptr;
-    void *block = operator new(sizeof(RemoteSubscription), length);
-    return block ? ::new (block) RemoteSubscription(receiver, cookie, url, length) : nullptr;
+    bool narrow = std::all_of(url, url + length, [](wchar_t c) { return c < 0x80; });
+    void *block = operator new(sizeof(RemoteSubscription), narrow ? length : length * sizeof(wchar_t));
+    return block ? ::new (block) RemoteSubscription(receiver, cookie, url, length, narrow) : nullptr;
 }
 
-void *RemoteSubscription::operator new(size_t size, size_t chars)
+void *RemoteSubscription::operator new(size_t size, size_t urlBytes)
 {
-    return ::operator new(size + chars * sizeof(wchar_t), std::nothrow);
+    return ::operator new(size + urlBytes, std::nothrow);
 }
 
 void RemoteSubscription::operator delete(void *p)
@@ -100,12 +102,25 @@ void RemoteSubscription::operator delete(void *p)
     ::operator delete(p);
 }
 
-RemoteSubscription::RemoteSubscription(ICadroRealTimeReceiver *r, void *c, const wchar_t *url, size_t length)
-    : receiver(r), cookie(c), m_urlLength(static_cast<uint32_t>(length))
+RemoteSubscription::RemoteSubscription(ICadroRealTimeReceiver *r, void *c, const wchar_t *url, size_t length,
+                                       bool narrow)
+    : receiver(r), cookie(c), m_urlLength(static_cast<uint32_t>(length)), m_urlNarrow(narrow)
 {
-    memcpy(const_cast<wchar_t *>(Chars()), url, length * sizeof(wchar_t));
+    char *stored = reinterpret_cast<char *>(this + 1);
+    if (narrow)
+        std::transform(url, url + length, stored, [](wchar_t ch) { return static_cast<char>(ch); });
+    else
+        memcpy(stored, url, length * sizeof(wchar_t));
     receiver->AddRef();
     NodeLink::Instance().AddUse();
+}
+
+std::wstring RemoteSubscription::Url() const
+{
+    const char *stored = reinterpret_cast<const char *>(this + 1);
+    if (m_urlNarrow)
+        return std::wstring(stored, stored + m_urlLength);
+    return std::wstring(reinterpret_cast<const wchar_t *>(stored), m_urlLength);
 }
 
 RemoteSubscription::~RemoteSubscription()
@@ -608,12 +623,12 @@ HRESULT NodeLink::Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeRece
             id, [](RemoteSubscription &s) { s.receiver->StatusChange(s.cookie, kCadroStatusConnecting, 0, 0); });
         return S_OK;
     }
-    bool known = m_knownUrls.Contains(UrlHash(sub->Url()));
+    bool known = m_knownUrls.Contains(UrlHash(url));
     if (known || OnLinkThread()) {
         Send(wire::Kind::Subscribe, [&](wire::Out &o) {
             o.U32(0);
             o.U32(sub->id);
-            o.Text(sub->Url());
+            o.Text(url);
         });
         *out = sub;
         return S_OK;
@@ -625,7 +640,7 @@ HRESULT NodeLink::Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeRece
         wire::Kind::Subscribe,
         [&](wire::Out &o) {
             o.U32(sub->id);
-            o.Text(sub->Url());
+            o.Text(url);
         },
         reply);
     wire::In in(reply.data(), reply.size());

@@ -29,7 +29,8 @@ public:
     HRESULT STDMETHODCALLTYPE Read(uint32_t *flags, CadroValue *value, int32_t *errorFlag, FILETIME *time) override;
     void LastRelease() override;
 
-    std::wstring_view Url() const { return {Chars(), m_urlLength}; }
+    // The URL, kept to subscribe again after a reconnection.
+    std::wstring Url() const;
 
     // Under the link's lock: the member's value as the node last sent it.
     // The node sends every change to every subscription, so a read is
@@ -79,12 +80,12 @@ public:
     }
 
 private:
-    RemoteSubscription(ICadroRealTimeReceiver *r, void *c, const wchar_t *url, size_t length);
+    RemoteSubscription(ICadroRealTimeReceiver *r, void *c, const wchar_t *url, size_t length, bool narrow);
     ~RemoteSubscription() override;
-    static void *operator new(size_t size, size_t chars);
+    static void *operator new(size_t size, size_t urlBytes);
     static void operator delete(void *p);
-    // The URL is kept behind the object, in the same block.
-    const wchar_t *Chars() const { return reinterpret_cast<const wchar_t *>(this + 1); }
+    // The URL is kept behind the object, in the same block: a byte a
+    // character when it is ASCII (URLs nearly always are), else two.
     uint32_t m_urlLength;
     CadroValue m_value = {}; // kCadroNoValue until the first value
     FILETIME m_time = {};
@@ -92,6 +93,7 @@ private:
     std::atomic<bool> m_forgotten{false};
     bool m_bad = false;
     bool m_connected = true;
+    bool m_urlNarrow;
     std::atomic<DWORD> m_callingThread{0};
     std::atomic<uint32_t> m_pins{1};
 };
