@@ -30,7 +30,11 @@ void PipeChannel::Close()
 
 bool PipeChannel::Finish(OVERLAPPED &ov, BOOL started, DWORD &bytes)
 {
-    if (!started && GetLastError() != ERROR_IO_PENDING)
+    // Every call that waits is a request to the Wine server: an operation
+    // done at once is taken as it is, without waiting for its event.
+    if (started)
+        return GetOverlappedResult(m_pipe, &ov, &bytes, FALSE) != FALSE && !m_closed;
+    if (GetLastError() != ERROR_IO_PENDING)
         return false;
     // A Close() between the check and the start of the operation would miss
     // it: the wait wakes up now and then to look.
@@ -50,8 +54,7 @@ bool PipeChannel::Read(std::string &buffer)
     size_t had = buffer.size();
     buffer.resize(had + kReadChunk);
     OVERLAPPED ov = {};
-    ov.hEvent = m_readEvent;
-    ResetEvent(m_readEvent);
+    ov.hEvent = m_readEvent; // reset by ReadFile as it starts
     DWORD got = 0;
     BOOL started = ReadFile(m_pipe, &buffer[had], kReadChunk, &got, &ov);
     bool ok = Finish(ov, started, got) || GetLastError() == ERROR_MORE_DATA;
@@ -66,8 +69,7 @@ bool PipeChannel::Write(const std::string &bytes)
         if (m_closed || !m_writeEvent)
             return false;
         OVERLAPPED ov = {};
-        ov.hEvent = m_writeEvent;
-        ResetEvent(m_writeEvent);
+        ov.hEvent = m_writeEvent; // reset by WriteFile as it starts
         DWORD put = 0;
         DWORD chunk = static_cast<DWORD>(std::min<size_t>(bytes.size() - done, 1u << 24));
         BOOL started = WriteFile(m_pipe, bytes.data() + done, chunk, &put, &ov);
