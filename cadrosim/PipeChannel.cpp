@@ -54,7 +54,10 @@ bool PipeChannel::Read(std::string &buffer)
     size_t had = buffer.size();
     buffer.resize(had + kReadChunk);
     OVERLAPPED ov = {};
-    ov.hEvent = m_readEvent; // reset by ReadFile as it starts
+    ov.hEvent = m_readEvent;
+    // Reset by hand: Wine does not reset it when the read starts, and a
+    // read that then waits would find the last one's signal.
+    ResetEvent(m_readEvent);
     DWORD got = 0;
     BOOL started = ReadFile(m_pipe, &buffer[had], kReadChunk, &got, &ov);
     bool ok = Finish(ov, started, got) || GetLastError() == ERROR_MORE_DATA;
@@ -69,7 +72,8 @@ bool PipeChannel::Write(const std::string &bytes)
         if (m_closed || !m_writeEvent)
             return false;
         OVERLAPPED ov = {};
-        ov.hEvent = m_writeEvent; // reset by WriteFile as it starts
+        ov.hEvent = m_writeEvent;
+        ResetEvent(m_writeEvent);
         DWORD put = 0;
         DWORD chunk = static_cast<DWORD>(std::min<size_t>(bytes.size() - done, 1u << 24));
         BOOL started = WriteFile(m_pipe, bytes.data() + done, chunk, &put, &ov);
