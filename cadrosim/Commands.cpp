@@ -315,7 +315,7 @@ std::wstring Engine::BrowseCommand(const std::vector<std::wstring> &args)
 std::wstring Engine::Status()
 {
     std::wostringstream out;
-    out << L"ok\nhost " << m_host << L"\nnetwork " << m_networkSource << L"\n";
+    out << L"ok\nhost " << LocalHostName() << L"\nnetwork " << m_networkSource << L"\n";
     if (!m_loadError.empty())
         out << L"load error " << m_loadError << L"\n";
     std::lock_guard<SlimMutex> l(m_networkLock);

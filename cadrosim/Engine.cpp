@@ -94,7 +94,7 @@ Engine &Engine::Instance()
     return *engine;
 }
 
-Engine::Engine() : m_host(LocalHostName()), m_epoch(std::chrono::steady_clock::now()), m_random(12345)
+Engine::Engine() : m_epoch(std::chrono::steady_clock::now()), m_random(12345)
 {
     for (unsigned i = 0; i < kShardCount; ++i)
         m_shards.push_back(std::make_unique<Shard>(*this));
@@ -126,8 +126,8 @@ void Engine::LoadInitialNetwork()
 
 bool Engine::Load(const std::wstring &description, std::wstring &error)
 {
-    auto network = std::make_unique<Network>(m_host);
-    if (!ParseNetworkDescription(description, m_host, *network, error))
+    auto network = std::make_unique<Network>(LocalHostName());
+    if (!ParseNetworkDescription(description, LocalHostName(), *network, error))
         return false;
     {
         std::lock_guard<SlimMutex> l(m_networkLock);

@@ -162,7 +162,6 @@ public:
     // members). False with a line-numbered error.
     bool Load(const std::wstring &description, std::wstring &error);
 
-    const std::wstring &HostName() const { return m_host; }
     double ElapsedMs() const { return ElapsedMs(std::chrono::steady_clock::now()); }
     double ElapsedMs(std::chrono::steady_clock::time_point now) const;
     unsigned NextShard() { return m_nextShard++ % m_shards.size(); }
@@ -190,8 +189,6 @@ private:
 
     friend class Shard;
     friend class ControlPipe;
-
-    std::wstring m_host;
     SlimMutex m_networkLock; // the topology; outside any shard lock
     std::unique_ptr<Network> m_network;
     std::vector<std::unique_ptr<Network>> m_retired;

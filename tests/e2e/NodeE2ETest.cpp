@@ -47,6 +47,52 @@ std::string From(const std::string &text, const std::string &from)
     size_t at = text.find(from);
     return at == std::string::npos ? std::string() : text.substr(at);
 }
+
+// The server COM starts, with an active group whose sink has seen the
+// described value of kTemperature.
+struct Subscribed {
+    void Start()
+    {
+        ASSERT_EQ(CoCreateInstance(CLSID_SkylarcOPCServerE2E, nullptr, CLSCTX_LOCAL_SERVER, IID_IOPCServer,
+                                   reinterpret_cast<void **>(server.Out())),
+                  S_OK);
+        OPCHANDLE group = 0;
+        DWORD rate = 0;
+        ASSERT_EQ(server->AddGroup(L"node", TRUE, 50, 0, nullptr, nullptr, 0, &group, &rate, IID_IOPCItemMgt,
+                                   reinterpret_cast<IUnknown **>(items.Out())),
+                  S_OK);
+        ComPtr<IConnectionPointContainer> container;
+        ASSERT_EQ(items.As(container), S_OK);
+        ASSERT_EQ(container->FindConnectionPoint(IID_IOPCDataCallback, point.Out()), S_OK);
+        ASSERT_EQ(point->Advise(&sink, &cookie), S_OK);
+        OPCITEMDEF def = {};
+        def.szItemID = const_cast<wchar_t *>(kTemperature);
+        def.bActive = TRUE;
+        OPCITEMRESULT *results = nullptr;
+        HRESULT *errors = nullptr;
+        ASSERT_EQ(items->AddItems(1, &def, &results, &errors), S_OK);
+        CoTaskMemFree(results);
+        CoTaskMemFree(errors);
+        ASSERT_TRUE(sink.WaitFor([](auto &calls) { return HasDataChange(calls, 21.5); }));
+    }
+    // Lets go of the server (its process then exits).
+    void Stop()
+    {
+        if (point)
+            point->Unadvise(cookie);
+        point.Reset();
+        items.Reset();
+        server.Reset();
+        CoDisconnectObject(&sink, 0);
+    }
+    ~Subscribed() { Stop(); }
+
+    ComPtr<IOPCServer> server;
+    ComPtr<IOPCItemMgt> items;
+    ComPtr<IConnectionPoint> point;
+    DWORD cookie = 0;
+    TestSink sink;
+};
 } // namespace
 
 TEST(NodeE2E, AWriteIsReadBackByALaterCommand)
@@ -65,32 +111,9 @@ TEST(NodeE2E, AWriteIsReadBackByALaterCommand)
 TEST(NodeE2E, AKilledNodeIsReportedToEverySubscriptionWhichResumesOnTheNextNode)
 {
     ASSERT_TRUE(WaitForNoServerProcess(20000));
-    ComPtr<IOPCServer> server;
-    ASSERT_EQ(CoCreateInstance(CLSID_SkylarcOPCServerE2E, nullptr, CLSCTX_LOCAL_SERVER, IID_IOPCServer,
-                               reinterpret_cast<void **>(server.Out())),
-              S_OK);
-    OPCHANDLE group = 0;
-    DWORD rate = 0;
-    ComPtr<IOPCItemMgt> items;
-    ASSERT_EQ(server->AddGroup(L"node", TRUE, 50, 0, nullptr, nullptr, 0, &group, &rate, IID_IOPCItemMgt,
-                               reinterpret_cast<IUnknown **>(items.Out())),
-              S_OK);
-    TestSink sink;
-    ComPtr<IConnectionPointContainer> container;
-    ComPtr<IConnectionPoint> point;
-    DWORD cookie = 0;
-    ASSERT_EQ(items.As(container), S_OK);
-    ASSERT_EQ(container->FindConnectionPoint(IID_IOPCDataCallback, point.Out()), S_OK);
-    ASSERT_EQ(point->Advise(&sink, &cookie), S_OK);
-    OPCITEMDEF def = {};
-    def.szItemID = const_cast<wchar_t *>(kTemperature);
-    def.bActive = TRUE;
-    OPCITEMRESULT *results = nullptr;
-    HRESULT *errors = nullptr;
-    ASSERT_EQ(items->AddItems(1, &def, &results, &errors), S_OK);
-    CoTaskMemFree(results);
-    CoTaskMemFree(errors);
-    ASSERT_TRUE(sink.WaitFor([](auto &calls) { return HasDataChange(calls, 21.5); }));
+    Subscribed first;
+    ASSERT_NO_FATAL_FAILURE(first.Start());
+    TestSink &sink = first.sink;
 
     // A second process on the same node, printing what it is told.
     auto other = std::async(std::launch::async, [] {
@@ -126,43 +149,15 @@ TEST(NodeE2E, AKilledNodeIsReportedToEverySubscriptionWhichResumesOnTheNextNode)
     EXPECT_TRUE(Has(resumed, "value 21.5")) << printed; // the new node's first value
     EXPECT_TRUE(Has(resumed, "value 77")) << printed;
 
-    point->Unadvise(cookie);
-    point.Reset();
-    container.Reset();
-    items.Reset();
-    server.Reset();
+    first.Stop();
     EXPECT_TRUE(WaitForNoServerProcess(20000));
-    CoDisconnectObject(&sink, 0);
 }
 
 TEST(NodeE2E, TwoServerProcessesSeeOnePublish)
 {
-    ComPtr<IOPCServer> server;
-    ASSERT_EQ(CoCreateInstance(CLSID_SkylarcOPCServerE2E, nullptr, CLSCTX_LOCAL_SERVER, IID_IOPCServer,
-                               reinterpret_cast<void **>(server.Out())),
-              S_OK);
-    OPCHANDLE group = 0;
-    DWORD rate = 0;
-    ComPtr<IOPCItemMgt> items;
-    ASSERT_EQ(server->AddGroup(L"first", TRUE, 50, 0, nullptr, nullptr, 0, &group, &rate, IID_IOPCItemMgt,
-                               reinterpret_cast<IUnknown **>(items.Out())),
-              S_OK);
-    TestSink sink;
-    ComPtr<IConnectionPointContainer> container;
-    ComPtr<IConnectionPoint> point;
-    DWORD cookie = 0;
-    ASSERT_EQ(items.As(container), S_OK);
-    ASSERT_EQ(container->FindConnectionPoint(IID_IOPCDataCallback, point.Out()), S_OK);
-    ASSERT_EQ(point->Advise(&sink, &cookie), S_OK);
-    OPCITEMDEF def = {};
-    def.szItemID = const_cast<wchar_t *>(kTemperature);
-    def.bActive = TRUE;
-    OPCITEMRESULT *results = nullptr;
-    HRESULT *errors = nullptr;
-    ASSERT_EQ(items->AddItems(1, &def, &results, &errors), S_OK);
-    CoTaskMemFree(results);
-    CoTaskMemFree(errors);
-    ASSERT_TRUE(sink.WaitFor([](auto &calls) { return HasDataChange(calls, 21.5); }));
+    Subscribed first;
+    ASSERT_NO_FATAL_FAILURE(first.Start());
+    TestSink &sink = first.sink;
 
     // The server's objects in a process of their own, with their own
     // libraries on the same node: one publish reaches both servers.
@@ -179,11 +174,6 @@ TEST(NodeE2E, TwoServerProcessesSeeOnePublish)
     EXPECT_TRUE(Has(printed, "added 0x00000000")) << printed;
     EXPECT_TRUE(Has(printed, "value 55")) << printed;
 
-    point->Unadvise(cookie);
-    point.Reset();
-    container.Reset();
-    items.Reset();
-    server.Reset();
+    first.Stop();
     EXPECT_TRUE(WaitForNoServerProcess(20000));
-    CoDisconnectObject(&sink, 0);
 }

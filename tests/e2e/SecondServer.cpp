@@ -1,61 +1,18 @@
 // second_server: a server process beside the one COM starts. The server's
 // objects live in this process with network libraries of their own, which
-// reach the same network node. It adds one active item and prints every
-// value its data callback receives ("value V") until a given value arrives
-// or the seconds run out.
+// reach the same network node. It adds one active item, waits until a given
+// value arrives or the seconds run out, and prints every value its data
+// callback received ("value V").
 #include "ClassFactory.h"
 #include "ComPtr.h"
+#include "TestSink.h"
 #include "opcda.h"
 
-#include <cmath>
 #include <cstdio>
 #include <cwchar>
 #include <ocidl.h>
 
 namespace {
-class PrintingSink : public IOPCDataCallback {
-public:
-    PrintingSink(double last, HANDLE done) : m_last(last), m_done(done) {}
-    STDMETHODIMP QueryInterface(REFIID riid, void **ppv) override
-    {
-        if (!ppv)
-            return E_POINTER;
-        if (IsEqualIID(riid, IID_IUnknown) || IsEqualIID(riid, IID_IOPCDataCallback)) {
-            *ppv = static_cast<IOPCDataCallback *>(this);
-            return S_OK;
-        }
-        *ppv = nullptr;
-        return E_NOINTERFACE;
-    }
-    STDMETHODIMP_(ULONG) AddRef() override { return 2; } // lives in main
-    STDMETHODIMP_(ULONG) Release() override { return 1; }
-    STDMETHODIMP OnDataChange(DWORD, OPCHANDLE, HRESULT, HRESULT, DWORD count, OPCHANDLE *, VARIANT *values, WORD *,
-                              FILETIME *, HRESULT *) override
-    {
-        for (DWORD i = 0; i < count; ++i) {
-            VARIANT number = {};
-            if (SUCCEEDED(VariantChangeType(&number, &values[i], 0, VT_R8))) {
-                printf("value %.17g\n", V_R8(&number));
-                if (V_R8(&number) == m_last)
-                    SetEvent(m_done);
-            }
-        }
-        fflush(stdout);
-        return S_OK;
-    }
-    STDMETHODIMP OnReadComplete(DWORD, OPCHANDLE, HRESULT, HRESULT, DWORD, OPCHANDLE *, VARIANT *, WORD *, FILETIME *,
-                                HRESULT *) override
-    {
-        return S_OK;
-    }
-    STDMETHODIMP OnWriteComplete(DWORD, OPCHANDLE, HRESULT, DWORD, OPCHANDLE *, HRESULT *) override { return S_OK; }
-    STDMETHODIMP OnCancelComplete(DWORD, OPCHANDLE) override { return S_OK; }
-
-private:
-    double m_last;
-    HANDLE m_done;
-};
-
 int Serve(const wchar_t *itemId, DWORD seconds, double last)
 {
     CServerClassFactory factory;
@@ -68,8 +25,7 @@ int Serve(const wchar_t *itemId, DWORD seconds, double last)
     if (FAILED(server->AddGroup(L"second", TRUE, 50, 0, nullptr, nullptr, 0, &group, &rate, IID_IOPCItemMgt,
                                 reinterpret_cast<IUnknown **>(items.Out()))))
         return 1;
-    HANDLE done = CreateEventW(nullptr, TRUE, FALSE, nullptr);
-    PrintingSink sink(last, done);
+    TestSink sink;
     ComPtr<IConnectionPointContainer> container;
     ComPtr<IConnectionPoint> point;
     DWORD cookie = 0;
@@ -86,13 +42,24 @@ int Serve(const wchar_t *itemId, DWORD seconds, double last)
     fflush(stdout);
     CoTaskMemFree(results);
     CoTaskMemFree(errors);
-    WaitForSingleObject(done, seconds * 1000);
+    sink.WaitFor(
+        [last](const std::vector<Callback> &calls) {
+            for (const Callback &c : calls)
+                for (double v : c.values)
+                    if (v == last)
+                        return true;
+            return false;
+        },
+        static_cast<int>(seconds * 1000));
+    for (const Callback &c : sink.Snapshot())
+        for (double v : c.values)
+            if (c.kind == Callback::DataChange)
+                printf("value %.17g\n", v);
     point->Unadvise(cookie);
     point.Reset();
     container.Reset();
     items.Reset();
     server->RemoveGroup(group, TRUE);
-    CloseHandle(done);
     return 0;
 }
 } // namespace
