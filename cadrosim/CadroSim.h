@@ -29,8 +29,10 @@ CADROSIM_API HRESULT CadroSim_Load(const wchar_t *description, BSTR *error);
 CADROSIM_API void CadroSim_UseEmbeddedNetwork();
 // Serves this process's network to the libraries of other processes until
 // "shutdown" or until none has been connected for idleSeconds; the process's
-// exit code (1: another node runs already).
-CADROSIM_API int CadroSim_RunNode(unsigned long idleSeconds);
+// exit code (1: another node runs already, 3: the port cannot be opened).
+// name: the node's pipe, null for the machine's node ("CadroNode"); listen:
+// "[host:]port" where the nodes of other machines reach it, or null.
+CADROSIM_API int CadroSim_RunNode(unsigned long idleSeconds, const wchar_t *name, const wchar_t *listen);
 // Asks a running network node to shut down and waits for it to end: S_OK,
 // S_FALSE when none runs, E_FAIL when it did not end.
 CADROSIM_API HRESULT CadroSim_StopNode();

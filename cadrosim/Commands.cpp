@@ -3,8 +3,11 @@
 #include "Engine.h"
 
 #include "NetworkFile.h"
+#include "NodeLink.h"
 
+#include <algorithm>
 #include <cwchar>
+#include <iterator>
 #include <sstream>
 
 namespace cadrosim {
@@ -86,6 +89,8 @@ std::wstring Engine::Execute(const std::wstring &command)
         return Error(L"empty command");
     std::wstring verb = args[0];
     args.erase(args.begin());
+    if (std::wstring address = ServedElsewhere(verb, args); !address.empty())
+        return Error(L"that machine is served by the node at " + address + L": run the command there");
     if (verb == L"publish")
         return Publish(args);
     if (verb == L"add-member")
@@ -130,6 +135,18 @@ std::wstring Engine::Execute(const std::wstring &command)
     if (verb == L"help")
         return kHelp;
     return Error(L"unknown command '" + verb + L"' (try help)");
+}
+
+std::wstring Engine::ServedElsewhere(const std::wstring &verb, const std::vector<std::wstring> &args)
+{
+    static const wchar_t *const onUrls[] = {L"publish", L"add-member", L"remove-member", L"stall",
+                                            L"unstall", L"show",       L"disconnect",    L"reconnect"};
+    bool onUrl = std::any_of(std::begin(onUrls), std::end(onUrls), [&](const wchar_t *v) { return verb == v; });
+    if (!onUrl || args.empty())
+        return L"";
+    bool machineOnly = verb == L"disconnect" || verb == L"reconnect";
+    NodeLink *link = RemoteNodeOf(machineOnly ? L"\\\\" + args[0] : args[0]);
+    return link ? link->Address() : L"";
 }
 
 std::wstring Engine::Publish(const std::vector<std::wstring> &args)
@@ -319,8 +336,12 @@ std::wstring Engine::Status()
     if (!m_loadError.empty())
         out << L"load error " << m_loadError << L"\n";
     std::lock_guard<SlimMutex> l(m_networkLock);
-    for (auto &m : m_network->Machines())
-        out << L"machine " << m->name << (m->connected ? L" connected" : L" disconnected") << L"\n";
+    for (auto &m : m_network->Machines()) {
+        if (!m->node.empty())
+            out << L"machine " << m->name << L" served by the node at " << m->node << L"\n";
+        else
+            out << L"machine " << m->name << (m->connected ? L" connected" : L" disconnected") << L"\n";
+    }
     out << L"subscriptions " << m_subscriptionCount.load() << L"\n";
     out << L"browses " << m_browseCount.load() << L"\n";
     return out.str();

@@ -1,6 +1,7 @@
 #include "Engine.h"
 
 #include "NetworkFile.h"
+#include "NodeLink.h"
 
 #include <algorithm>
 
@@ -26,6 +27,28 @@ std::wstring NetworkFilePath()
     return L"";
 }
 
+// A node's topology changes are this engine's too when it serves them.
+class TopologyRelay : public CSimUnknown<ICadroBrowserReceiver> {
+public:
+    explicit TopologyRelay(Engine &engine) : m_engine(engine) {}
+    HRESULT STDMETHODCALLTYPE BrowseItemChanged() override
+    {
+        m_engine.NotifyTopologyChanged();
+        return S_OK;
+    }
+
+private:
+    Engine &m_engine;
+};
+
+// The machine a URL begins with: "\\name\..." gives name.
+std::wstring MachineOf(const std::wstring &url)
+{
+    if (url.compare(0, 2, L"\\\\") != 0)
+        return L"";
+    size_t end = url.find(L'\\', 2);
+    return url.substr(2, end == std::wstring::npos ? std::wstring::npos : end - 2);
+}
 } // namespace
 
 // Asked once per subscription (to expand "\\.\"): read from the system once,
@@ -94,7 +117,7 @@ Engine &Engine::Instance()
     return *engine;
 }
 
-Engine::Engine() : m_epoch(std::chrono::steady_clock::now()), m_random(12345)
+Engine::Engine() : m_topologyRelay(new TopologyRelay(*this)), m_epoch(std::chrono::steady_clock::now()), m_random(12345)
 {
     for (unsigned i = 0; i < kShardCount; ++i)
         m_shards.push_back(std::make_unique<Shard>(*this));
@@ -129,6 +152,28 @@ bool Engine::Load(const std::wstring &description, std::wstring &error)
     auto network = std::make_unique<Network>(LocalHostName());
     if (!ParseNetworkDescription(description, LocalHostName(), *network, error))
         return false;
+    std::vector<NodeLink *> remote;
+    for (auto &machine : network->Machines())
+        if (!machine->node.empty()) {
+            NodeLink *link = NodeLink::ForAddress(machine->node);
+            if (!link) {
+                error = L"too many nodes of other machines";
+                return false;
+            }
+            if (std::find(remote.begin(), remote.end(), link) == remote.end())
+                remote.push_back(link);
+        }
+    {
+        // The new network's nodes are reached before the old ones are let
+        // go: a node that both name keeps its connection.
+        std::lock_guard<SlimMutex> l(m_useLock);
+        if (m_uses > 0) {
+            UseRemoteNodes(remote, true);
+            UseRemoteNodes(m_remoteNodes, false);
+        }
+        m_remoteNodes = remote;
+        m_hasRemoteNodes = !remote.empty();
+    }
     {
         std::lock_guard<SlimMutex> l(m_networkLock);
         // Subscriptions may still hold members of the old network, which
@@ -176,13 +221,51 @@ void Engine::StartThreads()
     for (auto &shard : m_shards)
         shard->Start();
     m_pipe = std::make_unique<ControlPipe>(*this);
+    UseRemoteNodes(m_remoteNodes, true);
 }
 
 void Engine::StopThreads()
 {
+    UseRemoteNodes(m_remoteNodes, false);
     m_pipe.reset();
     for (auto &shard : m_shards)
         shard->Stop();
+}
+
+void Engine::UseRemoteNodes(const std::vector<NodeLink *> &links, bool use)
+{
+    for (NodeLink *link : links) {
+        if (use) {
+            link->AddUse();
+            link->AddBrowserReceiver(m_topologyRelay);
+        } else {
+            link->RemoveBrowserReceiver(m_topologyRelay);
+            link->ReleaseUse();
+        }
+    }
+}
+
+NodeLink *Engine::RemoteNodeOf(const std::wstring &url)
+{
+    if (!m_hasRemoteNodes)
+        return nullptr;
+    std::wstring name = MachineOf(url);
+    std::wstring address;
+    {
+        std::lock_guard<SlimMutex> l(m_networkLock);
+        Machine *machine = name.empty() || name == L"." ? nullptr : m_network->FindMachine(name);
+        if (!machine || machine->node.empty())
+            return nullptr;
+        address = machine->node;
+    }
+    return NodeLink::ForAddress(address);
+}
+
+bool Engine::HasMember(const std::wstring &url)
+{
+    if (NodeLink *link = RemoteNodeOf(url))
+        return link->Knows(url);
+    return FindMember(url) != nullptr;
 }
 
 std::shared_ptr<Member> Engine::FindMember(const std::wstring &url, Machine **machine)
@@ -194,12 +277,16 @@ std::shared_ptr<Member> Engine::FindMember(const std::wstring &url, Machine **ma
     return member;
 }
 
-HRESULT Engine::Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeReceiver *receiver, CadroDataItem **out)
+HRESULT Engine::Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeReceiver *receiver, CadroDataItem **out,
+                          bool hereOnly)
 {
     if (!out || !receiver || !url)
         return E_POINTER;
     *out = nullptr;
-    std::shared_ptr<Member> member = FindMember(url);
+    NodeLink *link = RemoteNodeOf(url);
+    if (link && !hereOnly)
+        return link->Subscribe(url, cookie, receiver, out);
+    std::shared_ptr<Member> member = link ? nullptr : FindMember(url);
     if (!member) {
         // The network answers at once: contacted, but no such data item.
         for (uint32_t status :
@@ -300,13 +387,24 @@ HRESULT Engine::Read(Subscription *sub, uint32_t *flags, CadroValue *value, int3
 
 bool Engine::List(const std::wstring &url, std::vector<BrowseEntry> &out)
 {
+    if (NodeLink *link = RemoteNodeOf(url)) {
+        // A use of its own: the engine may be idle (a control command).
+        link->AddUse();
+        bool found = link->Browse(url, out);
+        link->ReleaseUse();
+        return found;
+    }
     std::lock_guard<SlimMutex> l(m_networkLock);
     return m_network->List(url, out);
 }
 
-bool Engine::Browse(const std::wstring &url, std::vector<BrowseEntry> &out)
+bool Engine::Browse(const std::wstring &url, std::vector<BrowseEntry> &out, bool hereOnly)
 {
     ++m_browseCount;
+    if (hereOnly && RemoteNodeOf(url)) {
+        out.clear();
+        return false;
+    }
     return List(url, out);
 }
 

@@ -141,20 +141,28 @@ public:
     void AddUse();
     void ReleaseUse();
 
-    HRESULT Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeReceiver *receiver, CadroDataItem **out);
+    // hereOnly: a machine that another node serves is unknown (a node
+    // passes on only its libraries' requests, so that two nodes that name
+    // each other cannot send one round for ever).
+    HRESULT Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeReceiver *receiver, CadroDataItem **out,
+                      bool hereOnly = false);
     void Unsubscribe(Subscription *sub);
     HRESULT Write(Subscription *sub, const CadroValue *value);
     HRESULT Read(Subscription *sub, uint32_t *flags, CadroValue *value, int32_t *errorFlag, FILETIME *time);
     bool List(const std::wstring &url, std::vector<BrowseEntry> &out);
     // A browse session's listing: counted, for "status".
-    bool Browse(const std::wstring &url, std::vector<BrowseEntry> &out);
+    bool Browse(const std::wstring &url, std::vector<BrowseEntry> &out, bool hereOnly = false);
 
-    bool HasMember(const std::wstring &url) { return FindMember(url) != nullptr; }
+    // Whether a subscription to url will find its member: known here, or
+    // confirmed by a listing of the node that serves its machine.
+    bool HasMember(const std::wstring &url);
     // Who ends the process when "shutdown" is asked (only a network node).
     void SetShutdownHandler(std::function<void()> handler);
 
     void AddBrowserReceiver(ICadroBrowserReceiver *receiver);
     void RemoveBrowserReceiver(ICadroBrowserReceiver *receiver);
+    // Tells the browser receivers that the topology changed.
+    void NotifyTopologyChanged();
 
     // Runs one control command; the answer's first line is "ok" or "error: ...".
     std::wstring Execute(const std::wstring &command);
@@ -172,11 +180,18 @@ private:
     void LoadInitialNetwork();
     void StartThreads();
     void StopThreads();
-    void NotifyTopologyChanged();
     void AssignShards();
     std::shared_ptr<Member> FindMember(const std::wstring &url, Machine **machine = nullptr);
+    // The link to the node that serves the machine of url, when another
+    // node serves it; else null.
+    class NodeLink *RemoteNodeOf(const std::wstring &url);
+    // Under m_useLock: the links of the network's machines on other nodes
+    // are used while the engine is.
+    void UseRemoteNodes(const std::vector<class NodeLink *> &links, bool use);
 
-    // Control commands.
+    // Control commands. A command on a machine that another node serves is
+    // refused with that node's address.
+    std::wstring ServedElsewhere(const std::wstring &verb, const std::vector<std::wstring> &args);
     std::wstring Publish(const std::vector<std::wstring> &args);
     std::wstring AddMemberCommand(const std::vector<std::wstring> &args);
     std::wstring RemoveMemberCommand(const std::vector<std::wstring> &args);
@@ -199,6 +214,9 @@ private:
     SlimMutex m_useLock;
     long m_uses = 0;
     std::unique_ptr<class ControlPipe> m_pipe;
+    std::vector<class NodeLink *> m_remoteNodes; // of the network, under m_useLock
+    std::atomic<bool> m_hasRemoteNodes{false};
+    ICadroBrowserReceiver *m_topologyRelay; // their topology changes, told here
     SlimMutex m_receiversLock;
     std::vector<ICadroBrowserReceiver *> m_browserReceivers;
     std::chrono::steady_clock::time_point m_epoch;

@@ -2,7 +2,7 @@
 
 namespace cadrosim {
 
-void FrameQueue::Attach(std::shared_ptr<PipeChannel> channel)
+void FrameQueue::Attach(std::shared_ptr<Channel> channel)
 {
     std::lock_guard<SlimMutex> l(m_lock);
     m_out.Clear();
@@ -77,7 +77,7 @@ void FrameQueue::Drain(std::unique_lock<SlimMutex> &l)
     // from one to the next, and goes back to the queue at each exchange.
     std::string &batch = m_batch;
     while (!m_out.Empty() && m_channel) {
-        std::shared_ptr<PipeChannel> channel = m_channel;
+        std::shared_ptr<Channel> channel = m_channel;
         m_out.Take(batch);
         l.unlock();
         if (!channel->Write(batch))

@@ -3,7 +3,7 @@
 // by the queue's own thread, in batches of whatever gathered during the
 // previous write; a thread that waits for an answer writes its request
 // itself (Flush), which spares the hand-over to the writing thread.
-#include "PipeChannel.h"
+#include "Channel.h"
 #include "SlimSync.h"
 #include "Wire.h"
 
@@ -23,7 +23,7 @@ public:
     FrameQueue &operator=(const FrameQueue &) = delete;
 
     // Starts writing into channel (frames queued before are dropped).
-    void Attach(std::shared_ptr<PipeChannel> channel);
+    void Attach(std::shared_ptr<Channel> channel);
     // Stops writing and drops what is queued.
     void Detach();
     // Ends the writing thread; with drain, what is queued is written first.
@@ -65,7 +65,7 @@ private:
     SlimCondition m_idle;
     wire::Out m_out;
     std::string m_batch; // being written
-    std::shared_ptr<PipeChannel> m_channel;
+    std::shared_ptr<Channel> m_channel;
     bool m_writing = false;
     bool m_stopping = false;
     bool m_closeWhenWritten = false;

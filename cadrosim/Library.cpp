@@ -202,10 +202,11 @@ void CadroSim_UseEmbeddedNetwork()
     g_embedded = true;
 }
 
-int CadroSim_RunNode(unsigned long idleSeconds)
+int CadroSim_RunNode(unsigned long idleSeconds, const wchar_t *name, const wchar_t *listen)
 {
     g_embedded = true;
-    NodeServer *node = NodeServer::Create(Engine::Instance(), idleSeconds * 1000);
+    NodeServer *node = NodeServer::Create(Engine::Instance(), idleSeconds * 1000, name ? name : wire::kNodeName,
+                                          listen ? listen : L"");
     if (!node)
         return 1;
     int code = node->Run();

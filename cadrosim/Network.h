@@ -70,6 +70,7 @@ struct Process {
 
 struct Machine {
     std::wstring name;
+    std::wstring node; // "host:port" of the node that serves it, when not this one
     std::atomic<bool> connected{true};
     std::vector<std::unique_ptr<Process>> processes;
 };

@@ -1,5 +1,7 @@
 #include "NetworkFile.h"
 
+#include "SocketChannel.h"
+
 #include <algorithm>
 #include <cmath>
 #include <cwchar>
@@ -271,8 +273,16 @@ bool ParseNetworkDescription(const std::wstring &text, const std::wstring &hostN
             continue;
         const std::wstring &keyword = tokens[0];
         if (keyword == L"machine") {
-            if (tokens.size() != 2)
-                return fail(L"expected: machine <name>");
+            std::wstring node;
+            if (tokens.size() == 3 && tokens[2].compare(0, 5, L"node=") == 0)
+                node = tokens[2].substr(5);
+            else if (tokens.size() != 2)
+                return fail(L"expected: machine <name> [node=<host>:<port>]");
+            std::wstring host, port;
+            if (tokens.size() == 3 && !SplitNodeAddress(node, host, port))
+                return fail(L"expected: node=<host>:<port>, not '" + tokens[2] + L"'");
+            if (!node.empty() && tokens[1] == L"$HOST")
+                return fail(L"this machine cannot be served by another node");
             std::wstring name = tokens[1] == L"$HOST" ? hostName : tokens[1];
             if (name.empty() || name.find_first_of(L"\\/ ") != std::wstring::npos)
                 return fail(L"bad machine name '" + tokens[1] + L"'");
@@ -281,11 +291,15 @@ bool ParseNetworkDescription(const std::wstring &text, const std::wstring &hostN
             out.Machines().push_back(std::make_unique<Machine>());
             machine = out.Machines().back().get();
             machine->name = name;
+            machine->node = node;
             process = nullptr;
             objectUrl.clear();
         } else if (keyword == L"process") {
             if (!machine)
                 return fail(L"process before any machine");
+            if (!machine->node.empty())
+                return fail(L"machine '" + machine->name + L"' is served by the node at " + machine->node +
+                            L": its processes are described there");
             if (tokens.size() != 2 || tokens[1].empty() || !iswalpha(tokens[1][0]))
                 return fail(L"expected: process <name starting with a letter>");
             machine->processes.push_back(std::make_unique<Process>());

@@ -1,6 +1,8 @@
 #include "NodeLink.h"
 
+#include "PipeChannel.h"
 #include "SimValue.h"
+#include "SocketChannel.h"
 
 #include <algorithm>
 #include <cstring>
@@ -20,6 +22,7 @@ constexpr DWORD kStartWaitMs = 15000;
 constexpr DWORD kReplyWaitMs = 60000;
 constexpr DWORD kReconnectPauseMs = 500;
 constexpr DWORD kRestartMs = 2000;
+constexpr DWORD kTcpConnectMs = 3000;
 constexpr size_t kMostKnownUrls = 4u << 20;
 
 uint64_t UrlHash(std::wstring_view url)
@@ -82,14 +85,15 @@ void StartNode()
 
 // ---- RemoteSubscription ------------------------------------------------------
 
-RemoteSubscription *RemoteSubscription::Create(const wchar_t *url, ICadroRealTimeReceiver *receiver, void *cookie)
+RemoteSubscription *RemoteSubscription::Create(uint8_t link, const wchar_t *url, ICadroRealTimeReceiver *receiver,
+                                               void *cookie)
 {
     size_t length = wcslen(url);
     if (length > UINT32_MAX / 4)
         return nullptr;
     bool narrow = std::all_of(url, url + length, [](wchar_t c) { return c < 0x80; });
     void *block = operator new(sizeof(RemoteSubscription), narrow ? length : length * sizeof(wchar_t));
-    return block ? ::new (block) RemoteSubscription(receiver, cookie, url, length, narrow) : nullptr;
+    return block ? ::new (block) RemoteSubscription(link, receiver, cookie, url, length, narrow) : nullptr;
 }
 
 void *RemoteSubscription::operator new(size_t size, size_t urlBytes)
@@ -102,9 +106,9 @@ void RemoteSubscription::operator delete(void *p)
     ::operator delete(p);
 }
 
-RemoteSubscription::RemoteSubscription(ICadroRealTimeReceiver *r, void *c, const wchar_t *url, size_t length,
-                                       bool narrow)
-    : receiver(r), cookie(c), m_urlLength(static_cast<uint32_t>(length)), m_urlNarrow(narrow)
+RemoteSubscription::RemoteSubscription(uint8_t link, ICadroRealTimeReceiver *r, void *c, const wchar_t *url,
+                                       size_t length, bool narrow)
+    : receiver(r), cookie(c), m_urlLength(static_cast<uint32_t>(length)), m_urlNarrow(narrow), m_link(link)
 {
     char *stored = reinterpret_cast<char *>(this + 1);
     if (narrow)
@@ -112,7 +116,12 @@ RemoteSubscription::RemoteSubscription(ICadroRealTimeReceiver *r, void *c, const
     else
         memcpy(stored, url, length * sizeof(wchar_t));
     receiver->AddRef();
-    NodeLink::Instance().AddUse();
+    Link().AddUse();
+}
+
+NodeLink &RemoteSubscription::Link() const
+{
+    return NodeLink::At(m_link);
 }
 
 std::wstring RemoteSubscription::Url() const
@@ -127,7 +136,7 @@ RemoteSubscription::~RemoteSubscription()
 {
     ClearCadroValue(m_value);
     receiver->Release();
-    NodeLink::Instance().ReleaseUse();
+    Link().ReleaseUse();
 }
 
 void RemoteSubscription::Remember(uint32_t flags, const CadroValue &value, int32_t error, uint32_t low, uint32_t high)
@@ -181,28 +190,71 @@ void RemoteSubscription::Delete()
 
 HRESULT STDMETHODCALLTYPE RemoteSubscription::Write(const CadroValue *value)
 {
-    return NodeLink::Instance().Write(this, value);
+    return Link().Write(this, value);
 }
 
 HRESULT STDMETHODCALLTYPE RemoteSubscription::Read(uint32_t *flags, CadroValue *value, int32_t *errorFlag,
                                                    FILETIME *time)
 {
-    return NodeLink::Instance().Read(this, flags, value, errorFlag, time);
+    return Link().Read(this, flags, value, errorFlag, time);
 }
 
 void RemoteSubscription::LastRelease()
 {
-    NodeLink::Instance().Unsubscribe(this);
+    Link().Unsubscribe(this);
 }
 
 // ---- NodeLink: lifetime --------------------------------------------------------
 
+namespace {
+// Every link of the process, by index (0: this machine's node). Never
+// destroyed, like the engine: their threads may outlive static destruction
+// at process exit.
+struct Links {
+    SlimMutex lock;
+    NodeLink *at[256] = {};
+    unsigned count = 0;
+};
+
+Links &AllLinks()
+{
+    static Links *links = new Links();
+    return *links;
+}
+} // namespace
+
 NodeLink &NodeLink::Instance()
 {
-    // Never destroyed, like the engine: its threads may outlive static
-    // destruction at process exit.
-    static NodeLink *link = new NodeLink();
+    static NodeLink *link = [] {
+        Links &links = AllLinks();
+        std::lock_guard<SlimMutex> l(links.lock);
+        if (!links.at[0])
+            links.at[0] = new NodeLink(0, L"");
+        links.count = std::max(links.count, 1u);
+        return links.at[0];
+    }();
     return *link;
+}
+
+NodeLink *NodeLink::ForAddress(const std::wstring &address)
+{
+    Instance(); // index 0 is the machine's node
+    Links &links = AllLinks();
+    std::lock_guard<SlimMutex> l(links.lock);
+    for (unsigned i = 1; i < links.count; ++i)
+        if (links.at[i]->m_address == address)
+            return links.at[i];
+    if (links.count == 256)
+        return nullptr;
+    NodeLink *link = new (std::nothrow) NodeLink(static_cast<uint8_t>(links.count), address);
+    if (link)
+        links.at[links.count++] = link;
+    return link;
+}
+
+NodeLink &NodeLink::At(uint8_t index)
+{
+    return *AllLinks().at[index];
 }
 
 void NodeLink::AddUse()
@@ -233,7 +285,7 @@ void NodeLink::Start()
 void NodeLink::Stop(std::unique_lock<SlimMutex> &l)
 {
     ++m_generation;
-    std::shared_ptr<PipeChannel> channel = m_channel;
+    std::shared_ptr<Channel> channel = m_channel;
     std::thread thread = std::move(m_thread);
     l.unlock();
     // What was said last (a write, unsubscriptions) reaches the node before
@@ -256,8 +308,10 @@ void NodeLink::Stop(std::unique_lock<SlimMutex> &l)
 
 // ---- NodeLink: the connection ----------------------------------------------------
 
-std::unique_ptr<PipeChannel> NodeLink::Connect(bool mayStart, unsigned generation)
+std::unique_ptr<Channel> NodeLink::Connect(bool mayStart, unsigned generation)
 {
+    if (!m_address.empty())
+        return SocketChannel::Connect(m_address, kTcpConnectMs);
     DWORD begin = GetTickCount();
     DWORD lastStart = 0;
     bool started = false;
@@ -305,7 +359,7 @@ void NodeLink::Run(unsigned generation)
                 return;
             mayStart = m_mayStartNode;
         }
-        std::shared_ptr<PipeChannel> channel = Connect(mayStart, generation);
+        std::shared_ptr<Channel> channel = Connect(mayStart, generation);
         {
             std::lock_guard<SlimMutex> l(m_lock);
             if (m_generation != generation)
@@ -339,7 +393,7 @@ void NodeLink::Run(unsigned generation)
     }
 }
 
-void NodeLink::Serve(PipeChannel &channel)
+void NodeLink::Serve(Channel &channel)
 {
     std::string buffer;
     size_t consumed = 0;
@@ -378,7 +432,7 @@ void NodeLink::Disconnected()
             [](RemoteSubscription &sub) { sub.RememberStatus(kCadroStatusDisconnected); });
 }
 
-bool NodeLink::WaitConnected(std::unique_lock<SlimMutex> &l)
+bool NodeLink::WaitConnected(std::unique_lock<SlimMutex> &l, bool forAnswer)
 {
     // A node shut down on purpose is not started again by the link alone,
     // but a request that needs the network starts one; and a request does
@@ -388,8 +442,12 @@ bool NodeLink::WaitConnected(std::unique_lock<SlimMutex> &l)
         m_state = State::Connecting;
         SetEvent(m_wake);
     }
+    // Another machine's node is not waited for unless an answer is needed:
+    // its subscriptions wait as on a disconnected machine, and the machine's
+    // own servers are not held up by one that cannot be reached.
+    bool wait = forAnswer || m_address.empty();
     auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(kStartWaitMs);
-    while (m_state == State::Connecting && !OnLinkThread() && std::chrono::steady_clock::now() < deadline)
+    while (wait && m_state == State::Connecting && !OnLinkThread() && std::chrono::steady_clock::now() < deadline)
         m_changed.wait_until(l, deadline);
     return m_state == State::Connected;
 }
@@ -574,7 +632,7 @@ template <class Fill> bool NodeLink::Ask(wire::Kind kind, Fill fill, std::string
 {
     std::unique_lock<SlimMutex> l(m_lock);
     // The link's own thread reads the answers: it cannot wait for one.
-    if (OnLinkThread() || !WaitConnected(l))
+    if (OnLinkThread() || !WaitConnected(l, true))
         return false;
     Pending pending;
     uint32_t request = ++m_nextRequest ? m_nextRequest : ++m_nextRequest;
@@ -603,11 +661,11 @@ HRESULT NodeLink::Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeRece
     if (!out || !receiver || !url)
         return E_POINTER;
     *out = nullptr;
-    RemoteSubscription *sub = RemoteSubscription::Create(url, receiver, cookie);
+    RemoteSubscription *sub = RemoteSubscription::Create(m_index, url, receiver, cookie);
     if (!sub)
         return E_OUTOFMEMORY;
     std::unique_lock<SlimMutex> l(m_lock);
-    bool connected = WaitConnected(l);
+    bool connected = WaitConnected(l, false);
     if (!Register(sub)) {
         l.unlock();
         sub->Delete();
@@ -684,7 +742,7 @@ HRESULT NodeLink::Write(RemoteSubscription *sub, const CadroValue *value)
     if (!value)
         return E_POINTER;
     std::unique_lock<SlimMutex> l(m_lock);
-    WaitConnected(l);
+    WaitConnected(l, false);
     bool sent = Send(wire::Kind::Write, [&](wire::Out &out) {
         out.U32(sub->id);
         out.Value(*value);
@@ -702,7 +760,7 @@ HRESULT NodeLink::Read(RemoteSubscription *sub, uint32_t *flags, CadroValue *val
     value->type = kCadroCleared;
     value->number = 0;
     std::unique_lock<SlimMutex> l(m_lock);
-    if (!WaitConnected(l))
+    if (!WaitConnected(l, false))
         return kNotConnected;
     return sub->Recall(flags, value, errorFlag, time);
 }
@@ -764,6 +822,12 @@ bool NodeLink::Load(const std::wstring &description, std::wstring &error)
     bool loaded = in.U8() != 0;
     error = in.Text();
     return in.Ok() && loaded;
+}
+
+bool NodeLink::Knows(const std::wstring &url)
+{
+    std::lock_guard<SlimMutex> l(m_lock);
+    return m_knownUrls.Contains(UrlHash(url));
 }
 
 void NodeLink::AddBrowserReceiver(ICadroBrowserReceiver *receiver)

@@ -5,6 +5,9 @@
 // breaks, every subscription is told that the node disconnected it; the link
 // connects again (starting a node unless the last one was shut down on
 // purpose) and subscribes again to all of them.
+//
+// A node reaches the machines that another machine's node serves the same
+// way, through a link to that node's TCP address (never started from here).
 #include "FrameQueue.h"
 #include "HashSet64.h"
 #include "Network.h"
@@ -22,7 +25,7 @@ class NodeLink;
 // A subscription through the node; the CadroDataItem its holder keeps.
 class RemoteSubscription : public CSimUnknown<CadroDataItem> {
 public:
-    static RemoteSubscription *Create(const wchar_t *url, ICadroRealTimeReceiver *receiver, void *cookie);
+    static RemoteSubscription *Create(uint8_t link, const wchar_t *url, ICadroRealTimeReceiver *receiver, void *cookie);
     void Delete();
 
     HRESULT STDMETHODCALLTYPE Write(const CadroValue *value) override;
@@ -80,7 +83,9 @@ public:
     }
 
 private:
-    RemoteSubscription(ICadroRealTimeReceiver *r, void *c, const wchar_t *url, size_t length, bool narrow);
+    RemoteSubscription(uint8_t link, ICadroRealTimeReceiver *r, void *c, const wchar_t *url, size_t length,
+                       bool narrow);
+    NodeLink &Link() const;
     ~RemoteSubscription() override;
     static void *operator new(size_t size, size_t urlBytes);
     static void operator delete(void *p);
@@ -94,13 +99,21 @@ private:
     bool m_bad = false;
     bool m_connected = true;
     bool m_urlNarrow;
+    uint8_t m_link; // NodeLink::At
     std::atomic<DWORD> m_callingThread{0};
     std::atomic<uint32_t> m_pins{1};
 };
 
 class NodeLink {
 public:
+    // The link to this machine's node.
     static NodeLink &Instance();
+    // The link to the node at a TCP address ("host:port"), made on first
+    // use and kept for the process's life; null when too many are made.
+    static NodeLink *ForAddress(const std::wstring &address);
+    static NodeLink &At(uint8_t index);
+    uint8_t Index() const { return m_index; }
+    const std::wstring &Address() const { return m_address; }
 
     // Library objects and subscriptions keep the link (and its threads) up.
     void AddUse();
@@ -116,6 +129,8 @@ public:
 
     void AddBrowserReceiver(ICadroBrowserReceiver *receiver);
     void RemoveBrowserReceiver(ICadroBrowserReceiver *receiver);
+    // Whether a listing through this link confirmed the member's URL.
+    bool Knows(const std::wstring &url);
 
 private:
     enum class State { Stopped, Connecting, Connected, Down };
@@ -125,12 +140,12 @@ private:
         std::string reply;
     };
 
-    NodeLink() = default;
+    NodeLink(uint8_t index, std::wstring address) : m_index(index), m_address(std::move(address)) {}
     void Start();
     void Stop(std::unique_lock<SlimMutex> &l);
     void Run(unsigned generation);
-    std::unique_ptr<PipeChannel> Connect(bool mayStart, unsigned generation);
-    void Serve(PipeChannel &channel);
+    std::unique_ptr<Channel> Connect(bool mayStart, unsigned generation);
+    void Serve(Channel &channel);
     void Dispatch(wire::Kind kind, wire::In &in);
     // Values arrive in batches: each id's subscription is looked up and its
     // value remembered under one hold of the lock per batch, then the
@@ -149,7 +164,10 @@ private:
         CallSubscription(id, call, [](RemoteSubscription &) {});
     }
     void TopologyChanged();
-    bool WaitConnected(std::unique_lock<SlimMutex> &l);
+    // Whether the node is connected, waiting for one being connected to (a
+    // node being started) unless it is another machine's and no answer is
+    // needed (forAnswer).
+    bool WaitConnected(std::unique_lock<SlimMutex> &l, bool forAnswer);
     bool OnLinkThread() const { return GetCurrentThreadId() == m_linkThreadId; }
 
     // Under m_lock.
@@ -161,6 +179,8 @@ private:
     // number); false when the node did not answer.
     template <class Fill> bool Ask(wire::Kind kind, Fill fill, std::string &reply);
 
+    const uint8_t m_index;
+    const std::wstring m_address; // empty: this machine's node, by its pipe
     SlimMutex m_lock;
     SlimCondition m_changed;      // the state, and replies
     SlimCondition m_callReturned; // a call to a forgotten subscription returned
@@ -170,7 +190,7 @@ private:
     unsigned m_generation = 0; // of the threads that should run; Stop() moves it on
     bool m_mayStartNode = true;
     DWORD m_lastFailure = 0; // when an attempt to connect last failed
-    std::shared_ptr<PipeChannel> m_channel;
+    std::shared_ptr<Channel> m_channel;
     FrameQueue m_queue;
     std::vector<RemoteSubscription *> m_slots;
     std::vector<uint16_t> m_generations;

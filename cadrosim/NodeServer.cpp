@@ -1,7 +1,9 @@
 #include "NodeServer.h"
 
+#include "PipeChannel.h"
 #include "Wire.h"
 
+#include <cstdio>
 #include <new>
 
 namespace cadrosim {
@@ -11,14 +13,14 @@ constexpr DWORD kPipeBuffer = 1 << 20;
 constexpr DWORD kIdleCheckMs = 500;
 } // namespace
 
-NodeServer *NodeServer::Create(Engine &engine, DWORD idleMs)
+NodeServer *NodeServer::Create(Engine &engine, DWORD idleMs, std::wstring name, std::wstring listen)
 {
-    return new (std::nothrow) NodeServer(engine, idleMs);
+    return new (std::nothrow) NodeServer(engine, idleMs, std::move(name), std::move(listen));
 }
 
-NodeServer::NodeServer(Engine &engine, DWORD idleMs)
-    : m_engine(engine), m_idleMs(idleMs), m_stop(CreateEventW(nullptr, TRUE, FALSE, nullptr)),
-      m_sessionEnded(CreateEventW(nullptr, FALSE, FALSE, nullptr))
+NodeServer::NodeServer(Engine &engine, DWORD idleMs, std::wstring name, std::wstring listen)
+    : m_engine(engine), m_idleMs(idleMs), m_pipeName(L"\\\\.\\pipe\\" + name), m_listen(std::move(listen)),
+      m_stop(CreateEventW(nullptr, TRUE, FALSE, nullptr)), m_sessionEnded(CreateEventW(nullptr, FALSE, FALSE, nullptr))
 {
 }
 
@@ -30,7 +32,7 @@ NodeServer::~NodeServer()
 
 HANDLE NodeServer::NewInstance(bool first)
 {
-    return CreateNamedPipeW(wire::NodePipeName(),
+    return CreateNamedPipeW(m_pipeName.c_str(),
                             PIPE_ACCESS_DUPLEX | FILE_FLAG_OVERLAPPED | (first ? FILE_FLAG_FIRST_PIPE_INSTANCE : 0),
                             PIPE_TYPE_BYTE | PIPE_READMODE_BYTE | PIPE_WAIT, PIPE_UNLIMITED_INSTANCES, kPipeBuffer,
                             kPipeBuffer, 0, nullptr);
@@ -41,11 +43,18 @@ int NodeServer::Run()
     // One node per machine: libraries that find none may start several at
     // once. The name is held for the node's life (the pipe's own "first
     // instance" flag is not honoured everywhere).
-    HANDLE single = CreateMutexW(nullptr, FALSE, L"Local\\CadroNode");
+    std::wstring mutexName = L"Local\\" + m_pipeName.substr(m_pipeName.rfind(L'\\') + 1);
+    HANDLE single = CreateMutexW(nullptr, FALSE, mutexName.c_str());
     if (!single || GetLastError() == ERROR_ALREADY_EXISTS) {
         if (single)
             CloseHandle(single);
         return 1;
+    }
+    std::wstring why;
+    if (!m_listen.empty() && !m_listener.Open(m_listen, why)) {
+        fwprintf(stderr, L"cadronode: %ls\n", why.c_str());
+        CloseHandle(single);
+        return 3;
     }
     // The network is up before the pipe appears: a library that finds the
     // pipe finds a node ready to answer.
@@ -77,24 +86,22 @@ int NodeServer::Run()
                 SetEvent(connected);
             }
         }
-        HANDLE events[] = {m_stop, connected, m_sessionEnded};
-        DWORD woke = WaitForMultipleObjects(3, events, FALSE, kIdleCheckMs);
+        HANDLE events[] = {m_stop, connected, m_sessionEnded, m_listener.Event()};
+        DWORD woke = WaitForMultipleObjects(m_listener.Event() ? 4 : 3, events, FALSE, kIdleCheckMs);
         if (woke == WAIT_OBJECT_0)
             break;
+        if (woke == WAIT_OBJECT_0 + 3)
+            if (std::unique_ptr<SocketChannel> channel = m_listener.Accept())
+                AddSession(std::move(channel), true);
         if (woke == WAIT_OBJECT_0 + 1) {
             DWORD unused = 0;
             listening = false;
             bool accepted = connectedBefore || GetOverlappedResult(pipe, &ov, &unused, FALSE);
             connectedBefore = false;
-            if (accepted) {
-                std::lock_guard<SlimMutex> l(m_sessionsLock);
-                if (NodeSession *session = NodeSession::Start(m_engine, pipe, m_sessionEnded))
-                    m_sessions.push_back(session);
-                else
-                    CloseHandle(pipe);
-            } else {
+            if (accepted)
+                AddSession(std::make_shared<PipeChannel>(pipe), false);
+            else
                 CloseHandle(pipe);
-            }
             pipe = NewInstance(false);
         }
         Reap(false);
@@ -122,6 +129,13 @@ int NodeServer::Run()
     m_engine.ReleaseUse();
     CloseHandle(single);
     return 0;
+}
+
+void NodeServer::AddSession(std::shared_ptr<Channel> channel, bool fromNode)
+{
+    std::lock_guard<SlimMutex> l(m_sessionsLock);
+    if (NodeSession *session = NodeSession::Start(m_engine, std::move(channel), fromNode, m_sessionEnded))
+        m_sessions.push_back(session);
 }
 
 void NodeServer::Reap(bool all)

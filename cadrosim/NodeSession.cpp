@@ -12,6 +12,7 @@ namespace {
 // dropped rather than the node's memory filled (it reconnects and
 // subscribes again when it recovers).
 constexpr size_t kLargestBacklog = 256u << 20;
+const wchar_t kNoCommands[] = L"the node takes commands from its own machine only";
 
 uint32_t IdOf(void *cookie)
 {
@@ -19,13 +20,14 @@ uint32_t IdOf(void *cookie)
 }
 } // namespace
 
-NodeSession *NodeSession::Start(Engine &engine, HANDLE pipe, HANDLE ended)
+NodeSession *NodeSession::Start(Engine &engine, std::shared_ptr<Channel> channel, bool fromNode, HANDLE ended)
 {
-    return new (std::nothrow) NodeSession(engine, pipe, ended);
+    return new (std::nothrow) NodeSession(engine, std::move(channel), fromNode, ended);
 }
 
-NodeSession::NodeSession(Engine &engine, HANDLE pipe, HANDLE ended)
-    : m_engine(engine), m_channel(std::make_shared<PipeChannel>(pipe)), m_endedEvent(ended), m_queue(kLargestBacklog)
+NodeSession::NodeSession(Engine &engine, std::shared_ptr<Channel> channel, bool fromNode, HANDLE ended)
+    : m_engine(engine), m_channel(std::move(channel)), m_fromNode(fromNode), m_endedEvent(ended),
+      m_queue(kLargestBacklog)
 {
     m_queue.Attach(m_channel);
     m_reader = std::thread([this] { ReadLoop(); });
@@ -103,7 +105,9 @@ bool NodeSession::Handle(wire::Kind kind, wire::In &in)
         std::wstring command = in.Text();
         if (!in.Ok())
             break;
-        std::wstring answer = m_engine.Execute(command);
+        // Another machine's node asks for values, never for commands: the
+        // port must not let anyone who reaches it load or stop this node.
+        std::wstring answer = m_fromNode ? L"error: " + std::wstring(kNoCommands) + L"\n" : m_engine.Execute(command);
         Reply([&](wire::Out &out) {
             out.U32(request);
             out.Text(answer);
@@ -115,8 +119,8 @@ bool NodeSession::Handle(wire::Kind kind, wire::In &in)
         std::wstring description = in.Text();
         if (!in.Ok())
             break;
-        std::wstring error;
-        bool loaded = m_engine.Load(description, error);
+        std::wstring error = kNoCommands;
+        bool loaded = !m_fromNode && m_engine.Load(description, error);
         Reply([&](wire::Out &out) {
             out.U32(request);
             out.U8(loaded ? 1 : 0);
@@ -138,7 +142,8 @@ void NodeSession::Subscribe(wire::In &in)
     if (!in.Ok())
         return;
     CadroDataItem *item = nullptr;
-    HRESULT hr = m_engine.Subscribe(url.c_str(), reinterpret_cast<void *>(static_cast<uintptr_t>(id)), this, &item);
+    HRESULT hr =
+        m_engine.Subscribe(url.c_str(), reinterpret_cast<void *>(static_cast<uintptr_t>(id)), this, &item, m_fromNode);
     if (SUCCEEDED(hr)) {
         CadroDataItem *previous = nullptr;
         {
@@ -184,7 +189,7 @@ CadroDataItem *NodeSession::Find(uint32_t id)
 void NodeSession::List(uint32_t request, const std::wstring &url)
 {
     std::vector<BrowseEntry> entries;
-    bool found = m_engine.Browse(url, entries);
+    bool found = m_engine.Browse(url, entries, m_fromNode);
     Reply([&](wire::Out &out) {
         out.U32(request);
         out.U8(found ? 1 : 0);

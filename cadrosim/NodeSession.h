@@ -13,9 +13,10 @@ namespace cadrosim {
 
 class NodeSession : public CSimUnknown<ICadroRealTimeReceiver> {
 public:
-    // Starts serving the connected pipe (taken over on success); ended is
-    // signalled when it is done.
-    static NodeSession *Start(Engine &engine, HANDLE pipe, HANDLE ended);
+    // Starts serving a connected library, or the node of another machine
+    // (fromNode: it is served only the machines this node serves itself);
+    // ended is signalled when it is done.
+    static NodeSession *Start(Engine &engine, std::shared_ptr<Channel> channel, bool fromNode, HANDLE ended);
     // Tells the library that the node is closing, then ends the connection
     // (the session then lets go of its subscriptions).
     void Finish();
@@ -33,7 +34,7 @@ public:
     HRESULT STDMETHODCALLTYPE StatusChange(void *cookie, uint32_t status, uint32_t, uint32_t) override;
 
 private:
-    NodeSession(Engine &engine, HANDLE pipe, HANDLE ended);
+    NodeSession(Engine &engine, std::shared_ptr<Channel> channel, bool fromNode, HANDLE ended);
     void ReadLoop();
     bool Handle(wire::Kind kind, wire::In &in);
     void Subscribe(wire::In &in);
@@ -45,7 +46,8 @@ private:
     void ReleaseAll();
 
     Engine &m_engine;
-    std::shared_ptr<PipeChannel> m_channel;
+    std::shared_ptr<Channel> m_channel;
+    bool m_fromNode;
     HANDLE m_endedEvent;
     std::atomic<bool> m_ended{false};
     SlimMutex m_subsLock;

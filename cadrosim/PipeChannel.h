@@ -1,7 +1,8 @@
 #pragma once
-// One end of a byte pipe opened for overlapped I/O, read by one thread and
-// written by another at the same time (blocking I/O on one handle would run
-// them one after the other). Close() from any thread ends both.
+// One end of a byte pipe opened for overlapped I/O (blocking I/O on one
+// handle would run the reader and the writer one after the other).
+#include "Channel.h"
+
 #include <windows.h>
 
 #include <atomic>
@@ -9,20 +10,16 @@
 
 namespace cadrosim {
 
-class PipeChannel {
+class PipeChannel : public Channel {
 public:
     explicit PipeChannel(HANDLE pipe); // takes the handle over
-    ~PipeChannel();
+    ~PipeChannel() override;
     PipeChannel(const PipeChannel &) = delete;
     PipeChannel &operator=(const PipeChannel &) = delete;
 
-    // Appends what arrives (waiting for at least one byte); false when the
-    // pipe broke or was closed.
-    bool Read(std::string &buffer);
-    // Writes all of bytes; false when the pipe broke or was closed.
-    bool Write(const std::string &bytes);
-    void Close();
-    bool Closed() const { return m_closed; }
+    bool Read(std::string &buffer) override;
+    bool Write(const std::string &bytes) override;
+    void Close() override;
 
 private:
     bool Finish(OVERLAPPED &ov, BOOL started, DWORD &bytes);

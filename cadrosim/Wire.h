@@ -29,7 +29,8 @@ enum class Kind : uint8_t {
     Closing,    // the node is shutting down on request: not to be restarted
 };
 
-// The node's pipe; one per network node of this machine.
+// The machine's node: its pipe, which every server's libraries reach.
+constexpr const wchar_t *kNodeName = L"CadroNode";
 inline const wchar_t *NodePipeName()
 {
     return L"\\\\.\\pipe\\CadroNode";

@@ -20,6 +20,14 @@ TEST(NetworkDescription, BadFilesGiveLineNumberedErrors)
         {L"machine A\nprocess p\nobject o\nmember x\nmember x", L"line 5: the object already has a member x"},
         {L"machine A\nprocess p\nobject o\nmember a.b", L"line 4: member name 'a.b' cannot be used in a URL"},
         {L"gadget A", L"line 1: unknown keyword 'gadget'"},
+        {L"machine A colour=red", L"line 1: expected: machine <name> [node=<host>:<port>]"},
+        {L"machine A node=plant9", L"line 1: expected: node=<host>:<port>"},
+        {L"machine A node=plant9:0", L"line 1: expected: node=<host>:<port>"},
+        {L"machine A node=plant9:65536", L"line 1: expected: node=<host>:<port>"},
+        {L"machine A node=::1:4850", L"line 1: expected: node=<host>:<port>"},
+        {L"machine A node=:4850", L"line 1: expected: node=<host>:<port>"},
+        {L"machine $HOST node=plant9:4850", L"line 1: this machine cannot be served by another node"},
+        {L"machine A node=plant9:4850\nprocess p", L"line 2: machine 'A' is served by the node at plant9:4850"},
     };
     for (const Case &c : cases) {
         BSTR error = nullptr;

@@ -295,3 +295,37 @@ TEST_F(SimTest, FaultsDisconnectStallAndBadQuality)
     EXPECT_EQ(Command(L"disconnect NOWHERE").rfind(L"error:", 0), 0u);
     EXPECT_EQ(Command(L"frobnicate").rfind(L"error:", 0), 0u);
 }
+
+TEST_F(SimTest, AMachineOfAnotherNodeThatCannotBeReachedWaitsForIt)
+{
+    // Port 1 of the loopback address: nothing listens, the node is away.
+    BSTR error = nullptr;
+    ASSERT_EQ(CadroSim_Load((std::wstring(kTestNetwork) + L"machine FAR node=[::1]:1\n").c_str(), &error), S_OK)
+        << (error ? error : L"");
+    EXPECT_NE(Command(L"browse \\").find(L"\\\\FAR"), std::wstring::npos);
+    EXPECT_NE(Command(L"status").find(L"machine FAR served by the node at [::1]:1"), std::wstring::npos);
+    std::wstring refused = Command(L"publish \\\\FAR\\p\\o.m 1");
+    EXPECT_EQ(refused, L"error: that machine is served by the node at [::1]:1: run the command there\n");
+    EXPECT_EQ(Command(L"browse \\\\FAR\\p").rfind(L"error: unknown URL", 0), 0u);
+
+    // Taken, and told that its machine is being connected to, as on a
+    // disconnected machine; the machine's own members go on as before.
+    HRESULT hr = E_FAIL;
+    void *away = NextCookie();
+    ASSERT_NE(Subscribe(L"\\\\FAR\\p\\o.m", &hr, away), nullptr);
+    EXPECT_EQ(hr, S_OK);
+    auto has = [](void *cookie, Delivery::Kind kind, uint32_t status) {
+        return [=](const std::vector<Delivery> &all) {
+            return std::any_of(all.begin(), all.end(), [&](const Delivery &d) {
+                return d.cookie == cookie && d.kind == kind && (kind != Delivery::Status || d.status == status);
+            });
+        };
+    };
+    EXPECT_TRUE(recorder.WaitFor(has(away, Delivery::Status, 13)));
+    EXPECT_EQ(recorder.Count(away, Delivery::Data), 0u);
+    void *here = NextCookie();
+    ASSERT_NE(Subscribe(L"\\\\" + Host() + L"\\p\\o.num", nullptr, here), nullptr);
+    EXPECT_TRUE(recorder.WaitFor(has(here, Delivery::Data, 0)));
+    // Loading another network lets go of the node's link.
+    EXPECT_EQ(Command(L"reset"), L"ok\n");
+}

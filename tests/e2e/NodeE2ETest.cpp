@@ -1,14 +1,18 @@
 // The network node seen from outside: values outlive the processes that
 // wrote them, several processes (two servers among them) share one network,
-// and a node that dies is reported to every subscription and started again,
-// which then resume.
+// a node that dies is reported to every subscription and started again,
+// which then resume, and a machine that another node serves is reached
+// through this machine's node over TCP.
 #include "ChildProcess.h"
 #include "ComPtr.h"
 #include "Handle.h"
 #include "OpcRunner.h"
 #include "ServerProcess.h"
+#include "TestNetwork.h"
 #include "TestSink.h"
 #include "opcda.h"
+
+#include <winsock2.h>
 
 #include <gtest/gtest.h>
 
@@ -49,13 +53,21 @@ std::string From(const std::string &text, const std::string &from)
 }
 
 // The server COM starts, with an active group whose sink has seen the
-// described value of kTemperature.
+// first value of its item (the described value of kTemperature).
 struct Subscribed {
     void Start()
+    {
+        ASSERT_NO_FATAL_FAILURE(Create());
+        ASSERT_NO_FATAL_FAILURE(Add(kTemperature, 21.5));
+    }
+    void Create()
     {
         ASSERT_EQ(CoCreateInstance(CLSID_SkylarcOPCServerE2E, nullptr, CLSCTX_LOCAL_SERVER, IID_IOPCServer,
                                    reinterpret_cast<void **>(server.Out())),
                   S_OK);
+    }
+    void Add(const wchar_t *id, double first)
+    {
         OPCHANDLE group = 0;
         DWORD rate = 0;
         ASSERT_EQ(server->AddGroup(L"node", TRUE, 50, 0, nullptr, nullptr, 0, &group, &rate, IID_IOPCItemMgt,
@@ -66,14 +78,15 @@ struct Subscribed {
         ASSERT_EQ(container->FindConnectionPoint(IID_IOPCDataCallback, point.Out()), S_OK);
         ASSERT_EQ(point->Advise(&sink, &cookie), S_OK);
         OPCITEMDEF def = {};
-        def.szItemID = const_cast<wchar_t *>(kTemperature);
+        def.szItemID = const_cast<wchar_t *>(id);
         def.bActive = TRUE;
         OPCITEMRESULT *results = nullptr;
         HRESULT *errors = nullptr;
         ASSERT_EQ(items->AddItems(1, &def, &results, &errors), S_OK);
+        item = results[0].hServer;
         CoTaskMemFree(results);
         CoTaskMemFree(errors);
-        ASSERT_TRUE(sink.WaitFor([](auto &calls) { return HasDataChange(calls, 21.5); }));
+        ASSERT_TRUE(sink.WaitFor([first](auto &calls) { return HasDataChange(calls, first); }));
     }
     // Lets go of the server (its process then exits).
     void Stop()
@@ -91,6 +104,7 @@ struct Subscribed {
     ComPtr<IOPCItemMgt> items;
     ComPtr<IConnectionPoint> point;
     DWORD cookie = 0;
+    OPCHANDLE item = 0;
     TestSink sink;
 };
 } // namespace
@@ -173,6 +187,149 @@ TEST(NodeE2E, TwoServerProcessesSeeOnePublish)
     std::string printed = second.get();
     EXPECT_TRUE(Has(printed, "added 0x00000000")) << printed;
     EXPECT_TRUE(Has(printed, "value 55")) << printed;
+
+    first.Stop();
+    EXPECT_TRUE(WaitForNoServerProcess(20000));
+}
+
+namespace {
+const wchar_t kLevel[] = L"\\\\PLANT9\\control\\Boiler.level";
+
+// A TCP port of the loopback address that nothing listens on now.
+unsigned short FreePort()
+{
+    WSADATA data;
+    if (WSAStartup(MAKEWORD(2, 2), &data) != 0)
+        return 0;
+    SOCKET s = socket(AF_INET, SOCK_STREAM, IPPROTO_TCP);
+    sockaddr_in address = {};
+    address.sin_family = AF_INET;
+    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    int size = sizeof address;
+    unsigned short port = 0;
+    if (bind(s, reinterpret_cast<sockaddr *>(&address), sizeof address) == 0 &&
+        getsockname(s, reinterpret_cast<sockaddr *>(&address), &size) == 0)
+        port = ntohs(address.sin_port);
+    closesocket(s);
+    WSACleanup();
+    return port;
+}
+
+// Another machine's node, on this one: a node of its own name that serves a
+// description to other nodes at a loopback port.
+class OtherNode {
+public:
+    OtherNode(const std::wstring &description, unsigned short port)
+        : m_command(L"\"" + BinPath(L"cadronode.exe") + L"\" --name CadroNodeE2E --idle 60 --listen 127.0.0.1:" +
+                    std::to_wstring(port) + L" --network \"" + description + L"\"")
+    {
+    }
+    ~OtherNode() { Kill(); }
+    OtherNode(const OtherNode &) = delete;
+    OtherNode &operator=(const OtherNode &) = delete;
+
+    // Started, and answering its control pipe.
+    bool Start()
+    {
+        m_process.Reset(StartProcess(m_command));
+        std::string output;
+        for (int i = 0; m_process && i < 100; ++i, Sleep(100))
+            if (Cadroctl(L"status", output) == 0)
+                return true;
+        return false;
+    }
+    long Cadroctl(const std::wstring &arguments, std::string &output)
+    {
+        return RunAndCapture(L"\"" + BinPath(L"cadroctl.exe") + L"\" --pid " +
+                                 std::to_wstring(GetProcessId(m_process.Get())) + L" " + arguments,
+                             output);
+    }
+    void Kill()
+    {
+        if (!m_process)
+            return;
+        TerminateProcess(m_process.Get(), 9);
+        WaitForSingleObject(m_process.Get(), 10000);
+        m_process.Reset();
+    }
+
+private:
+    std::wstring m_command;
+    UniqueHandle m_process;
+};
+} // namespace
+
+TEST(NodeE2E, AMachineServedByAnotherNodeIsReachedOverTcp)
+{
+    unsigned short port = FreePort();
+    ASSERT_NE(port, 0);
+    std::string at = "127.0.0.1:" + std::to_string(port);
+    // The other node names a machine at its own address, as this one does:
+    // a request for it must be refused, not sent round for ever.
+    TestNetwork plant9(L"plant9_network.txt", "machine PLANT9\nprocess control\nobject Boiler\n"
+                                              "member level type=number access=rw value=5\n"
+                                              "machine LOOP node=" +
+                                                  at + "\n");
+    TestNetwork here(L"here_network.txt", "machine $HOST\nprocess proc1\nobject Setpoints\n"
+                                          "member temperature type=number access=rw value=21.5\n"
+                                          "machine PLANT9 node=" +
+                                              at + "\nmachine LOOP node=" + at + "\n");
+    ASSERT_TRUE(plant9.Ok() && here.Ok());
+    OtherNode other(plant9.Path(), port);
+    ASSERT_TRUE(other.Start());
+
+    Subscribed first;
+    ASSERT_NO_FATAL_FAILURE(first.Create());
+    ASSERT_EQ(here.Load(), 0);
+    ASSERT_NO_FATAL_FAILURE(first.Add(kLevel, 5));
+    TestSink &sink = first.sink;
+    auto client = std::async(std::launch::async, [] {
+        std::string output;
+        RunAndCapture(L"\"" + BinPath(L"node_client.exe") + L"\" " + kLevel + L" 50 77", output, 80000);
+        return output;
+    });
+
+    // Published there, seen here; written here, stored there.
+    std::string out;
+    EXPECT_EQ(other.Cadroctl(std::wstring(L"publish ") + kLevel + L" 6", out), 0) << out;
+    EXPECT_TRUE(sink.WaitFor([](auto &calls) { return HasDataChange(calls, 6); }));
+    ComPtr<IOPCSyncIO> io;
+    ASSERT_EQ(first.items.As(io), S_OK);
+    VARIANT seven;
+    seven.vt = VT_R8;
+    seven.dblVal = 7;
+    HRESULT *errors = nullptr;
+    EXPECT_EQ(io->Write(1, &first.item, &seven, &errors), S_OK);
+    CoTaskMemFree(errors);
+    EXPECT_TRUE(sink.WaitFor([](auto &calls) { return HasDataChange(calls, 7); }));
+    EXPECT_EQ(other.Cadroctl(std::wstring(L"show ") + kLevel, out), 0) << out;
+    EXPECT_TRUE(Has(out, "value 7")) << out;
+    EXPECT_NE(RunCadroctl(std::wstring(L"show ") + kLevel, out), 0);
+    EXPECT_TRUE(Has(out, "served by the node at " + at)) << out;
+
+    OPCITEMDEF loop = {};
+    loop.szItemID = const_cast<wchar_t *>(L"\\\\LOOP\\control\\Boiler.level");
+    OPCITEMRESULT *results = nullptr;
+    errors = nullptr;
+    EXPECT_EQ(first.items->AddItems(1, &loop, &results, &errors), S_FALSE);
+    EXPECT_EQ(errors ? errors[0] : S_OK, static_cast<HRESULT>(0xC0040007)) << "OPC_E_UNKNOWNITEMID";
+    CoTaskMemFree(results);
+    CoTaskMemFree(errors);
+
+    // The other node dies and comes back: the subscriptions hear of it and
+    // resume on the new one (the published value proves it).
+    other.Kill();
+    ASSERT_TRUE(other.Start());
+    bool resumed = false;
+    for (int i = 0; i < 20 && !resumed; ++i) {
+        other.Cadroctl(std::wstring(L"publish ") + kLevel + L" 77", out);
+        resumed = sink.WaitFor([](auto &calls) { return HasDataChange(calls, 77); }, 500);
+    }
+    EXPECT_TRUE(resumed);
+    std::string printed = client.get();
+    std::string afterKill = From(printed, "status 15");
+    EXPECT_FALSE(afterKill.empty()) << "the disconnection was not reported:\n" << printed;
+    EXPECT_TRUE(Has(From(afterKill, "status 17"), "value 77")) << printed;
 
     first.Stop();
     EXPECT_TRUE(WaitForNoServerProcess(20000));

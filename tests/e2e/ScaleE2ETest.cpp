@@ -1,9 +1,9 @@
 // Plant-size AddItems across the process boundary: 20,000 distinct items of
 // one network file, every result with its member's own type and rights.
 #include "ComPtr.h"
-#include "Handle.h"
 #include "ItemDefinitions.h"
 #include "ServerProcess.h"
+#include "TestNetwork.h"
 #include "opcda.h"
 
 #include <gtest/gtest.h>
@@ -19,39 +19,6 @@ const VARTYPE kCanonical[] = {VT_R8, VT_BOOL, VT_BSTR};
 const char *const kAccess[] = {"rw", "r", "w"};
 const DWORD kRights[] = {3, 1, 2};
 
-// A network of the test's own, loaded into the network node while it lives;
-// then the node goes back to its configured description.
-class NetworkFile {
-public:
-    explicit NetworkFile(const std::string &text) : m_path(BinPath(L"scale_e2e_network.txt"))
-    {
-        UniqueHandle file(CreateFileW(m_path.c_str(), GENERIC_WRITE, 0, nullptr, CREATE_ALWAYS, 0, nullptr));
-        DWORD written = 0;
-        m_ok = file && WriteFile(file.Get(), text.data(), static_cast<DWORD>(text.size()), &written, nullptr);
-    }
-    ~NetworkFile()
-    {
-        std::string output;
-        RunCadroctl(L"reset", output);
-        DeleteFileW(m_path.c_str());
-    }
-    NetworkFile(const NetworkFile &) = delete;
-    NetworkFile &operator=(const NetworkFile &) = delete;
-    bool Ok() const { return m_ok; }
-    // Into the node, which a server has started (or is starting).
-    long Load()
-    {
-        std::string output;
-        long code = -1;
-        for (int i = 0; i < 100 && code != 0; ++i, Sleep(100))
-            code = RunCadroctl(L"load \"" + m_path + L"\"", output);
-        return code;
-    }
-
-private:
-    std::wstring m_path;
-    bool m_ok = false;
-};
 } // namespace
 
 TEST(ScaleE2E, AddItemsOfTwentyThousandDistinctItemsGivesEachItsTypeAndRights)
@@ -64,7 +31,7 @@ TEST(ScaleE2E, AddItemsOfTwentyThousandDistinctItemsGivesEachItsTypeAndRights)
             text += "member tag" + std::to_string(i) + " type=" + kTypes[i % 3] + " access=" + kAccess[i % 3] + "\n";
     }
     ASSERT_TRUE(WaitForNoServerProcess(20000));
-    NetworkFile network(text);
+    TestNetwork network(L"scale_e2e_network.txt", text);
     ASSERT_TRUE(network.Ok());
     {
         ComPtr<IOPCServer> server;

@@ -51,7 +51,20 @@ DWORD ServerProcessId()
 
 DWORD NodeProcessId()
 {
-    return ProcessIdOf(L"cadronode.exe");
+    // The machine's node is the one that serves its pipe: a test may run a
+    // second node beside it, for another machine.
+    for (int attempt = 0; attempt < 50; ++attempt) {
+        UniqueHandle pipe(CreateFileW(L"\\\\.\\pipe\\CadroNode", GENERIC_READ | GENERIC_WRITE, 0, nullptr,
+                                      OPEN_EXISTING, 0, nullptr));
+        if (pipe) {
+            ULONG pid = 0;
+            return GetNamedPipeServerProcessId(pipe.Get(), &pid) ? pid : 0;
+        }
+        if (GetLastError() != ERROR_PIPE_BUSY)
+            return 0;
+        WaitNamedPipeW(L"\\\\.\\pipe\\CadroNode", 100);
+    }
+    return 0;
 }
 
 namespace {

@@ -12,7 +12,8 @@ extern const CLSID CLSID_SkylarcOPCServerE2E;
 // Number of running processes whose image is Local.exe, or image.
 int CountServerProcesses();
 int CountProcesses(const wchar_t *image);
-// The id of a running Local.exe, or of the network node, 0 when none.
+// The id of a running Local.exe, or of the machine's network node, 0 when
+// none.
 DWORD ServerProcessId();
 DWORD NodeProcessId();
 // Runs cadroctl against the network node only (test programs serve
