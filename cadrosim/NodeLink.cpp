@@ -24,6 +24,7 @@ constexpr DWORD kReconnectPauseMs = 500;
 constexpr DWORD kRestartMs = 2000;
 constexpr DWORD kTcpConnectMs = 3000;
 constexpr size_t kMostKnownUrls = 4u << 20;
+constexpr uint32_t kFeedBit = 1u << 31; // on a batch entry's index: a feed's
 
 uint64_t UrlHash(std::wstring_view url)
 {
@@ -134,53 +135,13 @@ std::wstring RemoteSubscription::Url() const
 
 RemoteSubscription::~RemoteSubscription()
 {
-    ClearCadroValue(m_value);
     receiver->Release();
     Link().ReleaseUse();
 }
 
-void RemoteSubscription::Remember(uint32_t flags, const CadroValue &value, int32_t error, uint32_t low, uint32_t high)
-{
-    m_connected = true;
-    if (flags & kCadroHasValue) {
-        ClearCadroValue(m_value);
-        m_value = value;
-        if ((m_value.type & kCadroTextBit) && m_value.text)
-            m_value.text->AddRef();
-    }
-    if (flags & kCadroHasQuality)
-        m_bad = error != 0;
-    if (flags & kCadroHasTime)
-        m_time = {low, high};
-    else
-        GetSystemTimeAsFileTime(&m_time);
-}
-
-void RemoteSubscription::RememberStatus(uint32_t status)
-{
-    if (status == kCadroStatusDisconnected)
-        m_connected = false;
-    else if (status == kCadroStatusContacted)
-        m_connected = true;
-    else if (status == kCadroStatusSubscribeFailed)
-        ClearCadroValue(m_value); // the member has gone: no value to read
-}
-
 HRESULT RemoteSubscription::Recall(uint32_t *flags, CadroValue *value, int32_t *errorFlag, FILETIME *time) const
 {
-    if (!m_connected)
-        return kNotConnected;
-    if (m_value.type == kCadroNoValue) {
-        GetSystemTimeAsFileTime(time); // no value yet: the time of the query
-        return S_OK;
-    }
-    *value = m_value;
-    if ((value->type & kCadroTextBit) && value->text)
-        value->text->AddRef();
-    *flags = kCadroHasValue | kCadroHasQuality | kCadroHasTime;
-    *errorFlag = m_bad ? 1 : 0;
-    *time = m_time;
-    return S_OK;
+    return (feed ? feed->mirror : mirror).Recall(flags, value, errorFlag, time);
 }
 
 void RemoteSubscription::Delete()
@@ -419,6 +380,7 @@ void NodeLink::Disconnected()
         for (auto &entry : m_pending)
             entry.second->done = true; // unanswered
         m_pending.clear();
+        DropFeeds(); // the node's feeds are the connection's
         // Told once, however often a connection fails before the node is
         // back.
         for (RemoteSubscription *sub : m_slots)
@@ -429,7 +391,7 @@ void NodeLink::Disconnected()
     for (uint32_t id : ids)
         CallSubscription(
             id, [](RemoteSubscription &sub) { sub.receiver->StatusChange(sub.cookie, kCadroStatusDisconnected, 0, 0); },
-            [](RemoteSubscription &sub) { sub.RememberStatus(kCadroStatusDisconnected); });
+            [](RemoteSubscription &sub) { sub.mirror.RememberStatus(kCadroStatusDisconnected); });
 }
 
 bool NodeLink::WaitConnected(std::unique_lock<SlimMutex> &l, bool forAnswer)
@@ -469,7 +431,100 @@ template <class Call, class Note> void NodeLink::CallSubscription(uint32_t id, C
     sub->Unpin();
 }
 
-void NodeLink::TakeData(wire::In &in)
+template <class Call, class Note> void NodeLink::CallFeed(uint32_t feedId, Call call, Note note)
+{
+    std::vector<RemoteSubscription *> members;
+    {
+        std::lock_guard<SlimMutex> l(m_lock);
+        LinkFeed *feed = FeedOf(feedId);
+        if (!feed)
+            return;
+        note(*feed);
+        members = feed->members;
+        for (RemoteSubscription *sub : members)
+            sub->Pin();
+    }
+    for (RemoteSubscription *sub : members) {
+        sub->Deliver(call, m_callWaiters, m_lock, m_callReturned);
+        sub->Unpin();
+    }
+}
+
+LinkFeed *NodeLink::FeedOf(uint32_t feedId) const
+{
+    uint32_t slot = (feedId & wire::kFeedSlotMask) - 1;
+    if (slot >= m_feeds.size() || !m_feeds[slot] || m_feeds[slot]->id != feedId)
+        return nullptr;
+    return m_feeds[slot];
+}
+
+void NodeLink::Join(uint32_t id, uint32_t feedId)
+{
+    RemoteSubscription *sub = Lookup(id);
+    uint32_t slot = (feedId & wire::kFeedSlotMask) - 1;
+    if (!sub || slot == UINT32_MAX || slot >= wire::kFeedSlotMask)
+        return;
+    LeaveFeed(sub);
+    if (slot >= m_feeds.size())
+        m_feeds.resize(slot + 1, nullptr);
+    LinkFeed *&feed = m_feeds[slot];
+    if (feed && feed->id != feedId) {
+        // An earlier feed of the slot that the node has dropped.
+        for (RemoteSubscription *member : feed->members) {
+            member->mirror.CopyFrom(feed->mirror);
+            member->feed = nullptr;
+        }
+        delete feed;
+        feed = nullptr;
+    }
+    if (!feed) {
+        feed = new (std::nothrow) LinkFeed();
+        if (!feed)
+            return; // the subscription goes on with what it was told itself
+        feed->id = feedId;
+        // What the node told the newcomer is the feed's state now.
+        feed->mirror.CopyFrom(sub->mirror);
+    }
+    sub->feed = feed;
+    sub->feedIndex = static_cast<uint32_t>(feed->members.size());
+    feed->members.push_back(sub);
+}
+
+void NodeLink::LeaveFeed(RemoteSubscription *sub)
+{
+    LinkFeed *feed = sub->feed;
+    if (!feed)
+        return;
+    sub->mirror.CopyFrom(feed->mirror);
+    std::vector<RemoteSubscription *> &members = feed->members;
+    if (sub->feedIndex + 1 < members.size()) {
+        members[sub->feedIndex] = members.back();
+        members[sub->feedIndex]->feedIndex = sub->feedIndex;
+    }
+    members.pop_back();
+    sub->feed = nullptr;
+    if (members.empty()) {
+        m_feeds[(feed->id & wire::kFeedSlotMask) - 1] = nullptr;
+        delete feed;
+    }
+}
+
+void NodeLink::DropFeeds()
+{
+    for (LinkFeed *&feed : m_feeds) {
+        if (!feed)
+            continue;
+        for (RemoteSubscription *member : feed->members) {
+            member->mirror.CopyFrom(feed->mirror);
+            member->feed = nullptr;
+        }
+        delete feed;
+        feed = nullptr;
+    }
+    m_feeds.clear();
+}
+
+void NodeLink::TakeData(wire::In &in, bool feeds)
 {
     DataFields f;
     f.flags = in.U32();
@@ -479,10 +534,11 @@ void NodeLink::TakeData(wire::In &in)
     f.high = in.U32();
     auto index = static_cast<uint32_t>(m_batchFields.size());
     m_batchFields.push_back(f);
+    uint32_t tagged = index | (feeds ? kFeedBit : 0);
     while (in.Ok() && !in.AtEnd()) {
         uint32_t id = in.U32();
         if (in.Ok())
-            m_batchIds.emplace_back(id, index);
+            m_batchIds.emplace_back(id, tagged);
     }
 }
 
@@ -492,13 +548,24 @@ void NodeLink::DeliverData()
         return;
     {
         std::lock_guard<SlimMutex> l(m_lock);
-        for (auto [id, index] : m_batchIds)
-            if (RemoteSubscription *sub = Lookup(id)) {
-                const DataFields &f = m_batchFields[index];
-                sub->Remember(f.flags, f.value, f.error, f.low, f.high);
+        for (auto [id, tagged] : m_batchIds) {
+            uint32_t index = tagged & ~kFeedBit;
+            const DataFields &f = m_batchFields[index];
+            if (tagged & kFeedBit) {
+                // A feed's value: remembered once, for all its members.
+                if (LinkFeed *feed = FeedOf(id)) {
+                    feed->mirror.Remember(f.flags, f.value, f.error, f.low, f.high);
+                    for (RemoteSubscription *sub : feed->members) {
+                        sub->Pin();
+                        m_batchSubs.emplace_back(sub, index);
+                    }
+                }
+            } else if (RemoteSubscription *sub = Lookup(id)) {
+                sub->mirror.Remember(f.flags, f.value, f.error, f.low, f.high);
                 sub->Pin();
                 m_batchSubs.emplace_back(sub, index);
             }
+        }
     }
     for (auto [sub, index] : m_batchSubs) {
         const DataFields &f = m_batchFields[index];
@@ -516,8 +583,8 @@ void NodeLink::DeliverData()
 
 void NodeLink::Dispatch(wire::Kind kind, wire::In &in)
 {
-    if (kind == wire::Kind::Data) {
-        TakeData(in);
+    if (kind == wire::Kind::Data || kind == wire::Kind::FeedData) {
+        TakeData(in, kind == wire::Kind::FeedData);
         return;
     }
     DeliverData(); // what came before this frame, first
@@ -538,7 +605,36 @@ void NodeLink::Dispatch(wire::Kind kind, wire::In &in)
         if (in.Ok())
             CallSubscription(
                 id, [&](RemoteSubscription &sub) { sub.receiver->StatusChange(sub.cookie, status, 0, 0); },
-                [&](RemoteSubscription &sub) { sub.RememberStatus(status); });
+                [&](RemoteSubscription &sub) { sub.mirror.RememberStatus(status); });
+        return;
+    }
+    case wire::Kind::Joined: {
+        uint32_t id = in.U32();
+        uint32_t feedId = in.U32();
+        std::lock_guard<SlimMutex> l(m_lock);
+        if (in.Ok())
+            Join(id, feedId);
+        return;
+    }
+    case wire::Kind::FeedAttributes: {
+        uint32_t feedId = in.U32();
+        CadroAttributes a = {};
+        a.mask = in.U32();
+        a.dataType = in.U16();
+        a.access = in.U32();
+        if (in.Ok())
+            CallFeed(
+                feedId, [&](RemoteSubscription &sub) { sub.receiver->OnAttributes(sub.cookie, &a); },
+                [](LinkFeed &) {});
+        return;
+    }
+    case wire::Kind::FeedStatus: {
+        uint32_t feedId = in.U32();
+        uint32_t status = in.U32();
+        if (in.Ok())
+            CallFeed(
+                feedId, [&](RemoteSubscription &sub) { sub.receiver->StatusChange(sub.cookie, status, 0, 0); },
+                [&](LinkFeed &feed) { feed.mirror.RememberStatus(status); });
         return;
     }
     case wire::Kind::Reply: {
@@ -716,6 +812,7 @@ HRESULT NodeLink::Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeRece
 
 void NodeLink::Forget(RemoteSubscription *sub, std::unique_lock<SlimMutex> &l)
 {
+    LeaveFeed(sub);
     Unregister(sub);
     sub->Forgotten();
     // The link's thread never waits: the call under way elsewhere keeps the

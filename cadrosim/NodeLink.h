@@ -10,6 +10,7 @@
 // way, through a link to that node's TCP address (never started from here).
 #include "FrameQueue.h"
 #include "HashSet64.h"
+#include "MemberMirror.h"
 #include "Network.h"
 #include "Unknown.h"
 
@@ -21,6 +22,16 @@
 namespace cadrosim {
 
 class NodeLink;
+class RemoteSubscription;
+
+// The node's subscription that this process's subscriptions to one URL
+// share (the node's feed): the member as the node last sent it, and the
+// subscriptions that take its frames. The link's, under its lock.
+struct LinkFeed {
+    uint32_t id = 0;
+    MemberMirror mirror;
+    std::vector<RemoteSubscription *> members;
+};
 
 // A subscription through the node; the CadroDataItem its holder keeps.
 class RemoteSubscription : public CSimUnknown<CadroDataItem> {
@@ -35,17 +46,19 @@ public:
     // The URL, kept to subscribe again after a reconnection.
     std::wstring Url() const;
 
-    // Under the link's lock: the member's value as the node last sent it.
-    // The node sends every change to every subscription, so a read is
-    // answered from it without asking the node.
-    void Remember(uint32_t flags, const CadroValue &value, int32_t error, uint32_t low, uint32_t high);
-    void RememberStatus(uint32_t status);
+    // Under the link's lock: the member as the node last sent it, through
+    // the feed once the subscription has joined one.
     HRESULT Recall(uint32_t *flags, CadroValue *value, int32_t *errorFlag, FILETIME *time) const;
-    bool Connected() const { return m_connected; }
+    bool Connected() const { return (feed ? feed->mirror : mirror).Connected(); }
 
     ICadroRealTimeReceiver *receiver;
     void *cookie;
     uint32_t id = 0;
+    // Under the link's lock. What the node sent this subscription before it
+    // joined its feed (what a new subscription is told first).
+    MemberMirror mirror;
+    LinkFeed *feed = nullptr;
+    uint32_t feedIndex = 0; // in the feed's members
 
     // The link's handles on the object: one for its place in the table
     // (until its holder lets go) and one for each delivery that will call
@@ -92,12 +105,8 @@ private:
     // The URL is kept behind the object, in the same block: a byte a
     // character when it is ASCII (URLs nearly always are), else two.
     uint32_t m_urlLength;
-    CadroValue m_value = {}; // kCadroNoValue until the first value
-    FILETIME m_time = {};
     std::atomic<uint16_t> m_calling{0};
     std::atomic<bool> m_forgotten{false};
-    bool m_bad = false;
-    bool m_connected = true;
     bool m_urlNarrow;
     uint8_t m_link; // NodeLink::At
     std::atomic<DWORD> m_callingThread{0};
@@ -150,8 +159,13 @@ private:
     // Values arrive in batches: each id's subscription is looked up and its
     // value remembered under one hold of the lock per batch, then the
     // receivers are called without it.
-    void TakeData(wire::In &in);
+    void TakeData(wire::In &in, bool feeds);
     void DeliverData();
+    // Under m_lock: a subscription joins its feed, or leaves it.
+    void Join(uint32_t id, uint32_t feedId);
+    void LeaveFeed(RemoteSubscription *sub);
+    LinkFeed *FeedOf(uint32_t feedId) const;
+    void DropFeeds();
     void Disconnected();
     // Out of the table, then waits for a call to it under way on another
     // thread; the caller then unpins it.
@@ -163,6 +177,8 @@ private:
     {
         CallSubscription(id, call, [](RemoteSubscription &) {});
     }
+    // The same for every member of a feed; note(feed) first.
+    template <class Call, class Note> void CallFeed(uint32_t feedId, Call call, Note note);
     void TopologyChanged();
     // Whether the node is connected, waiting for one being connected to (a
     // node being started) unless it is another machine's and no answer is
@@ -195,6 +211,7 @@ private:
     std::vector<RemoteSubscription *> m_slots;
     std::vector<uint16_t> m_generations;
     std::vector<uint32_t> m_freeSlots;
+    std::vector<LinkFeed *> m_feeds; // by the node's slot of the feed
     uint32_t m_nextRequest = 0;
     std::unordered_map<uint32_t, Pending *> m_pending;
     // Member URLs that the node's listings confirmed, hashed: subscribing to
@@ -209,7 +226,8 @@ private:
     };
     // The batch of values being delivered; the link's thread's alone.
     std::vector<DataFields> m_batchFields;
-    std::vector<std::pair<uint32_t, uint32_t>> m_batchIds; // id, index of its fields
+    // id (or feed, with kFeedBit on the index), index of its fields
+    std::vector<std::pair<uint32_t, uint32_t>> m_batchIds;
     std::vector<std::pair<RemoteSubscription *, uint32_t>> m_batchSubs;
     std::vector<ICadroBrowserReceiver *> m_browserReceivers;
     HANDLE m_wake = nullptr; // cuts the pause between reconnections short

@@ -18,6 +18,29 @@ uint32_t IdOf(void *cookie)
 {
     return static_cast<uint32_t>(reinterpret_cast<uintptr_t>(cookie));
 }
+
+void *CookieOf(uint32_t id)
+{
+    return reinterpret_cast<void *>(static_cast<uintptr_t>(id));
+}
+
+// A Data frame's fields, packed on the stack when they hold no text.
+template <class Use>
+void WithFields(uint32_t flags, const CadroValue &value, int32_t error, uint32_t low, uint32_t high, Use use)
+{
+    wire::PackedFields packed;
+    if (packed.Pack(flags, value, error, low, high)) {
+        use(packed.View());
+        return;
+    }
+    wire::Out fields;
+    fields.U32(flags);
+    fields.Value(value);
+    fields.U32(static_cast<uint32_t>(error));
+    fields.U32(low);
+    fields.U32(high);
+    use(fields.View());
+}
 } // namespace
 
 NodeSession *NodeSession::Start(Engine &engine, std::shared_ptr<Channel> channel, bool fromNode, HANDLE ended)
@@ -64,13 +87,19 @@ void NodeSession::ReadLoop()
 
 void NodeSession::ReleaseAll()
 {
-    std::unordered_map<uint32_t, CadroDataItem *> subs;
+    std::vector<CadroDataItem *> items;
     {
-        std::lock_guard<SlimMutex> l(m_subsLock);
-        subs.swap(m_subs);
+        std::lock_guard<SlimMutex> l(m_feedsLock);
+        for (auto &feed : m_feeds)
+            if (feed && feed->item)
+                items.push_back(feed->item);
+        m_feeds.clear();
+        m_freeFeeds.clear();
+        m_feedOfUrl.clear();
+        m_memberships.clear();
     }
-    for (auto &entry : subs)
-        entry.second->Release();
+    for (CadroDataItem *item : items)
+        item->Release();
 }
 
 bool NodeSession::Handle(wire::Kind kind, wire::In &in)
@@ -141,19 +170,37 @@ void NodeSession::Subscribe(wire::In &in)
     std::wstring url = in.Text();
     if (!in.Ok())
         return;
-    CadroDataItem *item = nullptr;
-    HRESULT hr =
-        m_engine.Subscribe(url.c_str(), reinterpret_cast<void *>(static_cast<uintptr_t>(id)), this, &item, m_fromNode);
-    if (SUCCEEDED(hr)) {
-        CadroDataItem *previous = nullptr;
-        {
-            std::lock_guard<SlimMutex> l(m_subsLock);
-            CadroDataItem *&slot = m_subs[id];
-            previous = slot; // an id used twice: the later subscription wins
-            slot = item;
+    Unsubscribe(id); // an id used twice: the later subscription wins
+    HRESULT hr = S_OK;
+    uint32_t fresh = 0; // a new feed, to subscribe on the engine
+    {
+        std::lock_guard<SlimMutex> l(m_feedsLock);
+        auto it = m_feedOfUrl.find(url);
+        Feed *feed = it == m_feedOfUrl.end() ? nullptr : FeedOf(it->second);
+        if (!feed) {
+            feed = NewFeed(url);
+            fresh = feed ? feed->id : 0;
         }
-        if (previous)
-            previous->Release();
+        if (feed)
+            Join(*feed, id);
+        else
+            hr = E_OUTOFMEMORY;
+    }
+    if (fresh) {
+        // Outside the lock: the engine may answer at once, from this thread.
+        CadroDataItem *item = nullptr;
+        hr = m_engine.Subscribe(url.c_str(), CookieOf(fresh), this, &item, m_fromNode);
+        std::unique_lock<SlimMutex> l(m_feedsLock);
+        Feed *feed = FeedOf(fresh);
+        if (feed && SUCCEEDED(hr)) {
+            feed->item = item;
+            item = nullptr;
+        } else if (feed) {
+            DropFeed(*feed);
+        }
+        l.unlock();
+        if (item)
+            item->Release();
     }
     if (request)
         Reply([&](wire::Out &out) {
@@ -162,28 +209,121 @@ void NodeSession::Subscribe(wire::In &in)
         });
 }
 
+NodeSession::Feed *NodeSession::FeedOf(uint32_t feedId)
+{
+    uint32_t slot = (feedId & wire::kFeedSlotMask) - 1;
+    if (slot >= m_feeds.size() || !m_feeds[slot] || m_feeds[slot]->id != feedId)
+        return nullptr;
+    return m_feeds[slot].get();
+}
+
+NodeSession::Feed *NodeSession::NewFeed(const std::wstring &url)
+{
+    uint32_t slot;
+    if (!m_freeFeeds.empty()) {
+        slot = m_freeFeeds.back();
+        m_freeFeeds.pop_back();
+    } else {
+        if (m_feeds.size() >= wire::kFeedSlotMask)
+            return nullptr;
+        slot = static_cast<uint32_t>(m_feeds.size());
+        m_feeds.emplace_back();
+        m_feedGenerations.push_back(0);
+    }
+    auto feed = std::make_unique<Feed>();
+    // The generation tells the feed from an earlier one of the slot whose
+    // engine subscription may still be calling.
+    feed->id = (static_cast<uint32_t>(++m_feedGenerations[slot] & 0x7ff) << wire::kFeedSlotBits) | (slot + 1);
+    feed->url = url;
+    m_feedOfUrl[url] = feed->id;
+    m_feeds[slot] = std::move(feed);
+    return m_feeds[slot].get();
+}
+
+void NodeSession::Join(Feed &feed, uint32_t id)
+{
+    // A newcomer hears what a new subscription would: the statuses since
+    // "connecting", and once subscribed, the attributes and the value.
+    for (uint32_t status : feed.statuses)
+        m_queue.Push(wire::Kind::Status, [&](wire::Out &out) {
+            out.U32(id);
+            out.U32(status);
+        });
+    if (!feed.statuses.empty() && feed.statuses.back() == kCadroStatusSubscribed) {
+        if (feed.hasAttributes)
+            m_queue.Push(wire::Kind::Attributes, [&](wire::Out &out) {
+                out.U32(id);
+                out.U32(feed.attributes.mask);
+                out.U16(feed.attributes.dataType);
+                out.U32(feed.attributes.access);
+            });
+        if (!feed.data.empty())
+            m_queue.PushId(wire::Kind::Data, feed.data, id);
+    }
+    m_queue.Push(wire::Kind::Joined, [&](wire::Out &out) {
+        out.U32(id);
+        out.U32(feed.id);
+    });
+    m_memberships[id] = {feed.id, static_cast<uint32_t>(feed.members.size())};
+    feed.members.push_back(id);
+}
+
+CadroDataItem *NodeSession::Leave(uint32_t id)
+{
+    auto it = m_memberships.find(id);
+    if (it == m_memberships.end())
+        return nullptr;
+    Membership membership = it->second;
+    m_memberships.erase(it);
+    Feed *feed = FeedOf(membership.feed);
+    if (!feed)
+        return nullptr;
+    std::vector<uint32_t> &members = feed->members;
+    if (membership.index + 1 < members.size()) {
+        members[membership.index] = members.back();
+        m_memberships[members[membership.index]].index = membership.index;
+    }
+    members.pop_back();
+    if (!members.empty())
+        return nullptr;
+    CadroDataItem *item = feed->item;
+    feed->item = nullptr;
+    DropFeed(*feed);
+    return item;
+}
+
+void NodeSession::DropFeed(Feed &feed)
+{
+    for (uint32_t member : feed.members)
+        m_memberships.erase(member);
+    auto it = m_feedOfUrl.find(feed.url);
+    if (it != m_feedOfUrl.end() && it->second == feed.id)
+        m_feedOfUrl.erase(it);
+    uint32_t slot = (feed.id & wire::kFeedSlotMask) - 1;
+    m_feeds[slot].reset();
+    m_freeFeeds.push_back(slot);
+}
+
 void NodeSession::Unsubscribe(uint32_t id)
 {
-    CadroDataItem *item = nullptr;
+    CadroDataItem *item;
     {
-        std::lock_guard<SlimMutex> l(m_subsLock);
-        auto it = m_subs.find(id);
-        if (it == m_subs.end())
-            return;
-        item = it->second;
-        m_subs.erase(it);
+        std::lock_guard<SlimMutex> l(m_feedsLock);
+        item = Leave(id);
     }
-    item->Release();
+    if (item)
+        item->Release(); // waits for its callbacks, which take the lock
 }
 
 CadroDataItem *NodeSession::Find(uint32_t id)
 {
-    std::lock_guard<SlimMutex> l(m_subsLock);
-    auto it = m_subs.find(id);
-    if (it == m_subs.end())
+    std::lock_guard<SlimMutex> l(m_feedsLock);
+    auto it = m_memberships.find(id);
+    Feed *feed = it == m_memberships.end() ? nullptr : FeedOf(it->second.feed);
+    if (!feed || !feed->item)
         return nullptr;
-    it->second->AddRef();
-    return it->second;
+    feed->item->AddRef();
+    return feed->item;
 }
 
 void NodeSession::List(uint32_t request, const std::wstring &url)
@@ -216,33 +356,41 @@ void NodeSession::Finish()
 
 void NodeSession::TopologyChanged()
 {
+    {
+        // A running feed keeps the member it subscribed to (a network that
+        // was loaded since may have a new one under its URL): a newcomer
+        // subscribes anew, as a subscription of its own would.
+        std::lock_guard<SlimMutex> l(m_feedsLock);
+        m_feedOfUrl.clear();
+    }
     m_queue.Push(wire::Kind::Topology, [](wire::Out &) {});
 }
 
 HRESULT STDMETHODCALLTYPE NodeSession::OnData(void *cookie, uint32_t flags, const CadroValue *value, int32_t errorFlag,
                                               uint32_t timeLow, uint32_t timeHigh)
 {
-    // A member's new value goes to its subscriptions one after the other:
-    // they share one frame, which carries the value once.
-    wire::PackedFields packed;
-    if (packed.Pack(flags, *value, errorFlag, timeLow, timeHigh)) {
-        m_queue.PushId(wire::Kind::Data, packed.View(), IdOf(cookie));
-    } else {
-        wire::Out fields;
-        fields.U32(flags);
-        fields.Value(*value);
-        fields.U32(static_cast<uint32_t>(errorFlag));
-        fields.U32(timeLow);
-        fields.U32(timeHigh);
-        m_queue.PushId(wire::Kind::Data, fields.View(), IdOf(cookie));
-    }
+    WithFields(flags, *value, errorFlag, timeLow, timeHigh, [&](std::string_view fields) {
+        std::lock_guard<SlimMutex> l(m_feedsLock);
+        Feed *feed = FeedOf(IdOf(cookie));
+        if (!feed)
+            return;
+        feed->data.assign(fields.data(), fields.size());
+        // Feeds that get one value one after the other share one frame.
+        m_queue.PushId(wire::Kind::FeedData, fields, feed->id);
+    });
     return S_OK;
 }
 
 HRESULT STDMETHODCALLTYPE NodeSession::OnAttributes(void *cookie, const CadroAttributes *attributes)
 {
-    m_queue.Push(wire::Kind::Attributes, [&](wire::Out &out) {
-        out.U32(IdOf(cookie));
+    std::lock_guard<SlimMutex> l(m_feedsLock);
+    Feed *feed = FeedOf(IdOf(cookie));
+    if (!feed)
+        return S_OK;
+    feed->hasAttributes = true;
+    feed->attributes = *attributes;
+    m_queue.Push(wire::Kind::FeedAttributes, [&](wire::Out &out) {
+        out.U32(feed->id);
         out.U32(attributes->mask);
         out.U16(attributes->dataType);
         out.U32(attributes->access);
@@ -252,8 +400,28 @@ HRESULT STDMETHODCALLTYPE NodeSession::OnAttributes(void *cookie, const CadroAtt
 
 HRESULT STDMETHODCALLTYPE NodeSession::StatusChange(void *cookie, uint32_t status, uint32_t, uint32_t)
 {
-    m_queue.Push(wire::Kind::Status, [&](wire::Out &out) {
-        out.U32(IdOf(cookie));
+    std::lock_guard<SlimMutex> l(m_feedsLock);
+    Feed *feed = FeedOf(IdOf(cookie));
+    if (!feed)
+        return S_OK;
+    if (status == kCadroStatusConnecting || status == kCadroStatusDisconnected) {
+        // A newcomer to a machine that is away is told only that it is
+        // being connected to, and is given no value until it is back.
+        feed->statuses.assign(1, kCadroStatusConnecting);
+        feed->data.clear();
+    }
+    if (status != kCadroStatusConnecting)
+        feed->statuses.push_back(status);
+    if (status == kCadroStatusDisconnected)
+        feed->statuses.pop_back();
+    if (status == kCadroStatusSubscribeFailed && !feed->dead) {
+        feed->dead = true; // the member has gone: a newcomer asks the engine again
+        auto it = m_feedOfUrl.find(feed->url);
+        if (it != m_feedOfUrl.end() && it->second == feed->id)
+            m_feedOfUrl.erase(it);
+    }
+    m_queue.Push(wire::Kind::FeedStatus, [&](wire::Out &out) {
+        out.U32(feed->id);
         out.U32(status);
     });
     return S_OK;

@@ -3,11 +3,19 @@
 // the node's engine, the requests it sends and the callbacks it is sent,
 // gathered into batches (whatever came while the last batch was written goes
 // out in one write).
+//
+// The library's subscriptions to one URL share one subscription on the
+// engine, a feed: a value goes to the library once, whatever the number of
+// its items on that URL. A subscription that joins a running feed is first
+// told what a new subscription would be (statuses since "connecting", the
+// attributes, the value), in order with the feed's own frames.
 #include "Engine.h"
 #include "FrameQueue.h"
 
+#include <memory>
 #include <thread>
 #include <unordered_map>
+#include <vector>
 
 namespace cadrosim {
 
@@ -37,10 +45,35 @@ private:
     NodeSession(Engine &engine, std::shared_ptr<Channel> channel, bool fromNode, HANDLE ended);
     void ReadLoop();
     bool Handle(wire::Kind kind, wire::In &in);
+    struct Feed {
+        uint32_t id = 0; // with its slot's generation: the engine's cookie
+        std::wstring url;
+        CadroDataItem *item = nullptr;
+        std::vector<uint32_t> members;  // the library's ids
+        std::vector<uint32_t> statuses; // since the last "connecting"
+        bool hasAttributes = false;
+        CadroAttributes attributes = {};
+        std::string data;  // the last Data fields
+        bool dead = false; // its member has gone: a newcomer makes a new feed
+    };
+    struct Membership {
+        uint32_t feed;
+        uint32_t index; // in the feed's members
+    };
+
     void Subscribe(wire::In &in);
     void Unsubscribe(uint32_t id);
     void List(uint32_t request, const std::wstring &url);
     CadroDataItem *Find(uint32_t id);
+    // Under m_feedsLock.
+    Feed *FeedOf(uint32_t feedId);
+    Feed *NewFeed(const std::wstring &url);
+    void Join(Feed &feed, uint32_t id);
+    // Takes id out of its feed; the feed's engine subscription, for the
+    // caller to release without the lock, when it was the last member.
+    CadroDataItem *Leave(uint32_t id);
+    // Forgets the feed and its members (its engine subscription is gone).
+    void DropFeed(Feed &feed);
     // A reply: written by the reading thread itself, at once.
     template <class Fill> void Reply(Fill fill);
     void ReleaseAll();
@@ -50,8 +83,12 @@ private:
     bool m_fromNode;
     HANDLE m_endedEvent;
     std::atomic<bool> m_ended{false};
-    SlimMutex m_subsLock;
-    std::unordered_map<uint32_t, CadroDataItem *> m_subs;
+    SlimMutex m_feedsLock;
+    std::vector<std::unique_ptr<Feed>> m_feeds; // by slot
+    std::vector<uint16_t> m_feedGenerations;
+    std::vector<uint32_t> m_freeFeeds;
+    std::unordered_map<std::wstring, uint32_t> m_feedOfUrl;
+    std::unordered_map<uint32_t, Membership> m_memberships; // by the library's id
     FrameQueue m_queue;
     std::thread m_reader;
 };

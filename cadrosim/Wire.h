@@ -27,7 +27,20 @@ enum class Kind : uint8_t {
     Status,     // id, status
     Topology,   // the network's topology changed
     Closing,    // the node is shutting down on request: not to be restarted
+    // A library's subscriptions to one URL share one subscription on the
+    // node, a feed: a subscription joins its feed once it has been told
+    // what a new one is told first (its own frames above), and from then
+    // on takes the feed's frames.
+    Joined,         // id, feed
+    FeedData,       // as Data, with feeds for ids
+    FeedAttributes, // feed, data type, access
+    FeedStatus,     // feed, status
 };
+
+// A feed's id: its slot on the node plus one, in the low bits, under a
+// generation that tells it from an earlier feed of the slot.
+constexpr uint32_t kFeedSlotBits = 20;
+constexpr uint32_t kFeedSlotMask = (1u << kFeedSlotBits) - 1;
 
 // The machine's node: its pipe, which every server's libraries reach.
 constexpr const wchar_t *kNodeName = L"CadroNode";

@@ -32,6 +32,16 @@ bool HasDataChange(const std::vector<Callback> &calls, double value)
     return false;
 }
 
+bool HasValueFor(const std::vector<Callback> &calls, OPCHANDLE client, double value)
+{
+    for (const auto &c : calls)
+        if (c.kind == Callback::DataChange)
+            for (size_t i = 0; i < c.values.size() && i < c.clients.size(); ++i)
+                if (c.clients[i] == client && c.values[i] == value)
+                    return true;
+    return false;
+}
+
 // Waits for a node other than previous to answer cadroctl.
 bool WaitForNewNode(DWORD previous, DWORD timeoutMs)
 {
@@ -87,6 +97,22 @@ struct Subscribed {
         CoTaskMemFree(results);
         CoTaskMemFree(errors);
         ASSERT_TRUE(sink.WaitFor([first](auto &calls) { return HasDataChange(calls, first); }));
+    }
+    // Another item of the group, active; its server handle (0 on failure).
+    OPCHANDLE More(const wchar_t *id, OPCHANDLE client)
+    {
+        OPCITEMDEF def = {};
+        def.szItemID = const_cast<wchar_t *>(id);
+        def.bActive = TRUE;
+        def.hClient = client;
+        OPCITEMRESULT *results = nullptr;
+        HRESULT *errors = nullptr;
+        OPCHANDLE handle = 0;
+        if (items->AddItems(1, &def, &results, &errors) == S_OK)
+            handle = results[0].hServer;
+        CoTaskMemFree(results);
+        CoTaskMemFree(errors);
+        return handle;
     }
     // Lets go of the server (its process then exits).
     void Stop()
@@ -330,6 +356,53 @@ TEST(NodeE2E, AMachineServedByAnotherNodeIsReachedOverTcp)
     std::string afterKill = From(printed, "status 15");
     EXPECT_FALSE(afterKill.empty()) << "the disconnection was not reported:\n" << printed;
     EXPECT_TRUE(Has(From(afterKill, "status 17"), "value 77")) << printed;
+
+    first.Stop();
+    EXPECT_TRUE(WaitForNoServerProcess(20000));
+}
+
+TEST(NodeE2E, ItemsOfOneUrlInOneServerShareOneSubscriptionOnTheNode)
+{
+    Subscribed first;
+    ASSERT_NO_FATAL_FAILURE(first.Start());
+    TestSink &sink = first.sink;
+    // A second item of the URL joins the running subscription: it is told
+    // the value at once, as a subscription of its own would be.
+    OPCHANDLE second = first.More(kTemperature, 2);
+    ASSERT_NE(second, 0u);
+    EXPECT_TRUE(sink.WaitFor([](auto &calls) { return HasValueFor(calls, 2, 21.5); }));
+    std::string out;
+    EXPECT_EQ(RunCadroctl(L"show \\\\.\\proc1\\Setpoints.temperature", out), 0) << out;
+    EXPECT_TRUE(Has(out, "subscriptions 1")) << out;
+
+    // A publish reaches both; with the first item gone, the second still.
+    EXPECT_EQ(RunCadroctl(L"publish \\\\.\\proc1\\Setpoints.temperature 33", out), 0) << out;
+    EXPECT_TRUE(sink.WaitFor([](auto &calls) { return HasValueFor(calls, 0, 33) && HasValueFor(calls, 2, 33); }));
+    HRESULT *errors = nullptr;
+    EXPECT_EQ(first.items->RemoveItems(1, &first.item, &errors), S_OK);
+    CoTaskMemFree(errors);
+    EXPECT_EQ(RunCadroctl(L"publish \\\\.\\proc1\\Setpoints.temperature 34", out), 0) << out;
+    EXPECT_TRUE(sink.WaitFor([](auto &calls) { return HasValueFor(calls, 2, 34); }));
+
+    // A machine that goes away and comes back: the shared subscription's
+    // items get the value again; a newcomer while it is away gets none
+    // until it is back.
+    EXPECT_EQ(RunCadroctl(L"disconnect .", out), 0) << out;
+    OPCHANDLE third = first.More(kTemperature, 3);
+    ASSERT_NE(third, 0u);
+    Sleep(300);
+    EXPECT_FALSE(HasValueFor(sink.Snapshot(), 3, 34));
+    EXPECT_EQ(RunCadroctl(L"reconnect .", out), 0) << out;
+    EXPECT_TRUE(sink.WaitFor([](auto &calls) { return HasValueFor(calls, 3, 34); }));
+
+    // A network loaded since: a new item subscribes to its member, not to
+    // the one the running subscription holds.
+    EXPECT_EQ(RunCadroctl(L"reset", out), 0) << out;
+    OPCHANDLE fourth = first.More(kTemperature, 4);
+    ASSERT_NE(fourth, 0u);
+    EXPECT_TRUE(sink.WaitFor([](auto &calls) { return HasValueFor(calls, 4, 21.5); }));
+    EXPECT_EQ(RunCadroctl(L"publish \\\\.\\proc1\\Setpoints.temperature 35", out), 0) << out;
+    EXPECT_TRUE(sink.WaitFor([](auto &calls) { return HasValueFor(calls, 4, 35); }));
 
     first.Stop();
     EXPECT_TRUE(WaitForNoServerProcess(20000));
