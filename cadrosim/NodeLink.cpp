@@ -548,6 +548,7 @@ void NodeLink::DeliverData()
         return;
     {
         std::lock_guard<SlimMutex> l(m_lock);
+        m_delivering = true;
         for (auto [id, tagged] : m_batchIds) {
             uint32_t index = tagged & ~kFeedBit;
             const DataFields &f = m_batchFields[index];
@@ -555,30 +556,53 @@ void NodeLink::DeliverData()
                 // A feed's value: remembered once, for all its members.
                 if (LinkFeed *feed = FeedOf(id)) {
                     feed->mirror.Remember(f.flags, f.value, f.error, f.low, f.high);
-                    for (RemoteSubscription *sub : feed->members) {
-                        sub->Pin();
+                    for (RemoteSubscription *sub : feed->members)
                         m_batchSubs.emplace_back(sub, index);
-                    }
                 }
             } else if (RemoteSubscription *sub = Lookup(id)) {
                 sub->mirror.Remember(f.flags, f.value, f.error, f.low, f.high);
-                sub->Pin();
                 m_batchSubs.emplace_back(sub, index);
             }
         }
     }
+    // No pins: a subscription let go during the batch is deleted after it
+    // (Forget), and the one being called is published first, so that its
+    // holder either is seen here or sees the call and waits for it.
     for (auto [sub, index] : m_batchSubs) {
-        const DataFields &f = m_batchFields[index];
-        sub->Deliver(
-            [&](RemoteSubscription &s) { s.receiver->OnData(s.cookie, f.flags, &f.value, f.error, f.low, f.high); },
-            m_callWaiters, m_lock, m_callReturned);
-        sub->Unpin();
+        m_callingSub.store(sub);
+        if (!sub->IsForgotten()) {
+            const DataFields &f = m_batchFields[index];
+            sub->receiver->OnData(sub->cookie, f.flags, &f.value, f.error, f.low, f.high);
+        }
+        if (m_callWaiters.load() != 0)
+            WakeWaiters(nullptr);
     }
+    WakeWaiters(nullptr);
+    std::vector<RemoteSubscription *> graveyard;
+    {
+        std::lock_guard<SlimMutex> l(m_lock);
+        m_delivering = false;
+        graveyard.swap(m_graveyard);
+    }
+    for (RemoteSubscription *sub : graveyard)
+        sub->Unpin();
     for (DataFields &f : m_batchFields)
         ClearCadroValue(f.value);
     m_batchFields.clear();
     m_batchIds.clear();
     m_batchSubs.clear();
+}
+
+void NodeLink::WakeWaiters(RemoteSubscription *calling)
+{
+    m_callingSub.store(calling);
+    if (m_callWaiters.load() == 0)
+        return;
+    // Under the lock, so that a holder between its check and its sleep
+    // cannot miss the wake.
+    m_lock.lock();
+    m_lock.unlock();
+    m_callReturned.notify_all();
 }
 
 void NodeLink::Dispatch(wire::Kind kind, wire::In &in)
@@ -815,12 +839,17 @@ void NodeLink::Forget(RemoteSubscription *sub, std::unique_lock<SlimMutex> &l)
     LeaveFeed(sub);
     Unregister(sub);
     sub->Forgotten();
+    if (m_delivering) {
+        // The batch of values under way may still look at it.
+        sub->Pin();
+        m_graveyard.push_back(sub);
+    }
     // The link's thread never waits: the call under way elsewhere keeps the
     // object pinned, and a call of its own is further up its stack.
     if (OnLinkThread())
         return;
     ++m_callWaiters;
-    m_callReturned.wait(l, [&] { return sub->Returned(); });
+    m_callReturned.wait(l, [&] { return sub->Returned() && m_callingSub.load() != sub; });
     --m_callWaiters;
 }
 

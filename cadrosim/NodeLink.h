@@ -90,6 +90,7 @@ public:
     // already under way is over (one of this thread's own, further up its
     // stack, does not count).
     void Forgotten() { m_forgotten.store(true); }
+    bool IsForgotten() const { return m_forgotten.load(); }
     bool Returned() const
     {
         return m_calling.load() == 0 || m_callingThread.load(std::memory_order_relaxed) == GetCurrentThreadId();
@@ -161,6 +162,9 @@ private:
     // receivers are called without it.
     void TakeData(wire::In &in, bool feeds);
     void DeliverData();
+    // The link's thread publishes the subscription it calls now (null when
+    // none) and wakes holders waiting for a call to end.
+    void WakeWaiters(RemoteSubscription *calling);
     // Under m_lock: a subscription joins its feed, or leaves it.
     void Join(uint32_t id, uint32_t feedId);
     void LeaveFeed(RemoteSubscription *sub);
@@ -201,6 +205,9 @@ private:
     SlimCondition m_changed;      // the state, and replies
     SlimCondition m_callReturned; // a call to a forgotten subscription returned
     std::atomic<int> m_callWaiters{0};
+    std::atomic<RemoteSubscription *> m_callingSub{nullptr}; // by DeliverData
+    bool m_delivering = false;                               // a batch of values is being delivered
+    std::vector<RemoteSubscription *> m_graveyard;           // let go during it
     State m_state = State::Stopped;
     long m_uses = 0;
     unsigned m_generation = 0; // of the threads that should run; Stop() moves it on
