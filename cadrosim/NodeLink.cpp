@@ -26,21 +26,11 @@ constexpr DWORD kTcpConnectMs = 3000;
 constexpr size_t kMostKnownUrls = 4u << 20;
 constexpr uint32_t kFeedBit = 1u << 31; // on a batch entry's index: a feed's
 
-uint64_t UrlHash(std::wstring_view url)
-{
-    uint64_t h = 1469598103934665603ull;
-    for (wchar_t c : url) {
-        h ^= static_cast<uint16_t>(c);
-        h *= 1099511628211ull;
-    }
-    return h;
-}
-
 std::wstring NodeProgramPath()
 {
     HMODULE self = nullptr;
     GetModuleHandleExW(GET_MODULE_HANDLE_EX_FLAG_FROM_ADDRESS | GET_MODULE_HANDLE_EX_FLAG_UNCHANGED_REFCOUNT,
-                       reinterpret_cast<LPCWSTR>(&UrlHash), &self);
+                       reinterpret_cast<LPCWSTR>(&NodeProgramPath), &self);
     wchar_t path[MAX_PATH * 2];
     DWORD n = GetModuleFileNameW(self, path, MAX_PATH * 2);
     std::wstring text(path, n < MAX_PATH * 2 ? n : 0);
@@ -440,9 +430,10 @@ template <class Call, class Note> void NodeLink::CallFeed(uint32_t feedId, Call 
         if (!feed)
             return;
         note(*feed);
-        members = feed->members;
-        for (RemoteSubscription *sub : members)
+        feed->ForEachMember([&](RemoteSubscription *sub) {
             sub->Pin();
+            members.push_back(sub);
+        });
     }
     for (RemoteSubscription *sub : members) {
         sub->Deliver(call, m_callWaiters, m_lock, m_callReturned);
@@ -470,10 +461,7 @@ void NodeLink::Join(uint32_t id, uint32_t feedId)
     LinkFeed *&feed = m_feeds[slot];
     if (feed && feed->id != feedId) {
         // An earlier feed of the slot that the node has dropped.
-        for (RemoteSubscription *member : feed->members) {
-            member->mirror.CopyFrom(feed->mirror);
-            member->feed = nullptr;
-        }
+        DetachMembers(*feed);
         delete feed;
         feed = nullptr;
     }
@@ -486,8 +474,22 @@ void NodeLink::Join(uint32_t id, uint32_t feedId)
         feed->mirror.CopyFrom(sub->mirror);
     }
     sub->feed = feed;
-    sub->feedIndex = static_cast<uint32_t>(feed->members.size());
-    feed->members.push_back(sub);
+    sub->previousMember = nullptr;
+    sub->nextMember = feed->first;
+    if (feed->first)
+        feed->first->previousMember = sub;
+    feed->first = sub;
+}
+
+void NodeLink::DetachMembers(LinkFeed &feed)
+{
+    for (RemoteSubscription *member = feed.first, *next; member; member = next) {
+        next = member->nextMember;
+        member->mirror.CopyFrom(feed.mirror);
+        member->feed = nullptr;
+        member->previousMember = member->nextMember = nullptr;
+    }
+    feed.first = nullptr;
 }
 
 void NodeLink::LeaveFeed(RemoteSubscription *sub)
@@ -496,14 +498,15 @@ void NodeLink::LeaveFeed(RemoteSubscription *sub)
     if (!feed)
         return;
     sub->mirror.CopyFrom(feed->mirror);
-    std::vector<RemoteSubscription *> &members = feed->members;
-    if (sub->feedIndex + 1 < members.size()) {
-        members[sub->feedIndex] = members.back();
-        members[sub->feedIndex]->feedIndex = sub->feedIndex;
-    }
-    members.pop_back();
+    if (sub->previousMember)
+        sub->previousMember->nextMember = sub->nextMember;
+    else
+        feed->first = sub->nextMember;
+    if (sub->nextMember)
+        sub->nextMember->previousMember = sub->previousMember;
+    sub->previousMember = sub->nextMember = nullptr;
     sub->feed = nullptr;
-    if (members.empty()) {
+    if (!feed->first) {
         m_feeds[(feed->id & wire::kFeedSlotMask) - 1] = nullptr;
         delete feed;
     }
@@ -514,10 +517,7 @@ void NodeLink::DropFeeds()
     for (LinkFeed *&feed : m_feeds) {
         if (!feed)
             continue;
-        for (RemoteSubscription *member : feed->members) {
-            member->mirror.CopyFrom(feed->mirror);
-            member->feed = nullptr;
-        }
+        DetachMembers(*feed);
         delete feed;
         feed = nullptr;
     }
@@ -556,8 +556,7 @@ void NodeLink::DeliverData()
                 // A feed's value: remembered once, for all its members.
                 if (LinkFeed *feed = FeedOf(id)) {
                     feed->mirror.Remember(f.flags, f.value, f.error, f.low, f.high);
-                    for (RemoteSubscription *sub : feed->members)
-                        m_batchSubs.emplace_back(sub, index);
+                    feed->ForEachMember([&](RemoteSubscription *sub) { m_batchSubs.emplace_back(sub, index); });
                 }
             } else if (RemoteSubscription *sub = Lookup(id)) {
                 sub->mirror.Remember(f.flags, f.value, f.error, f.low, f.high);
@@ -801,7 +800,7 @@ HRESULT NodeLink::Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeRece
             id, [](RemoteSubscription &s) { s.receiver->StatusChange(s.cookie, kCadroStatusConnecting, 0, 0); });
         return S_OK;
     }
-    bool known = m_knownUrls.Contains(UrlHash(url));
+    bool known = m_knownUrls.Contains(wire::UrlHash(url));
     if (known || OnLinkThread()) {
         Send(wire::Kind::Subscribe, [&](wire::Out &o) {
             o.U32(0);
@@ -910,7 +909,7 @@ bool NodeLink::Browse(const std::wstring &url, std::vector<BrowseEntry> &out)
         e.dataType = in.U16();
         e.access = in.U16();
         if (in.U8())
-            known.push_back(UrlHash(wire::MemberUrl(url, e.name)));
+            known.push_back(wire::UrlHash(wire::MemberUrl(url, e.name)));
         out.push_back(std::move(e));
     }
     if (!in.Ok()) {
@@ -953,7 +952,7 @@ bool NodeLink::Load(const std::wstring &description, std::wstring &error)
 bool NodeLink::Knows(const std::wstring &url)
 {
     std::lock_guard<SlimMutex> l(m_lock);
-    return m_knownUrls.Contains(UrlHash(url));
+    return m_knownUrls.Contains(wire::UrlHash(url));
 }
 
 void NodeLink::AddBrowserReceiver(ICadroBrowserReceiver *receiver)

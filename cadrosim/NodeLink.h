@@ -30,7 +30,10 @@ class RemoteSubscription;
 struct LinkFeed {
     uint32_t id = 0;
     MemberMirror mirror;
-    std::vector<RemoteSubscription *> members;
+    // The members, linked through themselves: no allocation per feed but
+    // the feed's own (nearly every URL has one subscription).
+    RemoteSubscription *first = nullptr;
+    template <class F> void ForEachMember(F f) const;
 };
 
 // A subscription through the node; the CadroDataItem its holder keeps.
@@ -58,7 +61,7 @@ public:
     // joined its feed (what a new subscription is told first).
     MemberMirror mirror;
     LinkFeed *feed = nullptr;
-    uint32_t feedIndex = 0; // in the feed's members
+    RemoteSubscription *previousMember = nullptr, *nextMember = nullptr;
 
     // The link's handles on the object: one for its place in the table
     // (until its holder lets go) and one for each delivery that will call
@@ -113,6 +116,12 @@ private:
     std::atomic<DWORD> m_callingThread{0};
     std::atomic<uint32_t> m_pins{1};
 };
+
+template <class F> void LinkFeed::ForEachMember(F f) const
+{
+    for (RemoteSubscription *sub = first; sub; sub = sub->nextMember)
+        f(sub);
+}
 
 class NodeLink {
 public:
@@ -169,6 +178,8 @@ private:
     void Join(uint32_t id, uint32_t feedId);
     void LeaveFeed(RemoteSubscription *sub);
     LinkFeed *FeedOf(uint32_t feedId) const;
+    // Its members go on with what the feed last had, on their own.
+    void DetachMembers(LinkFeed &feed);
     void DropFeeds();
     void Disconnected();
     // Out of the table, then waits for a call to it under way on another

@@ -73,17 +73,27 @@ int NodeServer::Run()
     bool connectedBefore = false; // the library came before the wait for it
     OVERLAPPED ov = {};
     for (;;) {
+        if (pipe == INVALID_HANDLE_VALUE)
+            pipe = NewInstance(false); // the last attempt failed: again
         if (!listening && pipe != INVALID_HANDLE_VALUE) {
             ov = {};
             ov.hEvent = connected;
             ResetEvent(connected);
             listening = !ConnectNamedPipe(pipe, &ov) && GetLastError() == ERROR_IO_PENDING;
-            if (!listening && GetLastError() == ERROR_PIPE_CONNECTED) {
+            DWORD error = GetLastError();
+            if (!listening && error == ERROR_PIPE_CONNECTED) {
                 // Nothing is pending on ov then: its result would be this
                 // "error", and the library would lose its connection.
                 listening = true;
                 connectedBefore = true;
                 SetEvent(connected);
+            } else if (!listening) {
+                // A client that came and went before the wait (no data), or
+                // a broken instance: it would refuse every later client too.
+                DisconnectNamedPipe(pipe);
+                CloseHandle(pipe);
+                pipe = NewInstance(false);
+                continue;
             }
         }
         HANDLE events[] = {m_stop, connected, m_sessionEnded, m_listener.Event()};

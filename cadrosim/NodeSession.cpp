@@ -2,6 +2,7 @@
 
 #include "SimValue.h"
 
+#include <cstring>
 #include <new>
 #include <vector>
 
@@ -175,10 +176,10 @@ void NodeSession::Subscribe(wire::In &in)
     uint32_t fresh = 0; // a new feed, to subscribe on the engine
     {
         std::lock_guard<SlimMutex> l(m_feedsLock);
-        auto it = m_feedOfUrl.find(url);
-        Feed *feed = it == m_feedOfUrl.end() ? nullptr : FeedOf(it->second);
+        uint64_t hash = wire::UrlHash(url);
+        Feed *feed = SharedFeed(url, hash);
         if (!feed) {
-            feed = NewFeed(url);
+            feed = NewFeed(url, hash);
             fresh = feed ? feed->id : 0;
         }
         if (feed)
@@ -217,7 +218,33 @@ NodeSession::Feed *NodeSession::FeedOf(uint32_t feedId)
     return m_feeds[slot].get();
 }
 
-NodeSession::Feed *NodeSession::NewFeed(const std::wstring &url)
+NodeSession::Feed *NodeSession::SharedFeed(const std::wstring &url, uint64_t hash)
+{
+    auto it = m_feedOfUrl.find(hash);
+    Feed *feed = it == m_feedOfUrl.end() ? nullptr : FeedOf(it->second);
+    return feed && feed->url == url ? feed : nullptr;
+}
+
+void NodeSession::Unshare(Feed &feed)
+{
+    auto it = m_feedOfUrl.find(feed.hash);
+    if (it != m_feedOfUrl.end() && it->second == feed.id)
+        m_feedOfUrl.erase(it);
+}
+
+void NodeSession::LastData::Assign(std::string_view fields)
+{
+    if (fields.size() <= sizeof m_short) {
+        memcpy(m_short, fields.data(), fields.size());
+        m_size = static_cast<uint8_t>(fields.size());
+        m_long.clear();
+    } else {
+        m_size = 0;
+        m_long.assign(fields);
+    }
+}
+
+NodeSession::Feed *NodeSession::NewFeed(const std::wstring &url, uint64_t hash)
 {
     uint32_t slot;
     if (!m_freeFeeds.empty()) {
@@ -235,7 +262,12 @@ NodeSession::Feed *NodeSession::NewFeed(const std::wstring &url)
     // engine subscription may still be calling.
     feed->id = (static_cast<uint32_t>(++m_feedGenerations[slot] & 0x7ff) << wire::kFeedSlotBits) | (slot + 1);
     feed->url = url;
-    m_feedOfUrl[url] = feed->id;
+    feed->hash = hash;
+    // A stale entry (its feed gone) is replaced; a live one of another URL
+    // with the same hash is kept.
+    uint32_t &indexed = m_feedOfUrl[hash];
+    if (!FeedOf(indexed))
+        indexed = feed->id;
     m_feeds[slot] = std::move(feed);
     return m_feeds[slot].get();
 }
@@ -244,12 +276,12 @@ void NodeSession::Join(Feed &feed, uint32_t id)
 {
     // A newcomer hears what a new subscription would: the statuses since
     // "connecting", and once subscribed, the attributes and the value.
-    for (uint32_t status : feed.statuses)
+    for (uint8_t i = 0; i < feed.statusCount; ++i)
         m_queue.Push(wire::Kind::Status, [&](wire::Out &out) {
             out.U32(id);
-            out.U32(status);
+            out.U32(feed.statuses[i]);
         });
-    if (!feed.statuses.empty() && feed.statuses.back() == kCadroStatusSubscribed) {
+    if (feed.statusCount && feed.statuses[feed.statusCount - 1] == kCadroStatusSubscribed) {
         if (feed.hasAttributes)
             m_queue.Push(wire::Kind::Attributes, [&](wire::Out &out) {
                 out.U32(id);
@@ -257,8 +289,8 @@ void NodeSession::Join(Feed &feed, uint32_t id)
                 out.U16(feed.attributes.dataType);
                 out.U32(feed.attributes.access);
             });
-        if (!feed.data.empty())
-            m_queue.PushId(wire::Kind::Data, feed.data, id);
+        if (!feed.data.Empty())
+            m_queue.PushId(wire::Kind::Data, feed.data.View(), id);
     }
     m_queue.Push(wire::Kind::Joined, [&](wire::Out &out) {
         out.U32(id);
@@ -296,9 +328,7 @@ void NodeSession::DropFeed(Feed &feed)
 {
     for (uint32_t member : feed.members)
         m_memberships.erase(member);
-    auto it = m_feedOfUrl.find(feed.url);
-    if (it != m_feedOfUrl.end() && it->second == feed.id)
-        m_feedOfUrl.erase(it);
+    Unshare(feed);
     uint32_t slot = (feed.id & wire::kFeedSlotMask) - 1;
     m_feeds[slot].reset();
     m_freeFeeds.push_back(slot);
@@ -374,7 +404,7 @@ HRESULT STDMETHODCALLTYPE NodeSession::OnData(void *cookie, uint32_t flags, cons
         Feed *feed = FeedOf(IdOf(cookie));
         if (!feed)
             return;
-        feed->data.assign(fields.data(), fields.size());
+        feed->data.Assign(fields);
         // Feeds that get one value one after the other share one frame.
         m_queue.PushId(wire::Kind::FeedData, fields, feed->id);
     });
@@ -407,18 +437,15 @@ HRESULT STDMETHODCALLTYPE NodeSession::StatusChange(void *cookie, uint32_t statu
     if (status == kCadroStatusConnecting || status == kCadroStatusDisconnected) {
         // A newcomer to a machine that is away is told only that it is
         // being connected to, and is given no value until it is back.
-        feed->statuses.assign(1, kCadroStatusConnecting);
-        feed->data.clear();
+        feed->statuses[0] = kCadroStatusConnecting;
+        feed->statusCount = 1;
+        feed->data.Clear();
+    } else if (feed->statusCount < sizeof feed->statuses) {
+        feed->statuses[feed->statusCount++] = static_cast<uint8_t>(status);
     }
-    if (status != kCadroStatusConnecting)
-        feed->statuses.push_back(status);
-    if (status == kCadroStatusDisconnected)
-        feed->statuses.pop_back();
     if (status == kCadroStatusSubscribeFailed && !feed->dead) {
         feed->dead = true; // the member has gone: a newcomer asks the engine again
-        auto it = m_feedOfUrl.find(feed->url);
-        if (it != m_feedOfUrl.end() && it->second == feed->id)
-            m_feedOfUrl.erase(it);
+        Unshare(*feed);
     }
     m_queue.Push(wire::Kind::FeedStatus, [&](wire::Out &out) {
         out.U32(feed->id);

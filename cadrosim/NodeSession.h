@@ -45,16 +45,31 @@ private:
     NodeSession(Engine &engine, std::shared_ptr<Channel> channel, bool fromNode, HANDLE ended);
     void ReadLoop();
     bool Handle(wire::Kind kind, wire::In &in);
+    // The last Data fields: inline unless a text makes them long.
+    class LastData {
+    public:
+        void Assign(std::string_view fields);
+        void Clear() { m_size = 0, m_long.clear(); }
+        std::string_view View() const { return m_size ? std::string_view(m_short, m_size) : m_long; }
+        bool Empty() const { return m_size == 0 && m_long.empty(); }
+
+    private:
+        char m_short[32];
+        uint8_t m_size = 0;
+        std::string m_long;
+    };
     struct Feed {
-        uint32_t id = 0; // with its slot's generation: the engine's cookie
+        uint32_t id = 0;   // with its slot's generation: the engine's cookie
+        uint64_t hash = 0; // of the URL
         std::wstring url;
         CadroDataItem *item = nullptr;
-        std::vector<uint32_t> members;  // the library's ids
-        std::vector<uint32_t> statuses; // since the last "connecting"
+        std::vector<uint32_t> members; // the library's ids
+        uint8_t statuses[6];           // since the last "connecting"
+        uint8_t statusCount = 0;
         bool hasAttributes = false;
-        CadroAttributes attributes = {};
-        std::string data;  // the last Data fields
         bool dead = false; // its member has gone: a newcomer makes a new feed
+        CadroAttributes attributes = {};
+        LastData data;
     };
     struct Membership {
         uint32_t feed;
@@ -67,7 +82,10 @@ private:
     CadroDataItem *Find(uint32_t id);
     // Under m_feedsLock.
     Feed *FeedOf(uint32_t feedId);
-    Feed *NewFeed(const std::wstring &url);
+    Feed *NewFeed(const std::wstring &url, uint64_t hash);
+    // The running feed of url that a newcomer joins, if any.
+    Feed *SharedFeed(const std::wstring &url, uint64_t hash);
+    void Unshare(Feed &feed);
     void Join(Feed &feed, uint32_t id);
     // Takes id out of its feed; the feed's engine subscription, for the
     // caller to release without the lock, when it was the last member.
@@ -87,7 +105,9 @@ private:
     std::vector<std::unique_ptr<Feed>> m_feeds; // by slot
     std::vector<uint16_t> m_feedGenerations;
     std::vector<uint32_t> m_freeFeeds;
-    std::unordered_map<std::wstring, uint32_t> m_feedOfUrl;
+    // By the URL's hash; a URL whose hash another one has takes a feed
+    // that is not found here (it is not shared).
+    std::unordered_map<uint64_t, uint32_t> m_feedOfUrl;
     std::unordered_map<uint32_t, Membership> m_memberships; // by the library's id
     FrameQueue m_queue;
     std::thread m_reader;

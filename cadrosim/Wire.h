@@ -49,6 +49,17 @@ inline const wchar_t *NodePipeName()
     return L"\\\\.\\pipe\\CadroNode";
 }
 
+// A URL's hash (FNV-1a over its characters), for the tables of URLs.
+inline uint64_t UrlHash(std::wstring_view url)
+{
+    uint64_t h = 1469598103934665603ull;
+    for (wchar_t c : url) {
+        h ^= static_cast<uint16_t>(c);
+        h *= 1099511628211ull;
+    }
+    return h;
+}
+
 // The URL of a member listed under url: its part (the name up to the first
 // "-") after the member separator; "(implicit)" is named by url itself.
 inline std::wstring MemberUrl(const std::wstring &url, const std::wstring &name)
