@@ -4,6 +4,7 @@
 
 #include <cstring>
 #include <new>
+#include <shared_mutex>
 #include <vector>
 
 namespace cadrosim {
@@ -400,10 +401,14 @@ HRESULT STDMETHODCALLTYPE NodeSession::OnData(void *cookie, uint32_t flags, cons
                                               uint32_t timeLow, uint32_t timeHigh)
 {
     WithFields(flags, *value, errorFlag, timeLow, timeHigh, [&](std::string_view fields) {
-        std::lock_guard<SlimMutex> l(m_feedsLock);
+        // Values come from every shard at once: they share the table and
+        // take only their feed's own lock (a newcomer's replay holds the
+        // table alone).
+        std::shared_lock<SlimMutex> l(m_feedsLock);
         Feed *feed = FeedOf(IdOf(cookie));
         if (!feed)
             return;
+        std::lock_guard<SlimMutex> fl(feed->lock);
         feed->data.Assign(fields);
         // Feeds that get one value one after the other share one frame.
         m_queue.PushId(wire::Kind::FeedData, fields, feed->id);

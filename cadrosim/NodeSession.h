@@ -70,6 +70,7 @@ private:
         bool dead = false; // its member has gone: a newcomer makes a new feed
         CadroAttributes attributes = {};
         LastData data;
+        SlimMutex lock; // its values, under the table's shared lock
     };
     struct Membership {
         uint32_t feed;
@@ -80,7 +81,7 @@ private:
     void Unsubscribe(uint32_t id);
     void List(uint32_t request, const std::wstring &url);
     CadroDataItem *Find(uint32_t id);
-    // Under m_feedsLock.
+    // Under m_feedsLock (held alone, or shared by values).
     Feed *FeedOf(uint32_t feedId);
     Feed *NewFeed(const std::wstring &url, uint64_t hash);
     // The running feed of url that a newcomer joins, if any.

@@ -19,6 +19,9 @@ public:
     void lock() { AcquireSRWLockExclusive(&m_lock); }
     void unlock() { ReleaseSRWLockExclusive(&m_lock); }
     bool try_lock() { return TryAcquireSRWLockExclusive(&m_lock) != FALSE; }
+    // Shared holders (std::shared_lock) exclude exclusive ones only.
+    void lock_shared() { AcquireSRWLockShared(&m_lock); }
+    void unlock_shared() { ReleaseSRWLockShared(&m_lock); }
     SRWLOCK *native() { return &m_lock; }
 
 private:

@@ -186,6 +186,9 @@ TEST_F(AsyncTest, CancelDropsQueuedTransactionsWithoutCallbacks)
     // The worker spends about 3 s waiting for the member that never delivers.
     ASSERT_EQ(async->Read(1, &h[0], 50, &slowId, &errors), S_OK);
     CoTaskMemFree(errors);
+    // The worker must have taken the slow read before the next one comes
+    // (on a loaded machine it may wake late and take both at once).
+    Sleep(500);
     ASSERT_EQ(async->Read(1, &h[1], 51, &queuedId, &errors), S_OK);
     CoTaskMemFree(errors);
     EXPECT_EQ(async->Cancel2(queuedId), S_OK);
