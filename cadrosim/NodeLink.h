@@ -64,8 +64,9 @@ public:
     RemoteSubscription *previousMember = nullptr, *nextMember = nullptr;
 
     // The link's handles on the object: one for its place in the table
-    // (until its holder lets go) and one for each delivery that will call
-    // it. The last to go deletes it.
+    // (until its holder lets go), one for each status or attributes call
+    // on its way to it, and one while a batch of values that lists it is
+    // being delivered after its holder let go. The last to go deletes it.
     void Pin() { m_pins.fetch_add(1, std::memory_order_relaxed); }
     void Unpin()
     {
@@ -166,9 +167,9 @@ private:
     std::unique_ptr<Channel> Connect(bool mayStart, unsigned generation);
     void Serve(Channel &channel);
     void Dispatch(wire::Kind kind, wire::In &in);
-    // Values arrive in batches: each id's subscription is looked up and its
-    // value remembered under one hold of the lock per batch, then the
-    // receivers are called without it.
+    // Values arrive in batches: each id's subscription (or feed's members)
+    // is looked up and the value remembered under one hold of the lock per
+    // batch, then the receivers are called without it.
     void TakeData(wire::In &in, bool feeds);
     void DeliverData();
     // The link's thread publishes the subscription it calls now (null when
