@@ -614,10 +614,7 @@ void NodeLink::Dispatch(wire::Kind kind, wire::In &in)
     switch (kind) {
     case wire::Kind::Attributes: {
         uint32_t id = in.U32();
-        CadroAttributes a = {};
-        a.mask = in.U32();
-        a.dataType = in.U16();
-        a.access = in.U32();
+        CadroAttributes a = in.Attributes();
         if (in.Ok())
             CallSubscription(id, [&](RemoteSubscription &sub) { sub.receiver->OnAttributes(sub.cookie, &a); });
         return;
@@ -641,10 +638,7 @@ void NodeLink::Dispatch(wire::Kind kind, wire::In &in)
     }
     case wire::Kind::FeedAttributes: {
         uint32_t feedId = in.U32();
-        CadroAttributes a = {};
-        a.mask = in.U32();
-        a.dataType = in.U16();
-        a.access = in.U32();
+        CadroAttributes a = in.Attributes();
         if (in.Ok())
             CallFeed(
                 feedId, [&](RemoteSubscription &sub) { sub.receiver->OnAttributes(sub.cookie, &a); },

@@ -286,9 +286,7 @@ void NodeSession::Join(Feed &feed, uint32_t id)
         if (feed.hasAttributes)
             m_queue.Push(wire::Kind::Attributes, [&](wire::Out &out) {
                 out.U32(id);
-                out.U32(feed.attributes.mask);
-                out.U16(feed.attributes.dataType);
-                out.U32(feed.attributes.access);
+                out.Attributes(feed.attributes);
             });
         if (!feed.data.Empty())
             m_queue.PushId(wire::Kind::Data, feed.data.View(), id);
@@ -426,9 +424,7 @@ HRESULT STDMETHODCALLTYPE NodeSession::OnAttributes(void *cookie, const CadroAtt
     feed->attributes = *attributes;
     m_queue.Push(wire::Kind::FeedAttributes, [&](wire::Out &out) {
         out.U32(feed->id);
-        out.U32(attributes->mask);
-        out.U16(attributes->dataType);
-        out.U32(attributes->access);
+        out.Attributes(*attributes);
     });
     return S_OK;
 }

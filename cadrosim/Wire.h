@@ -80,6 +80,13 @@ public:
     void F64(double v) { Raw(&v, 8); }
     void Text(std::wstring_view text);
     void Value(const CadroValue &value);
+    // Mask, data type and access.
+    void Attributes(const CadroAttributes &a)
+    {
+        U32(a.mask);
+        U16(a.dataType);
+        U32(a.access);
+    }
     void Raw(const void *p, size_t n) { m_bytes.append(static_cast<const char *>(p), n); }
 
     // Adds id to the last frame when it is a frame of kind that starts with
@@ -141,6 +148,14 @@ public:
     std::wstring Text();
     // A text value gets a new text object, which the caller clears.
     void Value(CadroValue &value);
+    CadroAttributes Attributes()
+    {
+        CadroAttributes a = {};
+        a.mask = U32();
+        a.dataType = U16();
+        a.access = U32();
+        return a;
+    }
     bool Ok() const { return m_ok; }
     bool AtEnd() const { return m_p == m_end; }
     // What is left of the frame.
