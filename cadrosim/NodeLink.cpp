@@ -423,7 +423,11 @@ template <class Call, class Note> void NodeLink::CallSubscription(uint32_t id, C
 
 template <class Call, class Note> void NodeLink::CallFeed(uint32_t feedId, Call call, Note note)
 {
-    std::vector<RemoteSubscription *> members;
+    // The link thread's own list, kept between calls: a new subscription's
+    // feed brings five of them, and allocations from two threads meet in
+    // the process heap's lock.
+    std::vector<RemoteSubscription *> &members = m_feedCall;
+    members.clear();
     {
         std::lock_guard<SlimMutex> l(m_lock);
         LinkFeed *feed = FeedOf(feedId);

@@ -248,6 +248,7 @@ private:
     // id (or feed, with kFeedBit on the index), index of its fields
     std::vector<std::pair<uint32_t, uint32_t>> m_batchIds;
     std::vector<std::pair<RemoteSubscription *, uint32_t>> m_batchSubs;
+    std::vector<RemoteSubscription *> m_feedCall; // CallFeed's, the link thread's
     std::vector<ICadroBrowserReceiver *> m_browserReceivers;
     HANDLE m_wake = nullptr; // cuts the pause between reconnections short
     DWORD m_linkThreadId = 0;
