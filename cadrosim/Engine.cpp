@@ -155,7 +155,7 @@ bool Engine::Load(const std::wstring &description, std::wstring &error)
     std::vector<NodeLink *> remote;
     for (auto &machine : network->Machines())
         if (!machine->node.empty()) {
-            NodeLink *link = NodeLink::ForAddress(machine->node);
+            NodeLink *link = machine->link = NodeLink::ForAddress(machine->node);
             if (!link) {
                 error = L"too many nodes of other machines";
                 return false;
@@ -250,15 +250,11 @@ NodeLink *Engine::RemoteNodeOf(const std::wstring &url)
     if (!m_hasRemoteNodes)
         return nullptr;
     std::wstring name = MachineOf(url);
-    std::wstring address;
-    {
-        std::lock_guard<SlimMutex> l(m_networkLock);
-        Machine *machine = name.empty() || name == L"." ? nullptr : m_network->FindMachine(name);
-        if (!machine || machine->node.empty())
-            return nullptr;
-        address = machine->node;
-    }
-    return NodeLink::ForAddress(address);
+    if (name.empty() || name == L".")
+        return nullptr;
+    std::lock_guard<SlimMutex> l(m_networkLock);
+    Machine *machine = m_network->FindMachine(name);
+    return machine ? machine->link : nullptr; // links live as long as the process
 }
 
 bool Engine::HasMember(const std::wstring &url)
@@ -387,7 +383,12 @@ HRESULT Engine::Read(Subscription *sub, uint32_t *flags, CadroValue *value, int3
 
 bool Engine::List(const std::wstring &url, std::vector<BrowseEntry> &out)
 {
-    if (NodeLink *link = RemoteNodeOf(url)) {
+    return ListOn(RemoteNodeOf(url), url, out);
+}
+
+bool Engine::ListOn(NodeLink *link, const std::wstring &url, std::vector<BrowseEntry> &out)
+{
+    if (link) {
         // A use of its own: the engine may be idle (a control command).
         link->AddUse();
         bool found = link->Browse(url, out);
@@ -401,11 +402,12 @@ bool Engine::List(const std::wstring &url, std::vector<BrowseEntry> &out)
 bool Engine::Browse(const std::wstring &url, std::vector<BrowseEntry> &out, bool hereOnly)
 {
     ++m_browseCount;
-    if (hereOnly && RemoteNodeOf(url)) {
+    NodeLink *link = RemoteNodeOf(url);
+    if (hereOnly && link) {
         out.clear();
         return false;
     }
-    return List(url, out);
+    return ListOn(link, url, out);
 }
 
 void Engine::SetShutdownHandler(std::function<void()> handler)

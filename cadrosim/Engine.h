@@ -185,6 +185,8 @@ private:
     // The link to the node that serves the machine of url, when another
     // node serves it; else null.
     class NodeLink *RemoteNodeOf(const std::wstring &url);
+    // The children of url, from the node of link when it is not null.
+    bool ListOn(class NodeLink *link, const std::wstring &url, std::vector<BrowseEntry> &out);
     // Under m_useLock: the links of the network's machines on other nodes
     // are used while the engine is.
     void UseRemoteNodes(const std::vector<class NodeLink *> &links, bool use);

@@ -70,7 +70,8 @@ struct Process {
 
 struct Machine {
     std::wstring name;
-    std::wstring node; // "host:port" of the node that serves it, when not this one
+    std::wstring node;              // "host:port" of the node that serves it, when not this one
+    class NodeLink *link = nullptr; // the engine's link to that node
     std::atomic<bool> connected{true};
     std::vector<std::unique_ptr<Process>> processes;
 };

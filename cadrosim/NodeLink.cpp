@@ -459,7 +459,10 @@ void NodeLink::Join(uint32_t id, uint32_t feedId)
     uint32_t slot = (feedId & wire::kFeedSlotMask) - 1;
     if (!sub || slot == UINT32_MAX || slot >= wire::kFeedSlotMask)
         return;
-    LeaveFeed(sub);
+    if (sub->feed) {
+        sub->mirror.CopyFrom(sub->feed->mirror); // what it had, for a new feed
+        LeaveFeed(sub);
+    }
     if (slot >= m_feeds.size())
         m_feeds.resize(slot + 1, nullptr);
     LinkFeed *&feed = m_feeds[slot];
@@ -501,7 +504,6 @@ void NodeLink::LeaveFeed(RemoteSubscription *sub)
     LinkFeed *feed = sub->feed;
     if (!feed)
         return;
-    sub->mirror.CopyFrom(feed->mirror);
     if (sub->previousMember)
         sub->previousMember->nextMember = sub->nextMember;
     else

@@ -175,7 +175,8 @@ private:
     // The link's thread publishes the subscription it calls now (null when
     // none) and wakes holders waiting for a call to end.
     void WakeWaiters(RemoteSubscription *calling);
-    // Under m_lock: a subscription joins its feed, or leaves it.
+    // Under m_lock: a subscription joins its feed, or leaves it (taking
+    // nothing of the feed's state along: its holder has let go).
     void Join(uint32_t id, uint32_t feedId);
     void LeaveFeed(RemoteSubscription *sub);
     LinkFeed *FeedOf(uint32_t feedId) const;

@@ -19,7 +19,7 @@ NodeServer *NodeServer::Create(Engine &engine, DWORD idleMs, std::wstring name, 
 }
 
 NodeServer::NodeServer(Engine &engine, DWORD idleMs, std::wstring name, std::wstring listen)
-    : m_engine(engine), m_idleMs(idleMs), m_pipeName(L"\\\\.\\pipe\\" + name), m_listen(std::move(listen)),
+    : m_engine(engine), m_idleMs(idleMs), m_pipeName(wire::PipeNameOf(name)), m_listen(std::move(listen)),
       m_stop(CreateEventW(nullptr, TRUE, FALSE, nullptr)), m_sessionEnded(CreateEventW(nullptr, FALSE, FALSE, nullptr))
 {
 }

@@ -44,9 +44,14 @@ constexpr uint32_t kFeedSlotMask = (1u << kFeedSlotBits) - 1;
 
 // The machine's node: its pipe, which every server's libraries reach.
 constexpr const wchar_t *kNodeName = L"CadroNode";
+inline std::wstring PipeNameOf(const std::wstring &nodeName)
+{
+    return L"\\\\.\\pipe\\" + nodeName;
+}
 inline const wchar_t *NodePipeName()
 {
-    return L"\\\\.\\pipe\\CadroNode";
+    static const std::wstring name = PipeNameOf(kNodeName);
+    return name.c_str();
 }
 
 // A URL's hash (FNV-1a over its characters), for the tables of URLs.
