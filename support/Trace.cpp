@@ -19,11 +19,18 @@ bool TraceToStderr()
     return enabled;
 }
 
+// Status traces come per item (three for every subscription made): nothing
+// is formatted unless someone reads the text.
+bool Heard()
+{
+    return IsDebuggerPresent() || TraceToStderr();
+}
+
 void Emit(const char *text)
 {
     // OutputDebugString costs a round trip through the system on every call
-    // (tens of microseconds under Wine) and status traces come per item: the
-    // text goes to a debugger only when one is attached.
+    // (tens of microseconds under Wine): the text goes to a debugger only
+    // when one is attached.
     if (IsDebuggerPresent())
         OutputDebugStringA(text);
     if (TraceToStderr())
@@ -33,6 +40,8 @@ void Emit(const char *text)
 
 void Trace(const char *format, ...)
 {
+    if (!Heard())
+        return;
     char text[1024];
     va_list args;
     va_start(args, format);
