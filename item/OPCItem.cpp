@@ -16,19 +16,24 @@ bool IsZero(const FILETIME &t)
     return t.dwLowDateTime == 0 && t.dwHighDateTime == 0;
 }
 
-wchar_t *CopyText(std::wstring_view text, void *(*allocate)(size_t))
-{
-    auto *copy = static_cast<wchar_t *>(allocate((text.size() + 1) * sizeof(wchar_t)));
-    if (copy) {
-        memcpy(copy, text.data(), text.size() * sizeof(wchar_t));
-        copy[text.size()] = L'\0';
-    }
-    return copy;
-}
-
 size_t TextLength(const wchar_t *text)
 {
     return text ? wcslen(text) : 0;
+}
+
+bool IsAscii(const wchar_t *text, size_t length)
+{
+    for (size_t i = 0; i < length; ++i)
+        if (text[i] >= 0x80)
+            return false;
+    return true;
+}
+
+template <class Char> void Store(Char *to, const wchar_t *from, size_t length)
+{
+    for (size_t i = 0; i < length; ++i)
+        to[i] = static_cast<Char>(from[i]);
+    to[length] = 0;
 }
 } // namespace
 
@@ -38,25 +43,40 @@ std::unique_ptr<COPCItem> COPCItem::Create(const OPCITEMDEF &definition)
     size_t pathLength = TextLength(definition.szAccessPath);
     if (idLength > UINT32_MAX / 4 || pathLength > UINT32_MAX / 4)
         return nullptr;
-    return std::unique_ptr<COPCItem>(new (idLength + pathLength + 2, std::nothrow)
-                                         COPCItem(definition.szItemID, idLength, definition.szAccessPath, pathLength));
+    bool narrow = IsAscii(definition.szItemID, idLength) && IsAscii(definition.szAccessPath, pathLength);
+    size_t bytes = (idLength + pathLength + 2) * (narrow ? sizeof(char) : sizeof(wchar_t));
+    return std::unique_ptr<COPCItem>(
+        new (bytes, std::nothrow) COPCItem(definition.szItemID, idLength, definition.szAccessPath, pathLength, narrow));
 }
 
-void *COPCItem::operator new(size_t size, size_t textChars, const std::nothrow_t &) noexcept
+void *COPCItem::operator new(size_t size, size_t textBytes, const std::nothrow_t &) noexcept
 {
-    return ::operator new(size + textChars * sizeof(wchar_t), std::nothrow);
+    return ::operator new(size + textBytes, std::nothrow);
 }
 
-COPCItem::COPCItem(const wchar_t *itemId, size_t itemIdLength, const wchar_t *accessPath, size_t accessPathLength)
-    : m_itemIdLength(static_cast<uint32_t>(itemIdLength)), m_accessPathLength(static_cast<uint32_t>(accessPathLength))
+COPCItem::COPCItem(const wchar_t *itemId, size_t itemIdLength, const wchar_t *accessPath, size_t accessPathLength,
+                   bool narrow)
+    : m_narrowTexts(narrow), m_itemIdLength(static_cast<uint32_t>(itemIdLength)),
+      m_accessPathLength(static_cast<uint32_t>(accessPathLength))
 {
-    auto *texts = const_cast<wchar_t *>(Texts());
-    if (itemIdLength)
-        memcpy(texts, itemId, itemIdLength * sizeof(wchar_t));
-    texts[itemIdLength] = L'\0';
-    if (accessPathLength)
-        memcpy(texts + itemIdLength + 1, accessPath, accessPathLength * sizeof(wchar_t));
-    texts[itemIdLength + 1 + accessPathLength] = L'\0';
+    if (narrow) {
+        Store(Texts<char>(), itemId, itemIdLength);
+        Store(Texts<char>() + itemIdLength + 1, accessPath, accessPathLength);
+    } else {
+        Store(Texts<wchar_t>(), itemId, itemIdLength);
+        Store(Texts<wchar_t>() + itemIdLength + 1, accessPath, accessPathLength);
+    }
+}
+
+wchar_t *COPCItem::CopyText(size_t offset, size_t length, void *(*allocate)(size_t)) const
+{
+    auto *copy = static_cast<wchar_t *>(allocate((length + 1) * sizeof(wchar_t)));
+    if (!copy)
+        return nullptr;
+    for (size_t i = 0; i < length; ++i)
+        copy[i] = m_narrowTexts ? static_cast<unsigned char>(Texts<char>()[offset + i]) : Texts<wchar_t>()[offset + i];
+    copy[length] = L'\0';
+    return copy;
 }
 
 COPCItem::~COPCItem()
@@ -79,13 +99,13 @@ HRESULT COPCItem::Init(CItemOwner *group, const OPCITEMDEF &definition, OPCITEMR
         m_serverHandle = CIdMgr::Instance().GetId();
         m_accessRights = OPC_READABLE | OPC_WRITEABLE;
         m_canonicalType = VT_EMPTY;
-        if (m_itemIdLength == 0)
+        if (m_itemIdLength == 0 || !definition.szItemID)
             return OPC_E_INVALIDITEMID;
         if (m_serverHandle == 0)
             return E_OUTOFMEMORY; // no identifier left for a handle
         DWORD rights;
         VARTYPE type;
-        if (ItemServices::FindNode(ItemId(), type, rights)) {
+        if (ItemServices::FindNode(definition.szItemID, type, rights)) {
             m_canonicalType = type;
             m_accessRights = static_cast<BYTE>(rights);
         } else {
@@ -98,7 +118,7 @@ HRESULT COPCItem::Init(CItemOwner *group, const OPCITEMDEF &definition, OPCITEMR
     // Subscribed without the item lock: the library may call back at once.
     if (ComPtr<OPCCadroClient> client = ItemServices::RealTimeClient()) {
         CadroDataItem *dataItem = nullptr;
-        HRESULT hr = client->Subscribe(Texts(), this, &dataItem);
+        HRESULT hr = client->Subscribe(definition.szItemID, this, &dataItem);
         if (FAILED(hr))
             return OPC_E_UNKNOWNITEMID;
         m_dataItem = dataItem;
@@ -166,8 +186,8 @@ HRESULT COPCItem::GetAttributes(OPCITEMATTRIBUTES &record, void *(*allocate)(siz
 {
     CSlimLockHolder lock(&m_lock);
     memset(&record, 0, sizeof record);
-    record.szAccessPath = CopyText(AccessPath(), allocate);
-    record.szItemID = CopyText(ItemId(), allocate);
+    record.szAccessPath = CopyText(m_itemIdLength + 1, m_accessPathLength, allocate);
+    record.szItemID = CopyText(0, m_itemIdLength, allocate);
     record.bActive = m_active ? TRUE : FALSE;
     record.hClient = m_clientHandle;
     record.hServer = m_serverHandle;

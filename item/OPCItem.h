@@ -5,9 +5,10 @@
 // network subscription. Owned and deleted by its group.
 //
 // An item is one heap block: its identifier and access path follow the
-// object in the same allocation, and it links itself into the group's active
-// list. A plant adds tens of thousands of items, each of which would
-// otherwise cost three or four more blocks.
+// object in the same allocation (a byte a character when both are ASCII, as
+// a plant's identifiers nearly always are), and it links itself into the
+// group's active list. A plant adds tens of thousands of items, each of
+// which would otherwise cost three or four more blocks.
 #include "CadroNetwork.h"
 #include "ItemOwner.h"
 #include "ManualResetEvent.h"
@@ -31,7 +32,8 @@ public:
     COPCItem &operator=(const COPCItem &) = delete;
     static void operator delete(void *block) noexcept { ::operator delete(block); }
 
-    // The rest of definition (its texts were taken by Create).
+    // The rest of definition, the one given to Create (its identifier is
+    // looked up and subscribed to from there).
     HRESULT Init(CItemOwner *group, const OPCITEMDEF &definition, OPCITEMRESULT &result);
     HRESULT SetActive(BOOL active);
     // Copies of the texts come from allocate (CoTaskMemAlloc or malloc).
@@ -52,16 +54,18 @@ public:
     OPCHANDLE ClientHandle();
     void SetClientHandle(OPCHANDLE client);
     void SetRequestedType(VARTYPE type);
-    std::wstring_view ItemId() const { return {Texts(), m_itemIdLength}; }
-    std::wstring_view AccessPath() const { return {Texts() + m_itemIdLength + 1, m_accessPathLength}; }
     CActiveItemList::Links &ActiveLinks() { return m_activeLinks; }
 
 private:
-    COPCItem(const wchar_t *itemId, size_t itemIdLength, const wchar_t *accessPath, size_t accessPathLength);
-    static void *operator new(size_t size, size_t textChars, const std::nothrow_t &) noexcept;
+    COPCItem(const wchar_t *itemId, size_t itemIdLength, const wchar_t *accessPath, size_t accessPathLength,
+             bool narrow);
+    static void *operator new(size_t size, size_t textBytes, const std::nothrow_t &) noexcept;
     static void operator delete(void *block, size_t, const std::nothrow_t &) noexcept { ::operator delete(block); }
-    // The identifier, its NUL, the access path and its NUL, after the object.
-    const wchar_t *Texts() const { return reinterpret_cast<const wchar_t *>(this + 1); }
+    // The identifier, its NUL, the access path and its NUL, after the object:
+    // characters of Char (char when m_narrowTexts, else wchar_t).
+    template <class Char> Char *Texts() const { return reinterpret_cast<Char *>(const_cast<COPCItem *>(this) + 1); }
+    // A copy of the text at offset (in characters), from allocate.
+    wchar_t *CopyText(size_t offset, size_t length, void *(*allocate)(size_t)) const;
 
     // Converts an output value to the requested type when one is set.
     HRESULT ToRequestedType(VARIANT *value);
@@ -84,6 +88,7 @@ private:
     VARTYPE m_canonicalType = VT_EMPTY;
     BYTE m_accessRights = 3; // OPC_READABLE | OPC_WRITEABLE
     bool m_active = false;
+    bool m_narrowTexts = false;
     CManualResetEvent m_valueArrived; // created unsignalled; sleeps on m_lock
     CItemOwner *m_group = nullptr;
     CActiveItemList::Links m_activeLinks;

@@ -74,12 +74,12 @@ TEST(Item, InitChoosesCanonicalTypesForUnknownItems)
     EXPECT_EQ(result.hServer, 0u);
     EXPECT_EQ(COPCItem::Create(Def(nullptr))->Init(&group, Def(nullptr), result), OPC_E_INVALIDITEMID);
 
-    // The texts live in the item's own block: long ones and a null access
-    // path come back intact.
+    // The texts live in the item's own block (a byte a character when both
+    // are ASCII): long ones, a null access path and characters beyond ASCII
+    // in either text come back intact.
     std::wstring longId = L"\\\\.\\p\\o." + std::wstring(10000, L'x');
     OPCITEMDEF def = Def(longId.c_str());
-    def.szAccessPath = const_cast<wchar_t *>(L"path");
-    for (const wchar_t *path : {L"path", static_cast<const wchar_t *>(nullptr)}) {
+    for (const wchar_t *path : {L"path", static_cast<const wchar_t *>(nullptr), L"Pfad\u00e4\u4e2d"}) {
         def.szAccessPath = const_cast<wchar_t *>(path);
         auto item = COPCItem::Create(def);
         ASSERT_EQ(item->Init(&group, def, result), S_OK);
@@ -90,6 +90,16 @@ TEST(Item, InitChoosesCanonicalTypesForUnknownItems)
         free(attributes.szItemID);
         free(attributes.szAccessPath);
     }
+    std::wstring wideId = L"\\\\.\\p\\\u00d6fen.\u00fc";
+    def = Def(wideId.c_str());
+    auto item = COPCItem::Create(def);
+    ASSERT_EQ(item->Init(&group, def, result), S_OK);
+    OPCITEMATTRIBUTES attributes;
+    ASSERT_EQ(item->GetAttributes(attributes, malloc), S_OK);
+    EXPECT_EQ(attributes.szItemID, wideId);
+    EXPECT_STREQ(attributes.szAccessPath, L"");
+    free(attributes.szItemID);
+    free(attributes.szAccessPath);
 }
 
 TEST(Item, ChangesFollowQualityAndValueButNotTime)
