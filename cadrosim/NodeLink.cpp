@@ -131,7 +131,8 @@ RemoteSubscription::~RemoteSubscription()
 
 HRESULT RemoteSubscription::Recall(uint32_t *flags, CadroValue *value, int32_t *errorFlag, FILETIME *time) const
 {
-    return (feed ? feed->mirror : mirror).Recall(flags, value, errorFlag, time);
+    return feed ? feed->mirror.Recall(flags, value, errorFlag, time)
+                : MemberMirror().Recall(flags, value, errorFlag, time);
 }
 
 void RemoteSubscription::Delete()
@@ -381,7 +382,7 @@ void NodeLink::Disconnected()
     for (uint32_t id : ids)
         CallSubscription(
             id, [](RemoteSubscription &sub) { sub.receiver->StatusChange(sub.cookie, kCadroStatusDisconnected, 0, 0); },
-            [](RemoteSubscription &sub) { sub.mirror.RememberStatus(kCadroStatusDisconnected); });
+            [](RemoteSubscription &sub) { sub.feed->mirror.RememberStatus(kCadroStatusDisconnected); });
 }
 
 bool NodeLink::WaitConnected(std::unique_lock<SlimMutex> &l, bool forAnswer)
@@ -457,49 +458,47 @@ void NodeLink::Join(uint32_t id, uint32_t feedId)
 {
     RemoteSubscription *sub = Lookup(id);
     uint32_t slot = (feedId & wire::kFeedSlotMask) - 1;
-    if (!sub || slot == UINT32_MAX || slot >= wire::kFeedSlotMask)
+    if (!sub || !sub->feed || slot == UINT32_MAX || slot >= wire::kFeedSlotMask || sub->feed->id == feedId)
         return;
-    if (sub->feed) {
-        sub->mirror.CopyFrom(sub->feed->mirror); // what it had, for a new feed
-        LeaveFeed(sub);
-    }
     if (slot >= m_feeds.size())
         m_feeds.resize(slot + 1, nullptr);
     LinkFeed *&feed = m_feeds[slot];
     if (feed && feed->id != feedId) {
         // An earlier feed of the slot that the node has dropped.
-        DetachMembers(*feed);
-        delete feed;
+        Unshare(*feed);
         feed = nullptr;
+    }
+    LinkFeed *current = sub->feed;
+    if (!feed && current->id == 0 && current->first == sub && !sub->nextMember) {
+        // Its own feed becomes the node's: what the node told the newcomer
+        // is the feed's state now. (Nearly every URL goes this way.)
+        current->id = feedId;
+        feed = current;
+        return;
     }
     if (!feed) {
         feed = new (std::nothrow) LinkFeed();
         if (!feed)
-            return; // the subscription goes on with what it was told itself
+            return; // the subscription goes on in the feed it has
         feed->id = feedId;
-        // What the node told the newcomer is the feed's state now.
-        feed->mirror.CopyFrom(sub->mirror);
+        feed->mirror.CopyFrom(current->mirror);
     }
-    sub->feed = feed;
-    sub->previousMember = nullptr;
-    sub->nextMember = feed->first;
-    if (feed->first)
-        feed->first->previousMember = sub;
-    feed->first = sub;
+    LinkFeed &joined = *feed;
+    RemoveMember(sub);
+    AddMember(joined, sub);
 }
 
-void NodeLink::DetachMembers(LinkFeed &feed)
+void NodeLink::AddMember(LinkFeed &feed, RemoteSubscription *sub)
 {
-    for (RemoteSubscription *member = feed.first, *next; member; member = next) {
-        next = member->nextMember;
-        member->mirror.CopyFrom(feed.mirror);
-        member->feed = nullptr;
-        member->previousMember = member->nextMember = nullptr;
-    }
-    feed.first = nullptr;
+    sub->feed = &feed;
+    sub->previousMember = nullptr;
+    sub->nextMember = feed.first;
+    if (feed.first)
+        feed.first->previousMember = sub;
+    feed.first = sub;
 }
 
-void NodeLink::LeaveFeed(RemoteSubscription *sub)
+void NodeLink::RemoveMember(RemoteSubscription *sub)
 {
     LinkFeed *feed = sub->feed;
     if (!feed)
@@ -512,21 +511,34 @@ void NodeLink::LeaveFeed(RemoteSubscription *sub)
         sub->nextMember->previousMember = sub->previousMember;
     sub->previousMember = sub->nextMember = nullptr;
     sub->feed = nullptr;
-    if (!feed->first) {
+    if (feed->first)
+        return;
+    if (feed->id != 0)
         m_feeds[(feed->id & wire::kFeedSlotMask) - 1] = nullptr;
-        delete feed;
+    delete feed;
+}
+
+void NodeLink::Unshare(LinkFeed &feed)
+{
+    // The first member keeps the feed, the others take copies (they share
+    // it still when memory is short).
+    feed.id = 0;
+    for (RemoteSubscription *sub = feed.first ? feed.first->nextMember : nullptr, *next; sub; sub = next) {
+        next = sub->nextMember;
+        auto *own = new (std::nothrow) LinkFeed();
+        if (!own)
+            return;
+        own->mirror.CopyFrom(feed.mirror);
+        RemoveMember(sub);
+        AddMember(*own, sub);
     }
 }
 
 void NodeLink::DropFeeds()
 {
-    for (LinkFeed *&feed : m_feeds) {
-        if (!feed)
-            continue;
-        DetachMembers(*feed);
-        delete feed;
-        feed = nullptr;
-    }
+    for (LinkFeed *feed : m_feeds)
+        if (feed)
+            Unshare(*feed);
     m_feeds.clear();
 }
 
@@ -565,7 +577,7 @@ void NodeLink::DeliverData()
                     feed->ForEachMember([&](RemoteSubscription *sub) { m_batchSubs.emplace_back(sub, index); });
                 }
             } else if (RemoteSubscription *sub = Lookup(id)) {
-                sub->mirror.Remember(f.flags, f.value, f.error, f.low, f.high);
+                sub->feed->mirror.Remember(f.flags, f.value, f.error, f.low, f.high);
                 m_batchSubs.emplace_back(sub, index);
             }
         }
@@ -631,7 +643,7 @@ void NodeLink::Dispatch(wire::Kind kind, wire::In &in)
         if (in.Ok())
             CallSubscription(
                 id, [&](RemoteSubscription &sub) { sub.receiver->StatusChange(sub.cookie, status, 0, 0); },
-                [&](RemoteSubscription &sub) { sub.mirror.RememberStatus(status); });
+                [&](RemoteSubscription &sub) { sub.feed->mirror.RememberStatus(status); });
         return;
     }
     case wire::Kind::Joined: {
@@ -783,13 +795,17 @@ HRESULT NodeLink::Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeRece
     RemoteSubscription *sub = RemoteSubscription::Create(m_index, url, receiver, cookie);
     if (!sub)
         return E_OUTOFMEMORY;
+    // Its own feed holds what the node tells it until it joins the node's.
+    auto *own = new (std::nothrow) LinkFeed();
     std::unique_lock<SlimMutex> l(m_lock);
     bool connected = WaitConnected(l, false);
-    if (!Register(sub)) {
+    if (!own || !Register(sub)) {
         l.unlock();
+        delete own;
         sub->Delete();
         return E_OUTOFMEMORY;
     }
+    AddMember(*own, sub);
     if (!connected) {
         // The node is away: the subscription waits for it, as one on a
         // disconnected machine does.
@@ -835,7 +851,7 @@ HRESULT NodeLink::Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeRece
 
 void NodeLink::Forget(RemoteSubscription *sub, std::unique_lock<SlimMutex> &l)
 {
-    LeaveFeed(sub);
+    RemoveMember(sub);
     Unregister(sub);
     sub->Forgotten();
     if (m_delivering) {

@@ -24,11 +24,14 @@ namespace cadrosim {
 class NodeLink;
 class RemoteSubscription;
 
-// The node's subscription that this process's subscriptions to one URL
-// share (the node's feed): the member as the node last sent it, and the
-// subscriptions that take its frames. The link's, under its lock.
+// The member as the node last sent it, and the subscriptions that take its
+// frames. Every subscription is in one: the node's subscription that this
+// process's subscriptions to one URL share (the node's feed, by its id), or
+// one of its own until the node says which feed it joined (id 0). When the
+// node drops a feed, each member goes on with a copy of its own; the last
+// member to leave a feed deletes it. The link's, under its lock.
 struct LinkFeed {
-    uint32_t id = 0;
+    uint32_t id = 0; // the node's feed; 0: not the node's
     MemberMirror mirror;
     // The members, linked through themselves: no allocation per feed but
     // the feed's own (nearly every URL has one subscription).
@@ -49,17 +52,15 @@ public:
     // The URL, kept to subscribe again after a reconnection.
     std::wstring Url() const;
 
-    // Under the link's lock: the member as the node last sent it, through
-    // the feed once the subscription has joined one.
+    // Under the link's lock: the member as the node last sent it (its
+    // feed's).
     HRESULT Recall(uint32_t *flags, CadroValue *value, int32_t *errorFlag, FILETIME *time) const;
-    bool Connected() const { return (feed ? feed->mirror : mirror).Connected(); }
+    bool Connected() const { return !feed || feed->mirror.Connected(); }
 
     ICadroRealTimeReceiver *receiver;
     void *cookie;
     uint32_t id = 0;
-    // Under the link's lock. What the node sent this subscription before it
-    // joined its feed (what a new subscription is told first).
-    MemberMirror mirror;
+    // Under the link's lock; null only once it is forgotten.
     LinkFeed *feed = nullptr;
     RemoteSubscription *previousMember = nullptr, *nextMember = nullptr;
 
@@ -175,13 +176,15 @@ private:
     // The link's thread publishes the subscription it calls now (null when
     // none) and wakes holders waiting for a call to end.
     void WakeWaiters(RemoteSubscription *calling);
-    // Under m_lock: a subscription joins its feed, or leaves it (taking
-    // nothing of the feed's state along: its holder has let go).
+    // Under m_lock: a subscription joins the node's feed; a member enters a
+    // feed or leaves it (the last to leave deletes it).
     void Join(uint32_t id, uint32_t feedId);
-    void LeaveFeed(RemoteSubscription *sub);
+    static void AddMember(LinkFeed &feed, RemoteSubscription *sub);
+    void RemoveMember(RemoteSubscription *sub);
     LinkFeed *FeedOf(uint32_t feedId) const;
-    // Its members go on with what the feed last had, on their own.
-    void DetachMembers(LinkFeed &feed);
+    // The node has dropped the feed: its members go on with what it last
+    // had, each in a feed of its own.
+    void Unshare(LinkFeed &feed);
     void DropFeeds();
     void Disconnected();
     // Out of the table, then waits for a call to it under way on another

@@ -154,6 +154,10 @@ TEST(NodeE2E, AKilledNodeIsReportedToEverySubscriptionWhichResumesOnTheNextNode)
     Subscribed first;
     ASSERT_NO_FATAL_FAILURE(first.Start());
     TestSink &sink = first.sink;
+    // Two items of one URL share the node's subscription: each must go on,
+    // and resume, on its own once the node that held it is gone.
+    ASSERT_NE(first.More(kTemperature, 2), 0u);
+    ASSERT_TRUE(sink.WaitFor([](auto &calls) { return HasValueFor(calls, 2, 21.5); }));
 
     // A second process on the same node, printing what it is told.
     auto other = std::async(std::launch::async, [] {
@@ -178,7 +182,7 @@ TEST(NodeE2E, AKilledNodeIsReportedToEverySubscriptionWhichResumesOnTheNextNode)
     ASSERT_TRUE(WaitForNewNode(killed, 20000));
     Sleep(500);
     EXPECT_EQ(RunCadroctl(L"publish \\\\.\\proc1\\Setpoints.temperature 77", out), 0) << out;
-    EXPECT_TRUE(sink.WaitFor([](auto &calls) { return HasDataChange(calls, 77); }));
+    EXPECT_TRUE(sink.WaitFor([](auto &calls) { return HasValueFor(calls, 0, 77) && HasValueFor(calls, 2, 77); }));
 
     std::string printed = other.get();
     EXPECT_TRUE(Has(printed, "subscribed 0x00000000")) << printed;
