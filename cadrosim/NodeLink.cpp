@@ -469,7 +469,7 @@ void NodeLink::Join(uint32_t id, uint32_t feedId)
         feed = nullptr;
     }
     LinkFeed *current = sub->feed;
-    if (!feed && current->id == 0 && current->first == sub && !sub->nextMember) {
+    if (!feed && current->id == 0 && current->first == sub && current->Alone()) {
         // Its own feed becomes the node's: what the node told the newcomer
         // is the feed's state now. (Nearly every URL goes this way.)
         current->id = feedId;
@@ -484,18 +484,37 @@ void NodeLink::Join(uint32_t id, uint32_t feedId)
         feed->mirror.CopyFrom(current->mirror);
     }
     LinkFeed &joined = *feed;
+    // Room first: short of memory, the subscription stays where it is.
+    if (!MakeRoom(joined))
+        return;
     RemoveMember(sub);
     AddMember(joined, sub);
 }
 
+bool NodeLink::MakeRoom(LinkFeed &feed)
+{
+    if (!feed.first)
+        return true;
+    try {
+        if (!feed.others)
+            feed.others = std::make_unique<std::vector<RemoteSubscription *>>();
+        feed.others->reserve(feed.others->size() + 1);
+    } catch (const std::bad_alloc &) {
+        return false;
+    }
+    return true;
+}
+
 void NodeLink::AddMember(LinkFeed &feed, RemoteSubscription *sub)
 {
+    if (feed.first) {
+        feed.others->push_back(sub);
+        sub->place = static_cast<uint32_t>(feed.others->size());
+    } else {
+        feed.first = sub;
+        sub->place = 0;
+    }
     sub->feed = &feed;
-    sub->previousMember = nullptr;
-    sub->nextMember = feed.first;
-    if (feed.first)
-        feed.first->previousMember = sub;
-    feed.first = sub;
 }
 
 void NodeLink::RemoveMember(RemoteSubscription *sub)
@@ -503,14 +522,17 @@ void NodeLink::RemoveMember(RemoteSubscription *sub)
     LinkFeed *feed = sub->feed;
     if (!feed)
         return;
-    if (sub->previousMember)
-        sub->previousMember->nextMember = sub->nextMember;
-    else
-        feed->first = sub->nextMember;
-    if (sub->nextMember)
-        sub->nextMember->previousMember = sub->previousMember;
-    sub->previousMember = sub->nextMember = nullptr;
     sub->feed = nullptr;
+    // The last of the others takes the place that comes free.
+    RemoteSubscription *last = feed->Alone() ? nullptr : feed->others->back();
+    if (last)
+        feed->others->pop_back();
+    if (sub->place == 0)
+        feed->first = last;
+    else if (last != sub)
+        (*feed->others)[sub->place - 1] = last;
+    if (last && last != sub)
+        last->place = sub->place;
     if (feed->first)
         return;
     if (feed->id != 0)
@@ -523,11 +545,11 @@ void NodeLink::Unshare(LinkFeed &feed)
     // The first member keeps the feed, the others take copies (they share
     // it still when memory is short).
     feed.id = 0;
-    for (RemoteSubscription *sub = feed.first ? feed.first->nextMember : nullptr, *next; sub; sub = next) {
-        next = sub->nextMember;
+    while (!feed.Alone()) {
         auto *own = new (std::nothrow) LinkFeed();
         if (!own)
             return;
+        RemoteSubscription *sub = feed.others->back();
         own->mirror.CopyFrom(feed.mirror);
         RemoveMember(sub);
         AddMember(*own, sub);

@@ -33,9 +33,13 @@ class RemoteSubscription;
 struct LinkFeed {
     uint32_t id = 0; // the node's feed; 0: not the node's
     MemberMirror mirror;
-    // The members, linked through themselves: no allocation per feed but
-    // the feed's own (nearly every URL has one subscription).
+    // The members: the first in place (nearly every URL has one
+    // subscription), any others in an array, each knowing its place. A value
+    // walks them from one array rather than from member to member: a feed
+    // with thousands of members would chase a pointer into each.
     RemoteSubscription *first = nullptr;
+    std::unique_ptr<std::vector<RemoteSubscription *>> others;
+    bool Alone() const { return !others || others->empty(); }
     template <class F> void ForEachMember(F f) const;
 };
 
@@ -60,9 +64,10 @@ public:
     ICadroRealTimeReceiver *receiver;
     void *cookie;
     uint32_t id = 0;
-    // Under the link's lock; null only once it is forgotten.
+    // Under the link's lock: its feed (null only once it is forgotten) and
+    // its place there (0: the first, i + 1: others[i]).
+    uint32_t place = 0;
     LinkFeed *feed = nullptr;
-    RemoteSubscription *previousMember = nullptr, *nextMember = nullptr;
 
     // The link's handles on the object: one for its place in the table
     // (until its holder lets go), one for each status or attributes call
@@ -121,8 +126,11 @@ private:
 
 template <class F> void LinkFeed::ForEachMember(F f) const
 {
-    for (RemoteSubscription *sub = first; sub; sub = sub->nextMember)
-        f(sub);
+    if (first)
+        f(first);
+    if (others)
+        for (RemoteSubscription *sub : *others)
+            f(sub);
 }
 
 class NodeLink {
@@ -179,6 +187,9 @@ private:
     // Under m_lock: a subscription joins the node's feed; a member enters a
     // feed or leaves it (the last to leave deletes it).
     void Join(uint32_t id, uint32_t feedId);
+    // Room for one more member (false when memory is short), which
+    // AddMember then takes: a feed without members has room for one.
+    static bool MakeRoom(LinkFeed &feed);
     static void AddMember(LinkFeed &feed, RemoteSubscription *sub);
     void RemoveMember(RemoteSubscription *sub);
     LinkFeed *FeedOf(uint32_t feedId) const;
