@@ -939,6 +939,7 @@ bool NodeLink::Browse(const std::wstring &url, std::vector<BrowseEntry> &out)
     bool found = in.U8() != 0;
     uint32_t count = in.U32();
     std::vector<uint64_t> known;
+    uint64_t urlHash = wire::UrlHash(url);
     for (uint32_t i = 0; i < count && in.Ok(); ++i) {
         BrowseEntry e;
         e.name = in.Text();
@@ -947,7 +948,7 @@ bool NodeLink::Browse(const std::wstring &url, std::vector<BrowseEntry> &out)
         e.dataType = in.U16();
         e.access = in.U16();
         if (in.U8())
-            known.push_back(wire::UrlHash(wire::MemberUrl(url, e.name)));
+            known.push_back(wire::MemberUrlHash(urlHash, e.name));
         out.push_back(std::move(e));
     }
     if (!in.Ok()) {

@@ -54,10 +54,10 @@ inline const wchar_t *NodePipeName()
     return name.c_str();
 }
 
-// A URL's hash (FNV-1a over its characters), for the tables of URLs.
-inline uint64_t UrlHash(std::wstring_view url)
+// A URL's hash (FNV-1a over its characters), for the tables of URLs; from
+// h, the hash of the text before url.
+inline uint64_t UrlHash(std::wstring_view url, uint64_t h = 1469598103934665603ull)
 {
-    uint64_t h = 1469598103934665603ull;
     for (wchar_t c : url) {
         h ^= static_cast<uint16_t>(c);
         h *= 1099511628211ull;
@@ -72,6 +72,15 @@ inline std::wstring MemberUrl(const std::wstring &url, const std::wstring &name)
     if (name == L"(implicit)")
         return url;
     return url + L"." + name.substr(0, name.find(L'-'));
+}
+
+// UrlHash(MemberUrl(url, name)) without building the URL, from urlHash, the
+// hash of url.
+inline uint64_t MemberUrlHash(uint64_t urlHash, const std::wstring &name)
+{
+    if (name == L"(implicit)")
+        return urlHash;
+    return UrlHash(std::wstring_view(name).substr(0, name.find(L'-')), UrlHash(L".", urlHash));
 }
 
 class Out {

@@ -118,6 +118,10 @@ TEST(Wire, FramesRoundTripAndBadOnesAreRefused)
     // The member URLs a listing lets a library subscribe to without asking.
     EXPECT_EQ(wire::MemberUrl(L"\\\\H\\p\\Obj", L"cosine-Cosine wave"), L"\\\\H\\p\\Obj.cosine");
     EXPECT_EQ(wire::MemberUrl(L"\\\\H\\p\\Obj", L"(implicit)"), L"\\\\H\\p\\Obj");
+    // Their hashes, made without building them, are those of the URLs.
+    const std::wstring obj = L"\\\\H\\p\\Obj";
+    for (const wchar_t *name : {L"cosine-Cosine wave", L"(implicit)", L"plain", L"-", L"a-b-c"})
+        EXPECT_EQ(wire::MemberUrlHash(wire::UrlHash(obj), name), wire::UrlHash(wire::MemberUrl(obj, name))) << name;
 }
 
 // The set of member URLs that listings confirmed, by hash: what went in is
