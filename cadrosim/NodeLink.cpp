@@ -399,9 +399,12 @@ bool NodeLink::WaitConnected(std::unique_lock<SlimMutex> &l, bool forAnswer)
     // its subscriptions wait as on a disconnected machine, and the machine's
     // own servers are not held up by one that cannot be reached.
     bool wait = forAnswer || m_address.empty();
-    auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(kStartWaitMs);
-    while (wait && m_state == State::Connecting && !OnLinkThread() && std::chrono::steady_clock::now() < deadline)
-        m_changed.wait_until(l, deadline);
+    if (wait && m_state == State::Connecting && !OnLinkThread()) {
+        // Only then the clock: every read of every item comes this way.
+        auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(kStartWaitMs);
+        while (m_state == State::Connecting && std::chrono::steady_clock::now() < deadline)
+            m_changed.wait_until(l, deadline);
+    }
     return m_state == State::Connected;
 }
 

@@ -218,32 +218,37 @@ void COPCItem::CopyDeviceToLastReported()
 
 HRESULT COPCItem::Read(OPCDATASOURCE source, OPCHANDLE *client, VARIANT *value, WORD *quality, FILETIME *time)
 {
+    VariantInit(value);
     // Ask the network first, and wait for a first value, without the item
     // lock: updates must be able to arrive meanwhile.
+    uint32_t flags = 0;
+    CCadroValue record;
+    int32_t error = 0;
+    FILETIME stamp = {};
+    HRESULT asked = S_OK;
+    bool arrived = false;
     if (m_dataItem) {
-        uint32_t flags = 0;
-        CCadroValue record;
-        int32_t error = 0;
-        FILETIME stamp = {};
-        HRESULT hr = m_dataItem->Read(&flags, record.Get(), &error, &stamp);
-        if (SUCCEEDED(hr) && (flags & kCadroHasValue)) {
-            OnDataUpdate(flags, record.Value(), error, stamp);
-            hr = S_OK;
-        } else {
-            hr = m_valueArrived.Wait(m_lock, kFirstValueWaitMs) ? S_OK : OPC_E_UNKNOWNITEMID;
-        }
-        CSlimLockHolder lock(&m_lock);
-        if (SUCCEEDED(hr)) {
-            if (m_accessRights == 0 || IsZero(stamp))
-                hr = OPC_E_UNKNOWNITEMID;
-            else if (!(m_accessRights & OPC_READABLE))
-                hr = OPC_E_BADRIGHTS;
-        }
-        m_lastReadResult = hr;
+        asked = m_dataItem->Read(&flags, record.Get(), &error, &stamp);
+        arrived = SUCCEEDED(asked) && (flags & kCadroHasValue);
+        if (arrived)
+            asked = S_OK;
+        else
+            asked = m_valueArrived.Wait(m_lock, kFirstValueWaitMs) ? S_OK : OPC_E_UNKNOWNITEMID;
     }
 
-    VariantInit(value);
+    // The rest under one hold of the lock (a read of thousands of items).
     CSlimLockHolder lock(&m_lock);
+    if (m_dataItem) {
+        if (arrived)
+            StoreDeviceValue(flags, record.Value(), error, stamp);
+        if (SUCCEEDED(asked)) {
+            if (m_accessRights == 0 || IsZero(stamp))
+                asked = OPC_E_UNKNOWNITEMID;
+            else if (!(m_accessRights & OPC_READABLE))
+                asked = OPC_E_BADRIGHTS;
+        }
+        m_lastReadResult = asked;
+    }
     *client = m_clientHandle;
     HRESULT result = m_lastReadResult;
     bool inactive = !m_active || (m_group && !m_group->GroupActive());
@@ -315,6 +320,11 @@ HRESULT COPCItem::CheckChanged(double, OPCHANDLE *client, VARIANT *value, WORD *
 void COPCItem::OnDataUpdate(uint32_t flags, const CadroValue &value, int32_t errorFlag, const FILETIME &time)
 {
     CSlimLockHolder lock(&m_lock);
+    StoreDeviceValue(flags, value, errorFlag, time);
+}
+
+void COPCItem::StoreDeviceValue(uint32_t flags, const CadroValue &value, int32_t errorFlag, const FILETIME &time)
+{
     if (flags & kCadroHasQuality)
         m_deviceQuality = errorFlag == 0 ? OPC_QUALITY_GOOD : OPC_QUALITY_BAD;
     if (flags & kCadroHasValue) {

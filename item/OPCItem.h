@@ -70,6 +70,8 @@ private:
     // Converts an output value to the requested type when one is set.
     HRESULT ToRequestedType(VARIANT *value);
     void CopyDeviceToLastReported();
+    // Under the lock: a value (or quality, or time) from the network.
+    void StoreDeviceValue(uint32_t flags, const CadroValue &value, int32_t errorFlag, const FILETIME &time);
 
     CSlimLock m_lock;
     // What the network writes at every update and the scan reads at every
