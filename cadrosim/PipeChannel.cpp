@@ -4,10 +4,6 @@
 
 namespace cadrosim {
 
-namespace {
-constexpr DWORD kReadChunk = 256 * 1024;
-}
-
 PipeChannel::PipeChannel(HANDLE pipe)
     : m_pipe(pipe), m_readEvent(CreateEventW(nullptr, TRUE, FALSE, nullptr)),
       m_writeEvent(CreateEventW(nullptr, TRUE, FALSE, nullptr))
@@ -51,17 +47,19 @@ bool PipeChannel::Read(std::string &buffer)
 {
     if (m_closed || !m_readEvent)
         return false;
-    size_t had = buffer.size();
-    buffer.resize(had + kReadChunk);
+    char *room = ReadRoom();
+    if (!room)
+        return false;
     OVERLAPPED ov = {};
     ov.hEvent = m_readEvent;
     // Reset by hand: Wine does not reset it when the read starts, and a
     // read that then waits would find the last one's signal.
     ResetEvent(m_readEvent);
     DWORD got = 0;
-    BOOL started = ReadFile(m_pipe, &buffer[had], kReadChunk, &got, &ov);
+    BOOL started = ReadFile(m_pipe, room, kReadChunk, &got, &ov);
     bool ok = Finish(ov, started, got) || GetLastError() == ERROR_MORE_DATA;
-    buffer.resize(had + (ok ? got : 0));
+    if (ok)
+        buffer.append(room, got);
     return ok && got > 0;
 }
 

@@ -7,7 +7,6 @@
 namespace cadrosim {
 
 namespace {
-constexpr int kReadChunk = 256 * 1024;
 constexpr int kLargestSend = 64 * 1024;
 constexpr long kLookMs = 200;
 
@@ -130,10 +129,12 @@ bool SocketChannel::Read(std::string &buffer)
     }
     if (m_closed)
         return false;
-    size_t had = buffer.size();
-    buffer.resize(had + kReadChunk);
-    int got = recv(m_socket, &buffer[had], kReadChunk, 0);
-    buffer.resize(had + (got > 0 ? got : 0));
+    char *room = ReadRoom();
+    if (!room)
+        return false;
+    int got = recv(m_socket, room, static_cast<int>(kReadChunk), 0);
+    if (got > 0)
+        buffer.append(room, static_cast<size_t>(got));
     return got > 0 && !m_closed;
 }
 
