@@ -2,6 +2,8 @@
 // Lockable objects and the scoped lock holder used for every lock in the server.
 #include <windows.h>
 
+#include <atomic>
+
 class CSyncObject {
 public:
     virtual ~CSyncObject() = default;
@@ -38,12 +40,17 @@ private:
     CRITICAL_SECTION m_cs;
 };
 
-// A slim lock for objects that exist by the ten thousand (the items): an
-// SRW lock, a pointer in size, with nothing to create or delete (a critical
-// section costs a round trip to the wineserver when it is deleted, under
-// Wine, and five times the memory). Not recursive, and not a CSyncObject: a
-// table of virtual functions would add a pointer to every item. It spins a
-// while before it sleeps, for the same reason as the critical section above.
+// A slim lock for objects that exist by the ten thousand (the items): one
+// word, with nothing to create or delete (a critical section costs a round
+// trip to the wineserver when it is deleted, under Wine, and five times the
+// memory). Free, it is taken and given back with one atomic operation each;
+// only a holder that finds it held sleeps on the word (WaitOnAddress), and
+// only a release that knows of sleepers wakes one. An SRW lock would do, but
+// under Wine its release calls into the keyed waiters' table every time, and
+// the items take a million updates a second each under their lock. Not
+// recursive, and not a CSyncObject: a table of virtual functions would add
+// a pointer to every item. It spins a while before it sleeps, for the same
+// reason as the critical section above.
 class CSlimLock {
 public:
     CSlimLock() = default;
@@ -52,24 +59,37 @@ public:
 
     BOOL Lock(DWORD = INFINITE)
     {
+        LONG free = kFree;
+        if (m_state.compare_exchange_strong(free, kHeld, std::memory_order_acquire))
+            return TRUE;
         for (unsigned i = 0; i < kSpins; ++i) {
-            if (TryAcquireSRWLockExclusive(&m_srw))
-                return TRUE;
             YieldProcessor();
+            free = kFree;
+            if (m_state.load(std::memory_order_relaxed) == kFree &&
+                m_state.compare_exchange_weak(free, kHeld, std::memory_order_acquire))
+                return TRUE;
         }
-        AcquireSRWLockExclusive(&m_srw);
+        // Held: announce a sleeper and sleep until a release sees it. Taken
+        // this way the word stays "with sleepers", so the release wakes one
+        // more than needed at worst, never one less.
+        while (m_state.exchange(kSleepers, std::memory_order_acquire) != kFree) {
+            LONG sleepers = kSleepers;
+            WaitOnAddress(&m_state, &sleepers, sizeof sleepers, INFINITE);
+        }
         return TRUE;
     }
     BOOL Unlock()
     {
-        ReleaseSRWLockExclusive(&m_srw);
+        if (m_state.exchange(kFree, std::memory_order_release) == kSleepers)
+            WakeByAddressSingle(&m_state);
         return TRUE;
     }
-    // For condition variables (held exclusively by the sleeper).
 
 private:
     static constexpr unsigned kSpins = 1000;
-    SRWLOCK m_srw = SRWLOCK_INIT;
+    static constexpr LONG kFree = 0, kHeld = 1, kSleepers = 2;
+    std::atomic<LONG> m_state{kFree};
+    static_assert(sizeof(std::atomic<LONG>) == sizeof(LONG), "WaitOnAddress compares the word itself");
 };
 
 // Scoped holder: counts its own acquisitions and undoes them all when it goes
