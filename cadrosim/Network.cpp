@@ -124,7 +124,7 @@ bool Network::ParseUrl(const std::wstring &url, Path &path)
     if (it == processes.end())
         return false;
     path.process = it->get();
-    path.objects.assign(segments.begin() + 1, segments.end());
+    path.objects.assign(std::make_move_iterator(segments.begin() + 1), std::make_move_iterator(segments.end()));
     return true;
 }
 
@@ -187,9 +187,24 @@ bool Network::List(const std::wstring &url, std::vector<BrowseEntry> &out)
         e.leaf = true;
         e.dataType = static_cast<uint16_t>(m->type);
         e.access = static_cast<uint16_t>(m->access);
-        out.push_back(e);
+        e.named = NamesAMember(*object, e.name);
+        out.push_back(std::move(e));
     }
     return true;
+}
+
+bool Network::NamesAMember(const Object &object, const std::wstring &name)
+{
+    // The URL is the object's and "." and the name up to its first "-" (the
+    // object's own for "(implicit)"): a plain part is read back as the
+    // member's name, so the object's index tells. Other parts (empty,
+    // quoted, with a separator) are left to a lookup by URL.
+    if (name == L"(implicit)")
+        return object.memberIndex.count(std::wstring()) != 0;
+    std::wstring part = name.substr(0, name.find(L'-'));
+    if (part.empty() || part[0] == L'\'' || part.find_first_of(L"\\.") != std::wstring::npos)
+        return false;
+    return object.memberIndex.count(part) != 0;
 }
 
 Object *Network::EnsureObject(const std::wstring &objectUrl, std::wstring &error)

@@ -83,6 +83,10 @@ struct BrowseEntry {
     bool leaf = false;
     uint16_t dataType = 0;
     uint16_t access = 3;
+    // A member of a local object whose URL, as a library builds it from
+    // this listing (wire::MemberUrl), is known to name a member; false when
+    // that is not known without a lookup by URL.
+    bool named = false;
 };
 
 class Network {
@@ -101,6 +105,9 @@ public:
     // The children of a machine, process or object URL, or of "\" or "\\"
     // (the machines). False when the URL is unknown.
     bool List(const std::wstring &url, std::vector<BrowseEntry> &out);
+    // Whether the URL a library builds from the listed name of one of
+    // object's members is known to name a member (BrowseEntry::named).
+    static bool NamesAMember(const Object &object, const std::wstring &name);
 
     // The object an object URL names, created with its path when missing;
     // null (with error) when the URL names no process.

@@ -372,7 +372,8 @@ void NodeSession::List(uint32_t request, const std::wstring &url)
             // Whether the member's URL as a library would build it from this
             // listing names it: the library may then subscribe to it without
             // waiting for the node's answer.
-            out.U8(e.leaf && m_engine.HasMember(wire::MemberUrl(url, e.name)) ? 1 : 0);
+            // (A local object's listing knows it for nearly every member.)
+            out.U8(e.leaf && (e.named || m_engine.HasMember(wire::MemberUrl(url, e.name))) ? 1 : 0);
         }
     });
 }

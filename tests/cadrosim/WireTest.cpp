@@ -3,6 +3,7 @@
 // is never read past.
 #include "Wire.h"
 #include "HashSet64.h"
+#include "Network.h"
 
 #include <gtest/gtest.h>
 
@@ -141,4 +142,33 @@ TEST(Wire, ConfirmedUrlSetKeepsWhatWentInThroughGrowth)
     set.Clear();
     EXPECT_EQ(set.Size(), 0u);
     EXPECT_FALSE(set.Contains(0x9E3779B97F4A7C15ull));
+}
+
+// A local object's listing says which members a library may subscribe to by
+// the URL it builds from the listing, without a lookup of each URL: the
+// plainly named ones, an implicit one and one with a description.
+TEST(Wire, AListingNamesTheMembersItsUrlsReach)
+{
+    Network network(L"HOST");
+    auto machine = std::make_unique<Machine>();
+    machine->name = L"HOST";
+    machine->processes.push_back(std::make_unique<Process>());
+    machine->processes.back()->name = L"p";
+    network.Machines().push_back(std::move(machine));
+    const std::wstring objectUrl = L"\\\\.\\p\\o";
+    for (const wchar_t *name : {L"num", L"(implicit)", L"dash-With a description"}) {
+        auto member = std::make_shared<Member>();
+        member->name = name;
+        std::wstring text = name;
+        member->idPart = text == L"(implicit)" ? L"" : text.substr(0, text.find(L'-'));
+        std::wstring error;
+        ASSERT_TRUE(network.AddMember(objectUrl, member, error)) << error;
+    }
+    std::vector<BrowseEntry> entries;
+    ASSERT_TRUE(network.List(objectUrl, entries));
+    ASSERT_EQ(entries.size(), 3u);
+    for (const BrowseEntry &e : entries) {
+        EXPECT_TRUE(e.named) << e.name;
+        EXPECT_TRUE(network.FindMember(wire::MemberUrl(objectUrl, e.name))) << e.name;
+    }
 }
