@@ -1,6 +1,7 @@
 #pragma once
 // Helpers for tests that create server objects in this process through the
 // server's own class object.
+#include "CadroSim.h"
 #include "ClassFactory.h"
 #include "ComPtr.h"
 #include "GroupState.h"
@@ -10,6 +11,15 @@
 #include <gtest/gtest.h>
 
 #include <string>
+
+// Puts this process's network back as described: tests write to its
+// members, and a filter or a shuffle runs them in any order.
+inline void ResetNetwork()
+{
+    BSTR answer = nullptr;
+    CadroSim_Execute(L"reset", &answer);
+    SysFreeString(answer);
+}
 
 inline ComPtr<IOPCServer> CreateInProcServer()
 {

@@ -21,6 +21,7 @@ class AsyncTest : public testing::Test {
 protected:
     void SetUp() override
     {
+        ResetNetwork(); // the described values, whatever ran before
         server = CreateInProcServer();
         ASSERT_EQ(server->AddGroup(L"async", TRUE, 50, 777, nullptr, nullptr, 0, &hGroup, &rate, IID_IOPCItemMgt,
                                    reinterpret_cast<IUnknown **>(items.Out())),

@@ -127,6 +127,7 @@ TEST(Streams, DataAndWriteCompleteMatchTheirLayouts)
 
 TEST(DataObject, AdviseReadWriteAndSubscriptionStreams)
 {
+    ResetNetwork(); // the described values, whatever ran before
     V1Group g;
     ASSERT_NO_FATAL_FAILURE(
         MakeV1Group(L"v1", 66, {L"\\\\.\\proc1\\Setpoints.temperature", L"\\\\.\\proc1\\Counters.fast"}, g));

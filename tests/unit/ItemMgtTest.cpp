@@ -28,6 +28,7 @@ class ItemMgtTest : public testing::Test {
 protected:
     void SetUp() override
     {
+        ResetNetwork(); // the described values, whatever ran before
         server = CreateInProcServer();
         auto g = AddGroup(server.Get(), L"items", 100, TRUE);
         ASSERT_EQ(g.hr, S_OK);
