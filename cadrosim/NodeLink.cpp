@@ -131,8 +131,7 @@ RemoteSubscription::~RemoteSubscription()
 
 HRESULT RemoteSubscription::Recall(uint32_t *flags, CadroValue *value, int32_t *errorFlag, FILETIME *time) const
 {
-    return feed ? feed->mirror.Recall(flags, value, errorFlag, time)
-                : MemberMirror().Recall(flags, value, errorFlag, time);
+    return feed->mirror.Recall(flags, value, errorFlag, time);
 }
 
 void RemoteSubscription::Delete()
@@ -421,6 +420,11 @@ template <class Call, class Note> void NodeLink::CallSubscription(uint32_t id, C
         note(*sub);
         sub->Pin();
     }
+    CallPinned(sub, call);
+}
+
+template <class Call> void NodeLink::CallPinned(RemoteSubscription *sub, Call call)
+{
     sub->Deliver(call, m_callWaiters, m_lock, m_callReturned);
     sub->Unpin();
 }
@@ -443,10 +447,8 @@ template <class Call, class Note> void NodeLink::CallFeed(uint32_t feedId, Call 
             members.push_back(sub);
         });
     }
-    for (RemoteSubscription *sub : members) {
-        sub->Deliver(call, m_callWaiters, m_lock, m_callReturned);
-        sub->Unpin();
-    }
+    for (RemoteSubscription *sub : members)
+        CallPinned(sub, call);
 }
 
 LinkFeed *NodeLink::FeedOf(uint32_t feedId) const
@@ -461,7 +463,7 @@ void NodeLink::Join(uint32_t id, uint32_t feedId)
 {
     RemoteSubscription *sub = Lookup(id);
     uint32_t slot = (feedId & wire::kFeedSlotMask) - 1;
-    if (!sub || !sub->feed || slot == UINT32_MAX || slot >= wire::kFeedSlotMask || sub->feed->id == feedId)
+    if (!sub || slot == UINT32_MAX || slot >= wire::kFeedSlotMask || sub->feed->id == feedId)
         return;
     if (slot >= m_feeds.size())
         m_feeds.resize(slot + 1, nullptr);

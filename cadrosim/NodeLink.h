@@ -59,13 +59,14 @@ public:
     // Under the link's lock: the member as the node last sent it (its
     // feed's).
     HRESULT Recall(uint32_t *flags, CadroValue *value, int32_t *errorFlag, FILETIME *time) const;
-    bool Connected() const { return !feed || feed->mirror.Connected(); }
+    bool Connected() const { return feed->mirror.Connected(); }
 
     ICadroRealTimeReceiver *receiver;
     void *cookie;
     uint32_t id = 0;
-    // Under the link's lock: its feed (null only once it is forgotten) and
-    // its place there (0: the first, i + 1: others[i]).
+    // Under the link's lock: its feed and its place there (0: the first,
+    // i + 1: others[i]). A subscription in the table always has a feed (it
+    // gets its own with its id, and leaves the last one as it is forgotten).
     uint32_t place = 0;
     LinkFeed *feed = nullptr;
 
@@ -210,6 +211,8 @@ private:
     }
     // The same for every member of a feed; note(feed) first.
     template <class Call, class Note> void CallFeed(uint32_t feedId, Call call, Note note);
+    // Calls a subscription pinned under the lock, then unpins it.
+    template <class Call> void CallPinned(RemoteSubscription *sub, Call call);
     void TopologyChanged();
     // Whether the node is connected, waiting for one being connected to (a
     // node being started) unless it is another machine's and no answer is

@@ -47,7 +47,7 @@ private:
 // only a holder that finds it held sleeps on the word (WaitOnAddress), and
 // only a release that knows of sleepers wakes one. An SRW lock would do, but
 // under Wine its release calls into the keyed waiters' table every time, and
-// the items take a million updates a second each under their lock. Not
+// a plant's items take a million updates a second under their locks. Not
 // recursive, and not a CSyncObject: a table of virtual functions would add
 // a pointer to every item. It spins a while before it sleeps, for the same
 // reason as the critical section above.
