@@ -344,6 +344,7 @@ std::wstring Engine::Status()
     }
     out << L"subscriptions " << m_subscriptionCount.load() << L"\n";
     out << L"browses " << m_browseCount.load() << L"\n";
+    out << L"reads " << m_readCount.load() << L"\n";
     return out.str();
 }
 

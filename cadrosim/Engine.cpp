@@ -360,6 +360,7 @@ HRESULT Engine::Read(Subscription *sub, uint32_t *flags, CadroValue *value, int3
 {
     if (!flags || !value || !errorFlag || !time)
         return E_POINTER;
+    m_readCount.fetch_add(1, std::memory_order_relaxed);
     *flags = 0;
     *errorFlag = 0;
     *time = {};

@@ -225,6 +225,7 @@ private:
     std::mt19937 m_random;
     std::atomic<long> m_subscriptionCount{0};
     std::atomic<unsigned long> m_browseCount{0};
+    std::atomic<unsigned long> m_readCount{0}; // reads this engine answered (status)
     SlimMutex m_shutdownLock;
     std::function<void()> m_shutdown;
 };

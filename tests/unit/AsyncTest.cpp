@@ -17,6 +17,17 @@ const wchar_t kTemperature[] = L"\\\\.\\proc1\\Setpoints.temperature"; // consta
 const wchar_t kCommand[] = L"\\\\.\\proc1\\Setpoints.command";         // write-only
 const wchar_t kNever[] = L"\\\\.\\proc1\\Setpoints.never";             // never delivers
 
+// The reads the network has answered so far (its status).
+unsigned long ReadsSoFar()
+{
+    BSTR answer = nullptr;
+    CadroSim_Execute(L"status", &answer);
+    std::wstring status = answer ? answer : L"";
+    SysFreeString(answer);
+    size_t at = status.find(L"\nreads ");
+    return at == std::wstring::npos ? 0 : wcstoul(status.c_str() + at + 7, nullptr, 10);
+}
+
 class AsyncTest : public testing::Test {
 protected:
     void SetUp() override
@@ -185,11 +196,15 @@ TEST_F(AsyncTest, CancelDropsQueuedTransactionsWithoutCallbacks)
     DWORD slowId = 0, queuedId = 0;
     HRESULT *errors = nullptr;
     // The worker spends about 3 s waiting for the member that never delivers.
+    unsigned long readsBefore = ReadsSoFar();
     ASSERT_EQ(async->Read(1, &h[0], 50, &slowId, &errors), S_OK);
     CoTaskMemFree(errors);
-    // The worker must have taken the slow read before the next one comes
-    // (on a loaded machine it may wake late and take both at once).
-    Sleep(500);
+    // The worker must have taken the slow read before the next one comes (a
+    // worker that woke late would take both at once): it has once it has
+    // asked the network.
+    for (int i = 0; i < 1000 && ReadsSoFar() == readsBefore; ++i)
+        Sleep(10);
+    ASSERT_NE(ReadsSoFar(), readsBefore) << "the worker never read the slow item";
     ASSERT_EQ(async->Read(1, &h[1], 51, &queuedId, &errors), S_OK);
     CoTaskMemFree(errors);
     EXPECT_EQ(async->Cancel2(queuedId), S_OK);
