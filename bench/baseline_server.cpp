@@ -1,14 +1,22 @@
-// The baseline for the delivery benchmark: a minimal COM server that does
-// nothing but send precomputed OnDataChange calls of N items, every 10 ms or
-// back to back when a call takes longer, to the one sink advised on it.
+// The baseline of the benchmarks: a minimal COM server whose answers cost
+// nothing but the COM transport and their task memory, so that a benchmark
+// can set what our server takes beside what any server must take on this
+// machine at this moment.
+// - IConnectionPoint: sends precomputed OnDataChange calls of N items,
+//   every 10 ms or back to back when a call takes longer, to the one sink
+//   advised on it.
+// - IOPCItemMgt (AddItems, ValidateItems) and IOPCSyncIO (Read): answer
+//   every item at once without looking anything up (a double, readable and
+//   writable, good quality).
 //
-// Usage: baseline_server N CLIENT_PID. It writes its IConnectionPoint,
+// Usage: baseline_server N CLIENT_PID. It writes its object's IUnknown,
 // marshalled for another process on this machine, as one line of hex on
 // stdout, and exits once the client has released it or has ended.
 #include "ComObject.h"
 #include "ComPtr.h"
 #include "Handle.h"
 #include "OpcErrors.h"
+#include "TaskMem.h"
 #include "opcda.h"
 
 #include <atomic>
@@ -22,7 +30,7 @@
 namespace {
 const DWORD kRateMs = 10;
 
-class BaselineSource : public CComObjectRoot, public IConnectionPoint {
+class BaselineSource : public CComObjectRoot, public IConnectionPoint, public IOPCItemMgt, public IOPCSyncIO {
 public:
     BaselineSource(DWORD items, HANDLE released)
         : m_released(released), m_handles(items), m_values(items), m_qualities(items, OPC_QUALITY_GOOD), m_times(items),
@@ -71,10 +79,79 @@ public:
     }
     STDMETHODIMP EnumConnections(IEnumConnections **) override { return E_NOTIMPL; }
 
+    // IOPCItemMgt: what AddItems and ValidateItems must send back at the least.
+    STDMETHODIMP AddItems(DWORD count, OPCITEMDEF *items, OPCITEMRESULT **results, HRESULT **errors) override
+    {
+        return ItemResults(count, items, results, errors);
+    }
+    STDMETHODIMP ValidateItems(DWORD count, OPCITEMDEF *items, BOOL, OPCITEMRESULT **results, HRESULT **errors) override
+    {
+        return ItemResults(count, items, results, errors);
+    }
+    STDMETHODIMP RemoveItems(DWORD, OPCHANDLE *, HRESULT **) override { return E_NOTIMPL; }
+    STDMETHODIMP SetActiveState(DWORD, OPCHANDLE *, BOOL, HRESULT **) override { return E_NOTIMPL; }
+    STDMETHODIMP SetClientHandles(DWORD, OPCHANDLE *, OPCHANDLE *, HRESULT **) override { return E_NOTIMPL; }
+    STDMETHODIMP SetDatatypes(DWORD, OPCHANDLE *, VARTYPE *, HRESULT **) override { return E_NOTIMPL; }
+    STDMETHODIMP CreateEnumerator(REFIID, IUnknown **) override { return E_NOTIMPL; }
+
+    // IOPCSyncIO: the values of a cache read.
+    STDMETHODIMP Read(OPCDATASOURCE, DWORD count, OPCHANDLE *handles, OPCITEMSTATE **states, HRESULT **errors) override
+    {
+        if (!states || !errors)
+            return E_POINTER;
+        *states = nullptr;
+        *errors = nullptr;
+        if (count == 0 || !handles)
+            return E_INVALIDARG;
+        TaskMem<OPCITEMSTATE> out;
+        TaskMem<HRESULT> codes;
+        if (!out.Allocate(count) || !codes.Allocate(count))
+            return E_OUTOFMEMORY;
+        for (DWORD i = 0; i < count; ++i) {
+            out[i].hClient = handles[i];
+            out[i].ftTimeStamp = m_times[0];
+            out[i].wQuality = OPC_QUALITY_GOOD;
+            V_VT(&out[i].vDataValue) = VT_R8;
+            V_R8(&out[i].vDataValue) = i;
+        }
+        *states = out.Detach();
+        *errors = codes.Detach();
+        return S_OK;
+    }
+    STDMETHODIMP Write(DWORD, OPCHANDLE *, VARIANT *, HRESULT **) override { return E_NOTIMPL; }
+
 private:
     void *FindInterface(REFIID riid) override
     {
-        return IsEqualIID(riid, IID_IConnectionPoint) ? static_cast<IConnectionPoint *>(this) : nullptr;
+        if (IsEqualIID(riid, IID_IConnectionPoint))
+            return static_cast<IConnectionPoint *>(this);
+        if (IsEqualIID(riid, IID_IOPCItemMgt))
+            return static_cast<IOPCItemMgt *>(this);
+        if (IsEqualIID(riid, IID_IOPCSyncIO))
+            return static_cast<IOPCSyncIO *>(this);
+        return nullptr;
+    }
+
+    static HRESULT ItemResults(DWORD count, const OPCITEMDEF *items, OPCITEMRESULT **results, HRESULT **errors)
+    {
+        if (!results || !errors)
+            return E_POINTER;
+        *results = nullptr;
+        *errors = nullptr;
+        if (count == 0 || !items)
+            return E_INVALIDARG;
+        TaskMem<OPCITEMRESULT> out;
+        TaskMem<HRESULT> codes;
+        if (!out.Allocate(count) || !codes.Allocate(count))
+            return E_OUTOFMEMORY;
+        for (DWORD i = 0; i < count; ++i) {
+            out[i].hServer = i + 1;
+            out[i].vtCanonicalDataType = VT_R8;
+            out[i].dwAccessRights = OPC_READABLE | OPC_WRITEABLE;
+        }
+        *results = out.Detach();
+        *errors = codes.Detach();
+        return S_OK;
     }
     void FinalRelease() override
     {
@@ -120,7 +197,7 @@ bool WriteMarshalled(IUnknown *object)
 {
     ComPtr<IStream> stream;
     if (FAILED(CreateStreamOnHGlobal(nullptr, TRUE, stream.Out())) ||
-        FAILED(CoMarshalInterface(stream.Get(), IID_IConnectionPoint, object, MSHCTX_LOCAL, nullptr, MSHLFLAGS_NORMAL)))
+        FAILED(CoMarshalInterface(stream.Get(), IID_IUnknown, object, MSHCTX_LOCAL, nullptr, MSHLFLAGS_NORMAL)))
         return false;
     HGLOBAL memory = nullptr;
     GetHGlobalFromStream(stream.Get(), &memory);
@@ -146,8 +223,8 @@ int main(int argc, char **argv)
     UniqueHandle released(CreateEventW(nullptr, TRUE, FALSE, nullptr));
     int status = 1;
     {
-        ComPtr<IConnectionPoint> source;
-        CreateComObject(NewComObject<BaselineSource>(items, released.Get()), IID_IConnectionPoint,
+        ComPtr<IUnknown> source;
+        CreateComObject(NewComObject<BaselineSource>(items, released.Get()), IID_IUnknown,
                         reinterpret_cast<void **>(source.Out()));
         if (source && WriteMarshalled(source.Get()))
             status = 0;

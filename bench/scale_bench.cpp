@@ -13,7 +13,11 @@
 //   ValidateItems of the same identifiers), and the time of the RemoveGroup
 //   of such a group.
 // - the network node's memory per subscription (the same items).
+// Beside each time it prints the floor: the same call, in turns with ours,
+// answered by baseline_server, which looks nothing up and sends the least a
+// server must send; what is left above it is our server's and its network's.
 // No other server process may run meanwhile.
+#include "BaselineProcess.h"
 #include "CadroSim.h"
 #include "ComPtr.h"
 #include "Handle.h"
@@ -23,6 +27,7 @@
 #include <psapi.h>
 #include <tlhelp32.h>
 
+#include <algorithm>
 #include <chrono>
 #include <cstdio>
 #include <string>
@@ -122,6 +127,71 @@ double WorkingSetKB(HANDLE process)
     return counters.WorkingSetSize / 1024.0;
 }
 
+// AddItems of every id in one call: its time in ms, -1 when it failed; the
+// server handles go to handles when given.
+double AddAll(IOPCItemMgt *items, const std::vector<std::wstring> &ids, std::vector<OPCHANDLE> *handles = nullptr)
+{
+    std::vector<OPCITEMDEF> defs = ActiveDefinitions(ids);
+    OPCITEMRESULT *results = nullptr;
+    HRESULT *errors = nullptr;
+    auto start = Clock::now();
+    HRESULT hr = items->AddItems(static_cast<DWORD>(defs.size()), defs.data(), &results, &errors);
+    double ms = Ms(start);
+    if (hr != S_OK) {
+        printf("  AddItems failed: 0x%08lX\n", static_cast<unsigned long>(hr));
+        ms = -1;
+    }
+    for (size_t i = 0; handles && results && i < defs.size(); ++i)
+        handles->push_back(results[i].hServer);
+    CoTaskMemFree(results);
+    CoTaskMemFree(errors);
+    return ms;
+}
+
+// ValidateItems of every id in one call: its time in ms.
+double ValidateAll(IOPCItemMgt *items, const std::vector<std::wstring> &ids, HRESULT *hr = nullptr)
+{
+    std::vector<OPCITEMDEF> defs = ActiveDefinitions(ids);
+    OPCITEMRESULT *results = nullptr;
+    HRESULT *errors = nullptr;
+    auto start = Clock::now();
+    HRESULT result = items->ValidateItems(static_cast<DWORD>(defs.size()), defs.data(), FALSE, &results, &errors);
+    double ms = Ms(start);
+    if (hr)
+        *hr = result;
+    CoTaskMemFree(results);
+    CoTaskMemFree(errors);
+    return ms;
+}
+
+// A cache read of handles: its time in ms.
+double ReadAll(IOPCSyncIO *io, std::vector<OPCHANDLE> &handles, HRESULT *hr = nullptr)
+{
+    const DWORD n = static_cast<DWORD>(handles.size());
+    OPCITEMSTATE *states = nullptr;
+    HRESULT *errors = nullptr;
+    auto start = Clock::now();
+    HRESULT result = io->Read(OPC_DS_CACHE, n, handles.data(), &states, &errors);
+    double ms = Ms(start);
+    if (hr)
+        *hr = result;
+    for (DWORD i = 0; states && i < n; ++i)
+        VariantClear(&states[i].vDataValue);
+    CoTaskMemFree(states);
+    CoTaskMemFree(errors);
+    return ms;
+}
+
+// The baseline server's item management and reads, the floor of each
+// figure. The interfaces go before the process (members end in reverse
+// order), which waits for the baseline to end once released.
+struct Floor {
+    BaselineProcess process{1};
+    ComPtr<IOPCItemMgt> items = process.Query<IOPCItemMgt>(IID_IOPCItemMgt);
+    ComPtr<IOPCSyncIO> io = process.Query<IOPCSyncIO>(IID_IOPCSyncIO);
+    bool Ready() const { return items && io; }
+};
+
 // A group of the server with the definitions of ids, all active.
 class Group {
 public:
@@ -148,35 +218,8 @@ public:
     IOPCItemMgt *Items() const { return m_items.Get(); }
     const std::vector<OPCHANDLE> &Handles() const { return m_handles; }
 
-    // AddItems of every id in one call: its time in ms, -1 when it failed.
-    double Add(const std::vector<std::wstring> &ids)
-    {
-        std::vector<OPCITEMDEF> defs = ActiveDefinitions(ids);
-        OPCITEMRESULT *results = nullptr;
-        HRESULT *errors = nullptr;
-        auto start = Clock::now();
-        HRESULT hr = m_items->AddItems(static_cast<DWORD>(defs.size()), defs.data(), &results, &errors);
-        double ms = Ms(start);
-        if (hr != S_OK) {
-            printf("  AddItems failed: 0x%08lX\n", static_cast<unsigned long>(hr));
-            ms = -1;
-        }
-        for (size_t i = 0; results && i < defs.size(); ++i)
-            m_handles.push_back(results[i].hServer);
-        CoTaskMemFree(results);
-        CoTaskMemFree(errors);
-        return ms;
-    }
-
-    void Validate(const std::vector<std::wstring> &ids)
-    {
-        std::vector<OPCITEMDEF> defs = ActiveDefinitions(ids);
-        OPCITEMRESULT *results = nullptr;
-        HRESULT *errors = nullptr;
-        m_items->ValidateItems(static_cast<DWORD>(defs.size()), defs.data(), FALSE, &results, &errors);
-        CoTaskMemFree(results);
-        CoTaskMemFree(errors);
-    }
+    double Add(const std::vector<std::wstring> &ids) { return AddAll(m_items.Get(), ids, &m_handles); }
+    void Validate(const std::vector<std::wstring> &ids) { ValidateAll(m_items.Get(), ids); }
 
 private:
     IOPCServer *m_server;
@@ -194,30 +237,32 @@ std::vector<std::wstring> Ids(DWORD n, bool spread)
     return ids;
 }
 
-void AddItemsFigures(IOPCServer *server)
+void AddItemsFigures(IOPCServer *server, const Floor &floor)
 {
     // The first call of each layout reads its nodes for the first time;
     // later ones merge what the network gives into nodes that exist (a
     // client that adds its items again after a restart of its own). The
     // best of three is the machine's noise taken out.
     const int runs = 3;
-    printf("AddItems of N distinct items, one call, through COM (first call, best of %d):\n", runs);
+    printf("AddItems of N distinct items, one call, through COM (first call, best of %d; the floor's best):\n", runs);
     double perItemAt1000[2] = {0, 0};
     for (DWORD n : kCounts) {
         for (int spread = 0; spread < 2; ++spread) {
             std::vector<std::wstring> ids = Ids(n, spread != 0);
-            double first = 0, best = 1e12;
+            double first = 0, best = 1e12, floorBest = 1e12;
             for (int run = 0; run < runs; ++run) {
                 Group group(server, L"scale");
                 double ms = group.Add(ids);
                 first = run == 0 ? ms : first;
                 best = ms < best ? ms : best;
+                floorBest = std::min(floorBest, AddAll(floor.items.Get(), ids));
             }
             double perItem = best * 1000.0 / n;
             if (n == 1000)
                 perItemAt1000[spread] = perItem;
-            printf("  N=%-7lu %-26s %8.1f ms %8.1f ms  %6.2f us per item", static_cast<unsigned long>(n),
-                   spread ? "spread over 100 objects" : "one object of N members", first, best, perItem);
+            printf("  N=%-7lu %-26s %8.1f ms %8.1f ms  %6.2f us per item  floor %7.1f ms",
+                   static_cast<unsigned long>(n), spread ? "spread over 100 objects" : "one object of N members", first,
+                   best, perItem, floorBest);
             if (n != 1000 && perItemAt1000[spread] > 0)
                 printf("  (%.2f x the time per item at 1,000)", perItem / perItemAt1000[spread]);
             printf("\n");
@@ -225,21 +270,18 @@ void AddItemsFigures(IOPCServer *server)
     }
 }
 
-void ValidateFigure(IOPCServer *server)
+void ValidateFigure(IOPCServer *server, const Floor &floor)
 {
     Group group(server, L"validate");
     std::vector<std::wstring> ids = Ids(10000, true);
-    std::vector<OPCITEMDEF> defs = ActiveDefinitions(ids);
-    OPCITEMRESULT *results = nullptr;
-    HRESULT *errors = nullptr;
-    auto start = Clock::now();
-    HRESULT hr = group.Items()->ValidateItems(10000, defs.data(), FALSE, &results, &errors);
-    printf("ValidateItems of 10,000 items: %.1f ms (0x%08lX)\n", Ms(start), static_cast<unsigned long>(hr));
-    CoTaskMemFree(results);
-    CoTaskMemFree(errors);
+    HRESULT hr = S_OK;
+    double ms = ValidateAll(group.Items(), ids, &hr);
+    double floorMs = ValidateAll(floor.items.Get(), ids);
+    printf("ValidateItems of 10,000 items: %.1f ms (0x%08lX), floor %.1f ms\n", ms, static_cast<unsigned long>(hr),
+           floorMs);
 }
 
-void ReadFigures(IOPCServer *server)
+void ReadFigures(IOPCServer *server, const Floor &floor)
 {
     Group group(server, L"read");
     group.Add(Ids(10000, true));
@@ -247,26 +289,19 @@ void ReadFigures(IOPCServer *server)
     group.Items()->QueryInterface(IID_IOPCSyncIO, reinterpret_cast<void **>(io.Out()));
     for (DWORD n : {1000ul, 10000ul}) {
         std::vector<OPCHANDLE> handles(group.Handles().begin(), group.Handles().begin() + n);
-        double best = 1e9, total = 0;
+        double best = 1e9, total = 0, floorBest = 1e9;
         const int runs = 20;
         HRESULT hr = S_OK;
         for (int run = 0; run <= runs; ++run) {
-            OPCITEMSTATE *states = nullptr;
-            HRESULT *errors = nullptr;
-            auto start = Clock::now();
-            hr = io->Read(OPC_DS_CACHE, n, handles.data(), &states, &errors);
-            double ms = Ms(start);
+            double ms = ReadAll(io.Get(), handles, &hr);
             if (run > 0) { // the first read may wait for first values
                 best = ms < best ? ms : best;
                 total += ms;
             }
-            for (DWORD i = 0; states && i < n; ++i)
-                VariantClear(&states[i].vDataValue);
-            CoTaskMemFree(states);
-            CoTaskMemFree(errors);
+            floorBest = std::min(floorBest, ReadAll(floor.io.Get(), handles));
         }
-        printf("cache Read of %lu items: best %.2f ms, mean %.2f ms (0x%08lX)\n", n, best, total / runs,
-               static_cast<unsigned long>(hr));
+        printf("cache Read of %lu items: best %.2f ms, mean %.2f ms (0x%08lX), floor %.2f ms\n", n, best, total / runs,
+               static_cast<unsigned long>(hr), floorBest);
     }
 }
 
@@ -338,9 +373,14 @@ int main()
                    static_cast<unsigned long>(hr));
         } else {
             MemoryFigures(server.Get());
-            AddItemsFigures(server.Get());
-            ValidateFigure(server.Get());
-            ReadFigures(server.Get());
+            Floor floor;
+            if (!floor.Ready()) {
+                printf("the baseline server did not start\n");
+            } else {
+                AddItemsFigures(server.Get(), floor);
+                ValidateFigure(server.Get(), floor);
+                ReadFigures(server.Get(), floor);
+            }
         }
     }
     CoUninitialize();

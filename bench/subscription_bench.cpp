@@ -10,6 +10,7 @@
 //        subscription_bench -i         only the in-process figures
 //        subscription_bench N [N ...]  only the comparison through COM, for
 //                                      these item counts in turn
+#include "BaselineProcess.h"
 #include "CadroSim.h"
 #include "ClassFactory.h"
 #include "ComPtr.h"
@@ -171,78 +172,22 @@ Delivery InProcess(IOPCServer *server, DWORD n)
 // it (see baseline_server.cpp).
 class BaselineServer {
 public:
-    explicit BaselineServer(DWORD n) : m_sink(CountingSink::Create())
+    explicit BaselineServer(DWORD n)
+        : m_process(n), m_point(m_process.Query<IConnectionPoint>(IID_IConnectionPoint)), m_sink(CountingSink::Create())
     {
-        wchar_t exe[MAX_PATH];
-        GetModuleFileNameW(nullptr, exe, MAX_PATH);
-        std::wstring path(exe);
-        path = path.substr(0, path.find_last_of(L"\\/") + 1) + L"baseline_server.exe";
-        std::wstring command =
-            L"\"" + path + L"\" " + std::to_wstring(n) + L" " + std::to_wstring(GetCurrentProcessId());
-
-        SECURITY_ATTRIBUTES inherit = {sizeof(inherit), nullptr, TRUE};
-        HANDLE readEnd = nullptr, writeEnd = nullptr;
-        if (!CreatePipe(&readEnd, &writeEnd, &inherit, 0))
-            return;
-        UniqueHandle reader(readEnd), writer(writeEnd);
-        SetHandleInformation(readEnd, HANDLE_FLAG_INHERIT, 0);
-        STARTUPINFOW si = {};
-        si.cb = sizeof(si);
-        si.dwFlags = STARTF_USESTDHANDLES;
-        si.hStdOutput = writeEnd;
-        si.hStdError = GetStdHandle(STD_ERROR_HANDLE);
-        PROCESS_INFORMATION pi = {};
-        if (!CreateProcessW(nullptr, &command[0], nullptr, nullptr, TRUE, 0, nullptr, nullptr, &si, &pi))
-            return;
-        m_process.Reset(pi.hProcess);
-        UniqueHandle thread(pi.hThread);
-        writer.Reset();
-        Unmarshal(ReadLine(reader.Get()));
     }
-    ~BaselineServer()
-    {
-        m_point.Reset(); // the baseline ends once it is released
-        if (m_process)
-            WaitForSingleObject(m_process.Get(), 10000);
-    }
+    ~BaselineServer() { m_point.Reset(); } // before the process waits for its end
     BaselineServer(const BaselineServer &) = delete;
     BaselineServer &operator=(const BaselineServer &) = delete;
 
     bool Ready() const { return m_point.Get() != nullptr; }
     void Start() { m_point->Advise(static_cast<IOPCDataCallback *>(m_sink.Get()), &m_cookie); }
     void Stop() { m_point->Unadvise(m_cookie); }
-    HANDLE Process() const { return m_process.Get(); }
+    HANDLE Process() const { return m_process.Process(); }
     CountingSink *Sink() { return m_sink.Get(); }
 
 private:
-    static std::string ReadLine(HANDLE pipe)
-    {
-        std::string line;
-        char c;
-        DWORD got;
-        while (ReadFile(pipe, &c, 1, &got, nullptr) && got == 1 && c != '\n')
-            line += c;
-        return line;
-    }
-    // The connection point, marshalled by the baseline as hex.
-    void Unmarshal(const std::string &hex)
-    {
-        HGLOBAL memory = GlobalAlloc(GMEM_MOVEABLE, hex.size() / 2 + 1);
-        if (!memory)
-            return;
-        auto *bytes = static_cast<unsigned char *>(GlobalLock(memory));
-        for (size_t i = 0; i + 1 < hex.size(); i += 2)
-            bytes[i / 2] = static_cast<unsigned char>(std::stoul(hex.substr(i, 2), nullptr, 16));
-        GlobalUnlock(memory);
-        ComPtr<IStream> stream;
-        if (FAILED(CreateStreamOnHGlobal(memory, TRUE, stream.Out()))) {
-            GlobalFree(memory);
-            return;
-        }
-        CoUnmarshalInterface(stream.Get(), IID_IConnectionPoint, reinterpret_cast<void **>(m_point.Out()));
-    }
-
-    UniqueHandle m_process;
+    BaselineProcess m_process;
     ComPtr<IConnectionPoint> m_point;
     ComPtr<CountingSink> m_sink;
     DWORD m_cookie = 0;
