@@ -503,7 +503,12 @@ bool NodeLink::MakeRoom(LinkFeed &feed)
     try {
         if (!feed.others)
             feed.others = std::make_unique<std::vector<RemoteSubscription *>>();
-        feed.others->reserve(feed.others->size() + 1);
+        // Doubled when full: room for just one more each time would copy the
+        // whole array at every join, and thousands of items may follow one
+        // member.
+        std::vector<RemoteSubscription *> &others = *feed.others;
+        if (others.size() == others.capacity())
+            others.reserve(std::max<size_t>(4, others.capacity() * 2));
     } catch (const std::bad_alloc &) {
         return false;
     }

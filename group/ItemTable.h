@@ -8,6 +8,7 @@
 // stays linear.
 #include "OPCItem.h"
 
+#include <algorithm>
 #include <memory>
 #include <vector>
 
@@ -25,8 +26,15 @@ public:
     bool Erase(OPCHANDLE handle);
     // Deletes every item.
     void Clear();
-    // Room for more items, so that inserting them cannot fail half-way.
-    void Reserve(size_t more) { m_entries.reserve(m_entries.size() + more); }
+    // Room for more items, so that inserting them cannot fail half-way. The
+    // table at least doubles when it grows: a client that adds its items one
+    // per call would otherwise have it copied whole at every call.
+    void Reserve(size_t more)
+    {
+        size_t needed = m_entries.size() + more;
+        if (needed > m_entries.capacity())
+            m_entries.reserve(std::max(needed, m_entries.capacity() * 2));
+    }
     size_t size() const { return m_entries.size() - m_holes; }
     bool empty() const { return size() == 0; }
 
