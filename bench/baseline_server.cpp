@@ -1,6 +1,6 @@
 // The baseline of the benchmarks: a minimal COM server whose answers cost
 // nothing but the COM transport and their task memory, so that a benchmark
-// can set what our server takes beside what any server must take on this
+// can put what our server takes beside what any server must take on this
 // machine at this moment.
 // - IConnectionPoint: sends precomputed OnDataChange calls of N items,
 //   every 10 ms or back to back when a call takes longer, to the one sink
