@@ -97,26 +97,14 @@ public:
     // IOPCSyncIO: the values of a cache read.
     STDMETHODIMP Read(OPCDATASOURCE, DWORD count, OPCHANDLE *handles, OPCITEMSTATE **states, HRESULT **errors) override
     {
-        if (!states || !errors)
-            return E_POINTER;
-        *states = nullptr;
-        *errors = nullptr;
-        if (count == 0 || !handles)
-            return E_INVALIDARG;
-        TaskMem<OPCITEMSTATE> out;
-        TaskMem<HRESULT> codes;
-        if (!out.Allocate(count) || !codes.Allocate(count))
-            return E_OUTOFMEMORY;
-        for (DWORD i = 0; i < count; ++i) {
-            out[i].hClient = handles[i];
-            out[i].ftTimeStamp = m_times[0];
-            out[i].wQuality = OPC_QUALITY_GOOD;
-            V_VT(&out[i].vDataValue) = VT_R8;
-            V_R8(&out[i].vDataValue) = i;
-        }
-        *states = out.Detach();
-        *errors = codes.Detach();
-        return S_OK;
+        FILETIME time = m_times[0];
+        return Answer(count, handles, states, errors, [&](DWORD i, OPCITEMSTATE &state) {
+            state.hClient = handles[i];
+            state.ftTimeStamp = time;
+            state.wQuality = OPC_QUALITY_GOOD;
+            V_VT(&state.vDataValue) = VT_R8;
+            V_R8(&state.vDataValue) = i;
+        });
     }
     STDMETHODIMP Write(DWORD, OPCHANDLE *, VARIANT *, HRESULT **) override { return E_NOTIMPL; }
 
@@ -134,25 +122,35 @@ private:
 
     static HRESULT ItemResults(DWORD count, const OPCITEMDEF *items, OPCITEMRESULT **results, HRESULT **errors)
     {
-        if (!results || !errors)
+        return Answer(count, items, results, errors, [](DWORD i, OPCITEMRESULT &result) {
+            result.hServer = i + 1;
+            result.vtCanonicalDataType = VT_R8;
+            result.dwAccessRights = OPC_READABLE | OPC_WRITEABLE;
+        });
+    }
+
+    // Checks the arguments as a server must, then fills count records
+    // (fill(i, record)) and as many S_OK codes.
+    template <class Record, class Fill>
+    static HRESULT Answer(DWORD count, const void *input, Record **records, HRESULT **errors, Fill fill)
+    {
+        if (!records || !errors)
             return E_POINTER;
-        *results = nullptr;
+        *records = nullptr;
         *errors = nullptr;
-        if (count == 0 || !items)
+        if (count == 0 || !input)
             return E_INVALIDARG;
-        TaskMem<OPCITEMRESULT> out;
+        TaskMem<Record> out;
         TaskMem<HRESULT> codes;
         if (!out.Allocate(count) || !codes.Allocate(count))
             return E_OUTOFMEMORY;
-        for (DWORD i = 0; i < count; ++i) {
-            out[i].hServer = i + 1;
-            out[i].vtCanonicalDataType = VT_R8;
-            out[i].dwAccessRights = OPC_READABLE | OPC_WRITEABLE;
-        }
-        *results = out.Detach();
+        for (DWORD i = 0; i < count; ++i)
+            fill(i, out[i]);
+        *records = out.Detach();
         *errors = codes.Detach();
         return S_OK;
     }
+
     void FinalRelease() override
     {
         Stop();
