@@ -176,7 +176,6 @@ public:
         : m_process(n), m_point(m_process.Query<IConnectionPoint>(IID_IConnectionPoint)), m_sink(CountingSink::Create())
     {
     }
-    ~BaselineServer() { m_point.Reset(); } // before the process waits for its end
     BaselineServer(const BaselineServer &) = delete;
     BaselineServer &operator=(const BaselineServer &) = delete;
 
@@ -187,6 +186,8 @@ public:
     CountingSink *Sink() { return m_sink.Get(); }
 
 private:
+    // The process first: members end in reverse order, so the connection
+    // point is released before the process waits for the baseline's end.
     BaselineProcess m_process;
     ComPtr<IConnectionPoint> m_point;
     ComPtr<CountingSink> m_sink;
