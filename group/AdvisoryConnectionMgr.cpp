@@ -32,7 +32,7 @@ CConnectionData::~CConnectionData()
 
 HRESULT CAdvisoryConnectionMgr::Add(const FORMATETC &format, DWORD advf, IAdviseSink *sink, DWORD *id)
 {
-    auto record = std::make_unique<CConnectionData>(format, advf, sink);
+    auto record = std::make_shared<CConnectionData>(format, advf, sink);
     if (format.ptd && !record->format.ptd)
         return E_OUTOFMEMORY;
     CSingleLock lock(&m_lock);
@@ -43,7 +43,7 @@ HRESULT CAdvisoryConnectionMgr::Add(const FORMATETC &format, DWORD advf, IAdvise
 
 HRESULT CAdvisoryConnectionMgr::Remove(DWORD id)
 {
-    std::unique_ptr<CConnectionData> removed; // destroyed after the lock
+    std::shared_ptr<CConnectionData> removed; // destroyed after the lock
     CSingleLock lock(&m_lock);
     for (auto it = m_connections.begin(); it != m_connections.end(); ++it) {
         if ((*it)->id == id) {
@@ -57,7 +57,7 @@ HRESULT CAdvisoryConnectionMgr::Remove(DWORD id)
 
 void CAdvisoryConnectionMgr::RemoveAll()
 {
-    std::list<std::unique_ptr<CConnectionData>> removed;
+    std::list<std::shared_ptr<CConnectionData>> removed;
     CSingleLock lock(&m_lock);
     removed.swap(m_connections);
 }
@@ -77,22 +77,23 @@ size_t CAdvisoryConnectionMgr::Count()
     return m_connections.size();
 }
 
-HRESULT CAdvisoryConnectionMgr::SendTo(DWORD id, STGMEDIUM &medium)
-{
-    CSingleLock lock(&m_lock);
-    for (auto &c : m_connections) {
-        if (c->id == id) {
-            c->sink->OnDataChange(&c->format, &medium);
-            return S_OK;
-        }
-    }
-    return S_FALSE;
-}
-
-HRESULT CAdvisoryConnectionMgr::SendToAll(STGMEDIUM &medium)
+ConnectionList CAdvisoryConnectionMgr::Find(DWORD id)
 {
     CSingleLock lock(&m_lock);
     for (auto &c : m_connections)
+        if (c->id == id)
+            return {c};
+    return {};
+}
+
+ConnectionList CAdvisoryConnectionMgr::All()
+{
+    CSingleLock lock(&m_lock);
+    return ConnectionList(m_connections.begin(), m_connections.end());
+}
+
+void SendToConnections(const ConnectionList &connections, STGMEDIUM &medium)
+{
+    for (const auto &c : connections)
         c->sink->OnDataChange(&c->format, &medium);
-    return m_connections.empty() ? E_FAIL : S_OK;
 }

@@ -7,6 +7,7 @@
 
 #include <list>
 #include <memory>
+#include <vector>
 
 class CConnectionData {
 public:
@@ -24,6 +25,14 @@ public:
     IAdviseSink *sink;
 };
 
+// Connections taken out of a manager for one send: the sinks are called
+// with no lock held (a sink may call the group back from another thread),
+// and a connection removed meanwhile lives until the send is done.
+using ConnectionList = std::vector<std::shared_ptr<CConnectionData>>;
+
+// Calls OnDataChange of every connection, in order, with its own format.
+void SendToConnections(const ConnectionList &connections, STGMEDIUM &medium);
+
 class CAdvisoryConnectionMgr {
 public:
     virtual ~CAdvisoryConnectionMgr() = default;
@@ -33,12 +42,12 @@ public:
     void RemoveAll();
     bool Contains(DWORD id);
     size_t Count();
-    // The medium goes to one connection's sink (S_FALSE: no such
-    // connection), or to every sink (E_FAIL: none).
-    HRESULT SendTo(DWORD id, STGMEDIUM &medium);
-    HRESULT SendToAll(STGMEDIUM &medium);
+    // The connection with that id (empty when none), or every connection,
+    // newest first.
+    ConnectionList Find(DWORD id);
+    ConnectionList All();
 
 private:
     CCriticalSection m_lock;
-    std::list<std::unique_ptr<CConnectionData>> m_connections;
+    std::list<std::shared_ptr<CConnectionData>> m_connections;
 };

@@ -3,6 +3,8 @@
 #include "Trace.h"
 #include "Transaction.h"
 
+#include <iterator>
+
 CAsyncIOMgr::CAsyncIOMgr() : m_work(CreateEventW(nullptr, TRUE, FALSE, nullptr))
 {
     if (!m_work)
@@ -43,11 +45,11 @@ std::unique_ptr<CTransaction> CAsyncIOMgr::TakeNext()
     return t;
 }
 
-std::unique_ptr<CTransaction> CAsyncIOMgr::RemoveById(DWORD id)
+std::unique_ptr<CTransaction> CAsyncIOMgr::RemoveById(DWORD id, const COPCGroup *group)
 {
     CSingleLock lock(&m_lock);
     for (auto it = m_queue.begin(); it != m_queue.end(); ++it) {
-        if ((*it)->Id() == id) {
+        if ((*it)->Id() == id && (*it)->Group() == group) {
             std::unique_ptr<CTransaction> t = std::move(*it);
             m_queue.erase(it);
             if (m_queue.empty())
@@ -56,6 +58,22 @@ std::unique_ptr<CTransaction> CAsyncIOMgr::RemoveById(DWORD id)
         }
     }
     return nullptr;
+}
+
+void CAsyncIOMgr::RemoveAllOf(const COPCGroup *group)
+{
+    std::list<std::unique_ptr<CTransaction>> removed; // destroyed after the lock
+    {
+        CSingleLock lock(&m_lock);
+        for (auto it = m_queue.begin(); it != m_queue.end();) {
+            auto next = std::next(it);
+            if ((*it)->Group() == group)
+                removed.splice(removed.end(), m_queue, it);
+            it = next;
+        }
+        if (m_queue.empty())
+            ResetEvent(m_work.Get());
+    }
 }
 
 void CAsyncIOMgr::Run(HANDLE stopEvent)

@@ -8,6 +8,7 @@
 #include <list>
 #include <memory>
 
+class COPCGroup;
 class CTransaction;
 
 class CAsyncIOMgr {
@@ -23,9 +24,11 @@ public:
 
     void Enqueue(std::unique_ptr<CTransaction> transaction);
     std::unique_ptr<CTransaction> TakeNext();
-    // The queued transaction with that id, whatever its group; null when
-    // none is queued (never issued, or already taken by the worker).
-    std::unique_ptr<CTransaction> RemoveById(DWORD id);
+    // The queued transaction of group with that id; null when none is
+    // queued (never issued, another group's, or already taken by the worker).
+    std::unique_ptr<CTransaction> RemoveById(DWORD id, const COPCGroup *group);
+    // Destroys every queued transaction of group unexecuted (its removal).
+    void RemoveAllOf(const COPCGroup *group);
 
 private:
     using Singleton = CRefSingleton<CAsyncIOMgr>;

@@ -1,5 +1,6 @@
 #include "OPCGroup.h"
 
+#include "AsyncIOMgr.h"
 #include "ComPtr.h"
 #include "ComUtil.h"
 #include "Delivery.h"
@@ -78,94 +79,62 @@ std::wstring COPCGroup::Name()
     return m_name;
 }
 
-bool COPCGroup::Caller::operator==(const Caller &o) const
+COPCGroup::GroupCall::GroupCall(COPCGroup &group) : m_group(group), m_caller(LogicalCaller::Current())
 {
-    // Without a logical thread (COM refused it), the physical one decides.
-    if (IsEqualGUID(logicalThread, GUID_NULL) || IsEqualGUID(o.logicalThread, GUID_NULL))
-        return thread == o.thread;
-    return IsEqualGUID(logicalThread, o.logicalThread) != FALSE;
+    m_entered = m_group.m_activity.EnterCall(m_caller);
 }
 
-COPCGroup::Caller COPCGroup::Caller::Current()
+COPCGroup::GroupCall::~GroupCall()
 {
-    // A call that a client makes from inside a callback carries the
-    // callback's logical thread, also when it arrives on another thread.
-    Caller c{GUID_NULL, GetCurrentThreadId()};
-    if (FAILED(CoGetCurrentLogicalThreadId(&c.logicalThread)))
-        c.logicalThread = GUID_NULL;
-    return c;
+    if (m_entered)
+        m_group.m_activity.LeaveCall(m_caller);
 }
 
-LONG COPCGroup::CallbacksOf(const Caller &caller) const
+COPCGroup::CallbackInFlight::CallbackInFlight(COPCGroup &group)
+    : m_group(group), m_caller(LogicalCaller::Current()), m_kind(m_group.m_activity.BeginCallback(m_caller))
 {
-    return static_cast<LONG>(std::count(m_callbacks.begin(), m_callbacks.end(), caller));
+    CallbacksInFlight::Enter(m_caller);
 }
 
-void COPCGroup::WakeRemoval()
+COPCGroup::CallbackInFlight::~CallbackInFlight()
 {
-    if (m_removalsWaiting > 0)
-        WakeAllConditionVariable(&m_workChanged);
+    CallbacksInFlight::Leave(m_caller);
+    m_group.m_activity.EndCallback(m_caller, m_kind);
 }
 
-LONG COPCGroup::AddWork()
+void COPCGroup::AddWork()
 {
-    CSingleLock lock(&m_lock);
     InnerUnknown()->AddRef();
-    return ++m_pendingWork;
+    m_activity.AddWork();
 }
 
-LONG COPCGroup::ReleaseWork()
+void COPCGroup::ReleaseWork()
 {
-    bool handedOver;
-    LONG left;
-    {
-        CSingleLock lock(&m_lock);
-        handedOver = m_removalsWaiting > 0;
-        if (handedOver)
-            ++m_handedOverReferences;
-        left = --m_pendingWork;
-        WakeRemoval();
-    }
-    // Otherwise released after the work unit, as it may be the last.
-    if (!handedOver)
+    // While a removal waits, the unit's reference goes to the removal, so
+    // that the removal sees the client's references alone; otherwise it is
+    // released after the unit, as it may be the last.
+    if (!m_activity.ReleaseWork())
         InnerUnknown()->Release();
-    return left;
-}
-
-void COPCGroup::BeginCallback(const Caller &caller)
-{
-    CSingleLock lock(&m_lock);
-    m_callbacks.push_back(caller);
-}
-
-void COPCGroup::EndCallback(const Caller &caller)
-{
-    CSingleLock lock(&m_lock);
-    auto it = std::find(m_callbacks.begin(), m_callbacks.end(), caller);
-    if (it != m_callbacks.end())
-        m_callbacks.erase(it);
-    WakeRemoval();
 }
 
 void COPCGroup::BeginRemoval()
 {
-    LONG handedOver;
+    const LogicalCaller self = LogicalCaller::Current();
     {
         CSingleLock lock(&m_lock);
-        m_removing = true;
+        m_activity.MarkRemoving();
         m_callback.Close();
-        SetActive(FALSE);
-        Caller self = Caller::Current();
-        ++m_removalsWaiting;
-        // The callbacks of this logical thread wait for this removal: every
-        // other unit of work is waited for.
-        while (m_pendingWork - CallbacksOf(self) > 0)
-            if (!SleepConditionVariableCS(&m_workChanged, m_lock.Native(), INFINITE))
-                INTERNAL_ASSERT_FAILED("wait for the group's work");
-        --m_removalsWaiting;
-        handedOver = m_removalsWaiting == 0 ? std::exchange(m_handedOverReferences, 0) : 0;
-        // A scan still inside this caller's callback must not reach an owner
-        // that may be gone when it returns.
+        SetActive(FALSE); // its queued scan goes
+    }
+    // Its queued transactions go unexecuted, as cancelled ones do; they are
+    // destroyed here, outside the group lock.
+    if (CAsyncIOMgr *manager = CAsyncIOMgr::Instance())
+        manager->RemoveAllOf(this);
+    LONG handedOver = m_activity.WaitForRemoval(self);
+    {
+        // A scan still inside a callback must not reach an owner that may
+        // be gone when it returns.
+        CSingleLock lock(&m_lock);
         m_owner = nullptr;
     }
     // Never the last: the caller holds the server's reference.
@@ -179,7 +148,7 @@ void COPCGroup::Destroy()
     if (m_destroyed)
         return;
     m_destroyed = true;
-    m_removing = true;
+    m_activity.MarkRemoving();
     m_callback.Close();
     m_items.Clear(); // each item leaves the active list and ends its subscription
     if (m_serverHandle != 0)
@@ -218,9 +187,10 @@ STDMETHODIMP COPCGroup::GetState(DWORD *pUpdateRate, BOOL *pActive, LPWSTR *ppNa
                                  OPCHANDLE *phServerGroup)
 {
     return ComBoundary([&]() -> HRESULT {
-        CSingleLock lock(&m_lock);
-        if (m_removing)
+        GroupCall call(*this);
+        if (!call)
             return E_FAIL;
+        CSingleLock lock(&m_lock);
         if (!IsWritableOut(pUpdateRate) || !IsWritableOut(pActive) || !IsWritableOut(ppName) ||
             !IsWritableOut(pTimeBias) || !IsWritableOut(pPercentDeadband) || !IsWritableOut(pLCID) ||
             !IsWritableOut(phClientGroup) || !IsWritableOut(phServerGroup))
@@ -241,9 +211,10 @@ STDMETHODIMP COPCGroup::SetState(DWORD *pRequestedUpdateRate, DWORD *pRevisedUpd
                                  FLOAT *pPercentDeadband, DWORD *pLCID, OPCHANDLE *phClientGroup)
 {
     return ComBoundary([&]() -> HRESULT {
-        CSingleLock lock(&m_lock);
-        if (m_removing)
+        GroupCall call(*this);
+        if (!call)
             return E_FAIL;
+        CSingleLock lock(&m_lock);
         if (!IsWritableOut(pRevisedUpdateRate))
             return E_INVALIDARG;
         if (pPercentDeadband && !ValidDeadband(*pPercentDeadband))
@@ -279,8 +250,11 @@ STDMETHODIMP COPCGroup::SetState(DWORD *pRequestedUpdateRate, DWORD *pRevisedUpd
 STDMETHODIMP COPCGroup::SetName(LPCWSTR szName)
 {
     return ComBoundary([&]() -> HRESULT {
+        GroupCall call(*this);
+        if (!call)
+            return E_FAIL;
         CSingleLock lock(&m_lock);
-        if (m_removing || !m_owner)
+        if (!m_owner)
             return E_FAIL;
         CGroupRegistry &registry = m_owner->Registry();
         std::wstring name;
@@ -313,6 +287,9 @@ STDMETHODIMP COPCGroup::SetName(LPCWSTR szName)
 STDMETHODIMP COPCGroup::CloneGroup(LPCWSTR szName, REFIID riid, LPUNKNOWN *ppUnk)
 {
     return ComBoundary([&]() -> HRESULT {
+        GroupCall call(*this);
+        if (!call)
+            return E_FAIL;
         // The copy of the state is taken under the group lock, which is then
         // released: AddGroup and RemoveGroup take the server lock, which
         // comes before any group lock. The owner is entered while the group
@@ -325,8 +302,6 @@ STDMETHODIMP COPCGroup::CloneGroup(LPCWSTR szName, REFIID riid, LPUNKNOWN *ppUnk
         LCID lcid;
         {
             CSingleLock lock(&m_lock);
-            if (m_removing)
-                return E_FAIL;
             if (!IsWritableOut(ppUnk))
                 return E_INVALIDARG;
             *ppUnk = nullptr;

@@ -4,6 +4,7 @@
 #include "AdvisoryConnectionMgr.h"
 #include "ComObject.h"
 #include "ComPtr.h"
+#include "GroupActivity.h"
 #include "GroupOwner.h"
 #include "GroupRegistry.h"
 #include "Handle.h"
@@ -100,13 +101,15 @@ public:
                          const std::vector<VARIANT> &values);
     HRESULT ExecuteRefresh(DWORD connection, DWORD id, OPCDATASOURCE source);
 
-    // The DA 1.0 senders (group lock held while the sinks are called).
-    HRESULT NotifyAdviseSinks(DWORD count, const OPCHANDLE *clients, const VARIANT *values, const WORD *qualities,
-                              const FILETIME *times);
-    HRESULT SendReadComplete(DWORD connection, DWORD id, HRESULT overall, DWORD count, const OPCHANDLE *clients,
-                             const VARIANT *values, const WORD *qualities, const FILETIME *times);
-    HRESULT SendWriteComplete(DWORD connection, DWORD id, HRESULT overall, DWORD count, const OPCHANDLE *clients,
-                              const HRESULT *errors);
+    // The DA 1.0 senders: called with the group lock held in lock, they
+    // build the stream under it and release it before the sinks are called.
+    HRESULT NotifyAdviseSinks(CSingleLock &lock, DWORD count, const OPCHANDLE *clients, const VARIANT *values,
+                              const WORD *qualities, const FILETIME *times);
+    HRESULT SendReadComplete(CSingleLock &lock, DWORD connection, DWORD id, HRESULT overall, DWORD count,
+                             const OPCHANDLE *clients, const VARIANT *values, const WORD *qualities,
+                             const FILETIME *times);
+    HRESULT SendWriteComplete(CSingleLock &lock, DWORD connection, DWORD id, HRESULT overall, DWORD count,
+                              const OPCHANDLE *clients, const HRESULT *errors);
 
     // The update scan (scanner thread): delivers the changed active items;
     // next receives the next due time. FALSE when the group is inactive or
@@ -118,8 +121,8 @@ public:
     // the group, and lets go of both; each returns the work units left.
     // While a removal waits, the reference goes to the removal, so that the
     // removal sees the client's references alone.
-    LONG AddWork();
-    LONG ReleaseWork();
+    void AddWork();
+    void ReleaseWork();
 
     // IOPCItemMgt
     STDMETHODIMP AddItems(DWORD dwCount, OPCITEMDEF *pItemArray, OPCITEMRESULT **ppAddResults,
@@ -176,11 +179,11 @@ public:
     };
     HRESULT ReadForProperties(const wchar_t *itemId, PropertyRead &out);
 
-    // Removal: sets the removing flag, makes the group inactive, waits until
-    // no scan and no transaction of the group is queued or running, and cuts
-    // the link to the owner. Only a removal made from inside one of the
-    // group's own client callbacks (the same logical thread, also across the
-    // process boundary) does not wait for that callback, which waits for it.
+    // Removal: sets the removing flag (every call on the group fails from
+    // then on), makes the group inactive, drops its queued transactions,
+    // waits for the calls, scans and transactions in flight that it may wait
+    // for (GroupActivity.h), and cuts the link to the owner. It holds no
+    // lock while it waits.
     void BeginRemoval();
     // Destroys the items and gives the handle back; later calls fail with
     // E_FAIL. Runs once, at forced removal or at the last release.
@@ -199,24 +202,41 @@ private:
 
     COPCItem *FindItem(OPCHANDLE handle);
     class ScanColumns;
-    // Client callbacks in flight, by the logical thread that makes them: a
-    // removal from inside one of them does not wait for it.
-    struct Caller {
-        GUID logicalThread;
-        DWORD thread;
-        bool operator==(const Caller &o) const;
-        static Caller Current();
+    // The one way into the group for a client's call: false once removal
+    // has begun (the method returns E_FAIL); otherwise the call counts as
+    // work in flight until it returns.
+    class GroupCall {
+    public:
+        explicit GroupCall(COPCGroup &group);
+        ~GroupCall();
+        GroupCall(const GroupCall &) = delete;
+        GroupCall &operator=(const GroupCall &) = delete;
+        explicit operator bool() const { return m_entered; }
+
+    private:
+        COPCGroup &m_group;
+        const LogicalCaller m_caller;
+        bool m_entered = false;
     };
-    void BeginCallback(const Caller &caller);
-    void EndCallback(const Caller &caller);
-    LONG CallbacksOf(const Caller &caller) const;
-    void WakeRemoval();
-    struct CallbackInFlight {
-        explicit CallbackInFlight(COPCGroup &g) : group(g), caller(Caller::Current()) { group.BeginCallback(caller); }
-        ~CallbackInFlight() { group.EndCallback(caller); }
-        COPCGroup &group;
-        const Caller caller;
+    // A client callback in flight, from its start (group lock held) until
+    // it returns.
+    class CallbackInFlight {
+    public:
+        explicit CallbackInFlight(COPCGroup &group);
+        ~CallbackInFlight();
+        CallbackInFlight(const CallbackInFlight &) = delete;
+        CallbackInFlight &operator=(const CallbackInFlight &) = delete;
+
+    private:
+        COPCGroup &m_group;
+        const LogicalCaller m_caller;
+        CGroupActivity::Kind m_kind;
     };
+    // Sends one built stream to the connections; the lock is released for it.
+    HRESULT SendStreamTo(CSingleLock &lock, const ConnectionList &connections, HGLOBAL memory);
+    // A DA 1.0 read of the handles and its completion to one connection.
+    HRESULT ReadAndSend(CSingleLock &lock, DWORD connection, DWORD id, OPCDATASOURCE source,
+                        const std::vector<OPCHANDLE> &handles);
     // Reads the handles and sends the results through one of the two
     // callbacks that carry values; the lock (held on entry) is released for
     // the call.
@@ -280,10 +300,7 @@ private:
     ~COPCGroup() override;
 
     CCriticalSection m_lock; // guards every field below
-    CONDITION_VARIABLE m_workChanged = CONDITION_VARIABLE_INIT;
-    LONG m_pendingWork = 0;
-    LONG m_removalsWaiting = 0;
-    LONG m_handedOverReferences = 0;
+    CGroupActivity m_activity; // client calls, callbacks and work in flight
     CGroupOwner *m_owner = nullptr;
     CItemTable m_items;
     CActiveItemList m_activeItems;
@@ -296,8 +313,6 @@ private:
     // neither allocates nor touches fresh pages. Taken out for a scan, so
     // that two scans of the group can never share them.
     std::unique_ptr<Delivery> m_scanColumns;
-    std::vector<Caller> m_callbacks;
-    bool m_removing = false;
     bool m_destroyed = false;
     DWORD m_updateRate = 0;
     std::atomic<BOOL> m_active{FALSE}; // also read without the lock by items

@@ -17,11 +17,17 @@
 
 STDMETHODIMP COPCGroup::FindConnectionPoint(REFIID riid, IConnectionPoint **ppCP)
 {
+    GroupCall call(*this);
+    if (!call)
+        return E_FAIL;
     return m_callback.Find(riid, ppCP);
 }
 
 STDMETHODIMP COPCGroup::EnumConnectionPoints(IEnumConnectionPoints **ppEnum)
 {
+    GroupCall call(*this);
+    if (!call)
+        return E_FAIL;
     return m_callback.Enumerate(ppEnum);
 }
 
@@ -48,8 +54,6 @@ std::vector<OPCHANDLE> COPCGroup::ActiveHandles()
 HRESULT COPCGroup::QueueRequest(DWORD count, const OPCHANDLE *handles, const RequestChecks &checks, DWORD *pId,
                                 HRESULT **ppErrors, const MakeTransaction &make)
 {
-    if (m_removing)
-        return E_FAIL;
     if (!IsWritableOut(pId) || !IsWritableOut(ppErrors))
         return E_INVALIDARG;
     *pId = 0;
@@ -85,8 +89,6 @@ HRESULT COPCGroup::QueueRequest(DWORD count, const OPCHANDLE *handles, const Req
 
 HRESULT COPCGroup::QueueRefresh(OPCDATASOURCE source, HRESULT connection, DWORD *pId, const MakeRefresh &make)
 {
-    if (m_removing)
-        return E_FAIL;
     if (!IsWritableOut(pId))
         return E_INVALIDARG;
     *pId = 0;
@@ -112,6 +114,9 @@ STDMETHODIMP COPCGroup::Read(DWORD dwCount, OPCHANDLE *phServer, DWORD dwTransac
                              HRESULT **ppErrors)
 {
     return ComBoundary([&]() -> HRESULT {
+        GroupCall call(*this);
+        if (!call)
+            return E_FAIL;
         CSingleLock lock(&m_lock);
         RequestChecks checks;
         checks.connection = CallbackConnection();
@@ -132,6 +137,9 @@ STDMETHODIMP COPCGroup::Write(DWORD dwCount, OPCHANDLE *phServer, VARIANT *pItem
                               DWORD *pdwCancelID, HRESULT **ppErrors)
 {
     return ComBoundary([&]() -> HRESULT {
+        GroupCall call(*this);
+        if (!call)
+            return E_FAIL;
         CSingleLock lock(&m_lock);
         RequestChecks checks;
         checks.argumentsValid = IsReadableArray(pItemValues, dwCount);
@@ -145,6 +153,9 @@ STDMETHODIMP COPCGroup::Write(DWORD dwCount, OPCHANDLE *phServer, VARIANT *pItem
 STDMETHODIMP COPCGroup::Refresh2(OPCDATASOURCE dwSource, DWORD dwTransactionID, DWORD *pdwCancelID)
 {
     return ComBoundary([&]() -> HRESULT {
+        GroupCall call(*this);
+        if (!call)
+            return E_FAIL;
         CSingleLock lock(&m_lock);
         return QueueRefresh(dwSource, CallbackConnection(), pdwCancelID, [&](DWORD id) {
             return std::make_unique<CRefresh2Transaction>(id, this, dwTransactionID, dwSource);
@@ -155,13 +166,13 @@ STDMETHODIMP COPCGroup::Refresh2(OPCDATASOURCE dwSource, DWORD dwTransactionID, 
 STDMETHODIMP COPCGroup::Cancel2(DWORD dwCancelID)
 {
     return ComBoundary([&]() -> HRESULT {
-        {
-            CSingleLock lock(&m_lock);
-            if (m_removing)
-                return E_FAIL;
-        }
+        GroupCall call(*this);
+        if (!call)
+            return E_FAIL;
+        // Only a transaction of this group: another group's ids are not
+        // this client's to cancel.
         CAsyncIOMgr *manager = CAsyncIOMgr::Instance();
-        std::unique_ptr<CTransaction> t = manager ? manager->RemoveById(dwCancelID) : nullptr;
+        std::unique_ptr<CTransaction> t = manager ? manager->RemoveById(dwCancelID, this) : nullptr;
         if (!t)
             return E_FAIL;
         return t->Cancel(); // destroyed unexecuted: nothing is sent
@@ -170,9 +181,10 @@ STDMETHODIMP COPCGroup::Cancel2(DWORD dwCancelID)
 
 STDMETHODIMP COPCGroup::SetEnable(BOOL bEnable)
 {
-    CSingleLock lock(&m_lock);
-    if (m_removing)
+    GroupCall call(*this);
+    if (!call)
         return E_FAIL;
+    CSingleLock lock(&m_lock);
     if (!m_callback.IsFilled())
         return CONNECT_E_NOCONNECTION;
     m_enable = bEnable;
@@ -181,9 +193,10 @@ STDMETHODIMP COPCGroup::SetEnable(BOOL bEnable)
 
 STDMETHODIMP COPCGroup::GetEnable(BOOL *pbEnable)
 {
-    CSingleLock lock(&m_lock);
-    if (!IsWritableOut(pbEnable) || m_removing)
+    GroupCall call(*this);
+    if (!call || !IsWritableOut(pbEnable))
         return E_FAIL;
+    CSingleLock lock(&m_lock);
     *pbEnable = m_enable;
     return m_callback.IsFilled() ? S_OK : CONNECT_E_NOCONNECTION;
 }
@@ -322,11 +335,11 @@ BOOL COPCGroup::Scan(LONGLONG &next)
         sink.Reset();
         lock.Lock();
     }
-    HRESULT adviseResult =
-        NotifyAdviseSinks(static_cast<DWORD>(n), d.clients.data(), d.values.data(), d.qualities.data(), d.times.data());
+    HRESULT adviseResult = NotifyAdviseSinks(lock, static_cast<DWORD>(n), d.clients.data(), d.values.data(),
+                                             d.qualities.data(), d.times.data());
     if (callbackResult == S_OK || adviseResult == S_OK) {
-        // Recorded without the server lock, which a removal of this group
-        // may hold while it waits.
+        // Recorded under a lock of the owner's own: never the server lock.
+        lock.Lock();
         if (m_owner && m_owner->EnterGroupCall()) {
             CGroupOwner *owner = m_owner;
             lock.Unlock();

@@ -28,57 +28,100 @@ template <class Send> HRESULT SendStream(HGLOBAL memory, Send send)
 } // namespace
 
 // ---- Senders ---------------------------------------------------------
+//
+// The streams are built under the group lock; the sinks are called after it
+// is released, as IOPCDataCallback is: a sink may call the group back from
+// another thread of its process, and a removal may be waiting meanwhile.
 
-HRESULT COPCGroup::NotifyAdviseSinks(DWORD count, const OPCHANDLE *clients, const VARIANT *values,
-                                     const WORD *qualities, const FILETIME *times)
+HRESULT COPCGroup::SendStreamTo(CSingleLock &lock, const ConnectionList &connections, HGLOBAL memory)
 {
-    CSingleLock lock(&m_lock);
-    bool any = false, sent = false;
-    for (bool withTime : {true, false}) {
-        CAdvisoryConnectionMgr &manager = withTime ? m_dataTimeAdvise : m_dataAdvise;
-        if (manager.Count() == 0)
-            continue;
-        any = true;
-        HGLOBAL memory = nullptr;
-        HRESULT hr =
-            OpcStreams::BuildData(withTime, m_clientHandle, 0, count, clients, values, qualities, times, &memory);
-        if (FAILED(hr)) {
-            INTERNAL_ASSERT_FAILED("building a data stream");
-            return withTime ? hr : E_FAIL;
-        }
-        sent |= SendStream(memory, [&](STGMEDIUM &m) { return manager.SendToAll(m); }) == S_OK;
-    }
-    return !any ? S_FALSE : sent ? S_OK : E_FAIL;
+    CallbackInFlight inFlight(*this);
+    lock.Unlock();
+    HRESULT hr = SendStream(memory, [&](STGMEDIUM &m) {
+        SendToConnections(connections, m);
+        return S_OK;
+    });
+    return hr;
 }
 
-HRESULT COPCGroup::SendReadComplete(DWORD connection, DWORD id, HRESULT overall, DWORD count, const OPCHANDLE *clients,
-                                    const VARIANT *values, const WORD *qualities, const FILETIME *times)
+HRESULT COPCGroup::NotifyAdviseSinks(CSingleLock &lock, DWORD count, const OPCHANDLE *clients, const VARIANT *values,
+                                     const WORD *qualities, const FILETIME *times)
 {
-    CSingleLock lock(&m_lock);
-    bool withTime = m_dataTimeAdvise.Contains(connection);
-    if (!withTime && !m_dataAdvise.Contains(connection))
+    struct Send {
+        ConnectionList connections;
+        HGLOBAL memory = nullptr;
+    } sends[2];
+    bool any = false;
+    for (int i = 0; i < 2; ++i) {
+        bool withTime = i == 0; // the connections with time stamps first
+        sends[i].connections = (withTime ? m_dataTimeAdvise : m_dataAdvise).All();
+        if (sends[i].connections.empty())
+            continue;
+        any = true;
+        HRESULT hr = OpcStreams::BuildData(withTime, m_clientHandle, 0, count, clients, values, qualities, times,
+                                           &sends[i].memory);
+        if (FAILED(hr)) {
+            INTERNAL_ASSERT_FAILED("building a data stream");
+            for (Send &built : sends)
+                if (built.memory)
+                    GlobalFree(built.memory);
+            lock.Unlock();
+            return withTime ? hr : E_FAIL;
+        }
+    }
+    if (!any) {
+        lock.Unlock();
+        return S_FALSE;
+    }
+    CallbackInFlight inFlight(*this);
+    lock.Unlock();
+    for (Send &send : sends)
+        if (send.memory)
+            SendStream(send.memory, [&](STGMEDIUM &m) {
+                SendToConnections(send.connections, m);
+                return S_OK;
+            });
+    return S_OK;
+}
+
+HRESULT COPCGroup::SendReadComplete(CSingleLock &lock, DWORD connection, DWORD id, HRESULT overall, DWORD count,
+                                    const OPCHANDLE *clients, const VARIANT *values, const WORD *qualities,
+                                    const FILETIME *times)
+{
+    ConnectionList target = m_dataTimeAdvise.Find(connection);
+    bool withTime = !target.empty();
+    if (!withTime)
+        target = m_dataAdvise.Find(connection);
+    if (target.empty()) {
+        lock.Unlock();
         return OLE_E_NOCONNECTION; // unadvised meanwhile
-    CAdvisoryConnectionMgr &manager = withTime ? m_dataTimeAdvise : m_dataAdvise;
+    }
     HGLOBAL memory = nullptr;
     HRESULT hr = OpcStreams::BuildData(withTime, m_clientHandle, id, FAILED(overall) ? 0 : count, clients, values,
                                        qualities, times, &memory);
-    if (FAILED(hr))
+    if (FAILED(hr)) {
+        lock.Unlock();
         return hr;
-    return SendStream(memory, [&](STGMEDIUM &m) { return manager.SendTo(connection, m); });
+    }
+    return SendStreamTo(lock, target, memory);
 }
 
-HRESULT COPCGroup::SendWriteComplete(DWORD connection, DWORD id, HRESULT overall, DWORD count, const OPCHANDLE *clients,
-                                     const HRESULT *errors)
+HRESULT COPCGroup::SendWriteComplete(CSingleLock &lock, DWORD connection, DWORD id, HRESULT overall, DWORD count,
+                                     const OPCHANDLE *clients, const HRESULT *errors)
 {
-    CSingleLock lock(&m_lock);
-    if (!m_writeAdvise.Contains(connection))
+    ConnectionList target = m_writeAdvise.Find(connection);
+    if (target.empty()) {
+        lock.Unlock();
         return OLE_E_NOCONNECTION;
+    }
     HGLOBAL memory = nullptr;
     HRESULT hr =
         OpcStreams::BuildWriteComplete(m_clientHandle, id, FAILED(overall) ? 0 : count, clients, errors, &memory);
-    if (FAILED(hr))
+    if (FAILED(hr)) {
+        lock.Unlock();
         return hr;
-    return SendStream(memory, [&](STGMEDIUM &m) { return m_writeAdvise.SendTo(connection, m); });
+    }
+    return SendStreamTo(lock, target, memory);
 }
 
 // ---- Transaction work ------------------------------------------------
@@ -86,11 +129,17 @@ HRESULT COPCGroup::SendWriteComplete(DWORD connection, DWORD id, HRESULT overall
 HRESULT COPCGroup::ExecuteRead(DWORD connection, DWORD id, OPCDATASOURCE source, const std::vector<OPCHANDLE> &handles)
 {
     CSingleLock lock(&m_lock);
+    return ReadAndSend(lock, connection, id, source, handles);
+}
+
+HRESULT COPCGroup::ReadAndSend(CSingleLock &lock, DWORD connection, DWORD id, OPCDATASOURCE source,
+                               const std::vector<OPCHANDLE> &handles)
+{
     std::vector<ReadResult> results;
     HRESULT overall = ReadPass(source, static_cast<DWORD>(handles.size()), handles.data(), results);
     Delivery d(std::move(results));
-    return SendReadComplete(connection, id, overall, d.Count(), d.clients.data(), d.values.data(), d.qualities.data(),
-                            d.times.data());
+    return SendReadComplete(lock, connection, id, overall, d.Count(), d.clients.data(), d.values.data(),
+                            d.qualities.data(), d.times.data());
 }
 
 HRESULT COPCGroup::ExecuteWrite(DWORD connection, DWORD id, const std::vector<OPCHANDLE> &handles,
@@ -99,7 +148,7 @@ HRESULT COPCGroup::ExecuteWrite(DWORD connection, DWORD id, const std::vector<OP
     CSingleLock lock(&m_lock);
     WriteResults w(handles.size());
     WritePass(handles, values, w);
-    return SendWriteComplete(connection, id, w.overall, w.Count(), w.clients.data(), w.errors.data());
+    return SendWriteComplete(lock, connection, id, w.overall, w.Count(), w.clients.data(), w.errors.data());
 }
 
 HRESULT COPCGroup::ExecuteRefresh(DWORD connection, DWORD id, OPCDATASOURCE source)
@@ -107,7 +156,7 @@ HRESULT COPCGroup::ExecuteRefresh(DWORD connection, DWORD id, OPCDATASOURCE sour
     CSingleLock lock(&m_lock);
     if (!m_active)
         return S_OK; // nothing is sent for an inactive group
-    return ExecuteRead(connection, id, source, ActiveHandles());
+    return ReadAndSend(lock, connection, id, source, ActiveHandles());
 }
 
 // ---- IOPCAsyncIO -----------------------------------------------------
@@ -123,6 +172,9 @@ STDMETHODIMP COPCGroup::Read(DWORD dwConnection, OPCDATASOURCE dwSource, DWORD d
                              DWORD *pTransactionID, HRESULT **ppErrors)
 {
     return ComBoundary([&]() -> HRESULT {
+        GroupCall call(*this);
+        if (!call)
+            return E_FAIL;
         CSingleLock lock(&m_lock);
         RequestChecks checks;
         checks.argumentsValid = dwSource == OPC_DS_CACHE || dwSource == OPC_DS_DEVICE;
@@ -142,6 +194,9 @@ STDMETHODIMP COPCGroup::Write(DWORD dwConnection, DWORD dwCount, OPCHANDLE *phSe
                               DWORD *pTransactionID, HRESULT **ppErrors)
 {
     return ComBoundary([&]() -> HRESULT {
+        GroupCall call(*this);
+        if (!call)
+            return E_FAIL;
         CSingleLock lock(&m_lock);
         RequestChecks checks;
         checks.argumentsValid = IsReadableArray(pItemValues, dwCount);
@@ -155,6 +210,9 @@ STDMETHODIMP COPCGroup::Write(DWORD dwConnection, DWORD dwCount, OPCHANDLE *phSe
 STDMETHODIMP COPCGroup::Refresh(DWORD dwConnection, OPCDATASOURCE dwSource, DWORD *pTransactionID)
 {
     return ComBoundary([&]() -> HRESULT {
+        GroupCall call(*this);
+        if (!call)
+            return E_FAIL;
         CSingleLock lock(&m_lock);
         return QueueRefresh(dwSource, AdviseConnection(dwConnection, false), pTransactionID, [&](DWORD id) {
             return std::make_unique<CRefreshTransaction>(id, this, dwConnection, dwSource);
@@ -172,12 +230,13 @@ STDMETHODIMP COPCGroup::Cancel(DWORD dwTransactionID)
 STDMETHODIMP COPCGroup::DAdvise(FORMATETC *pformatetc, DWORD advf, IAdviseSink *pAdvSink, DWORD *pdwConnection)
 {
     return ComBoundary([&]() -> HRESULT {
+        GroupCall call(*this);
+        if (!call)
+            return E_FAIL;
         // Null pointers are refused rather than followed.
         if (!pformatetc || !pAdvSink || !IsWritableOut(pdwConnection))
             return E_INVALIDARG;
         CSingleLock lock(&m_lock);
-        if (m_removing)
-            return E_FAIL;
         // A target device's size must cover at least its own header.
         const DVTARGETDEVICE *device = pformatetc->ptd;
         if (device && (!IsReadable(device, sizeof(DWORD)) || device->tdSize < sizeof(DVTARGETDEVICE) ||
@@ -191,14 +250,19 @@ STDMETHODIMP COPCGroup::DAdvise(FORMATETC *pformatetc, DWORD advf, IAdviseSink *
         if (!manager)
             return DV_E_FORMATETC;
         HRESULT hr = manager->Add(*pformatetc, advf, pAdvSink, pdwConnection);
-        if (SUCCEEDED(hr) && manager != &m_writeAdvise)
-            ExecuteRefresh(*pdwConnection, 0, OPC_DS_CACHE); // the current values, at once
+        // The current values, at once, on this thread; the sink is called
+        // after the group lock is released.
+        if (SUCCEEDED(hr) && manager != &m_writeAdvise && m_active)
+            ReadAndSend(lock, *pdwConnection, 0, OPC_DS_CACHE, ActiveHandles());
         return hr;
     });
 }
 
 STDMETHODIMP COPCGroup::DUnadvise(DWORD dwConnection)
 {
+    GroupCall call(*this);
+    if (!call)
+        return E_FAIL;
     CSingleLock lock(&m_lock);
     for (CAdvisoryConnectionMgr *manager : {&m_dataTimeAdvise, &m_dataAdvise, &m_writeAdvise})
         if (manager->Remove(dwConnection) == S_OK)
@@ -208,6 +272,9 @@ STDMETHODIMP COPCGroup::DUnadvise(DWORD dwConnection)
 
 STDMETHODIMP COPCGroup::QueryGetData(FORMATETC *f)
 {
+    GroupCall call(*this);
+    if (!call)
+        return E_FAIL;
     if (!f)
         return DV_E_FORMATETC;
     CLIPFORMAT cf = f->cfFormat;

@@ -33,11 +33,6 @@ COPCItem *COPCGroup::FindItem(OPCHANDLE handle)
 template <class PerItem>
 HRESULT COPCGroup::ForEachHandle(DWORD count, const OPCHANDLE *handles, HRESULT **ppErrors, PerItem perItem)
 {
-    {
-        CSingleLock lock(&m_lock);
-        if (m_removing)
-            return E_FAIL;
-    }
     if (!IsWritableOut(ppErrors))
         return E_INVALIDARG;
     *ppErrors = nullptr;
@@ -59,8 +54,6 @@ HRESULT COPCGroup::ForEachHandle(DWORD count, const OPCHANDLE *handles, HRESULT 
 HRESULT COPCGroup::BeginItemDefinitions(DWORD count, const OPCITEMDEF *items, OPCITEMRESULT **ppResults,
                                         HRESULT **ppErrors, TaskMem<OPCITEMRESULT> &results, TaskMem<HRESULT> &errors)
 {
-    if (m_removing)
-        return E_FAIL;
     if (!IsWritableOut(ppResults) || !IsWritableOut(ppErrors))
         return E_INVALIDARG;
     *ppResults = nullptr;
@@ -76,6 +69,9 @@ STDMETHODIMP COPCGroup::AddItems(DWORD dwCount, OPCITEMDEF *pItemArray, OPCITEMR
                                  HRESULT **ppErrors)
 {
     return ComBoundary([&]() -> HRESULT {
+        GroupCall call(*this);
+        if (!call)
+            return E_FAIL;
         CCallPass pass; // each node is read from the network once per call
         CSingleLock lock(&m_lock);
         TaskMem<OPCITEMRESULT> results;
@@ -132,6 +128,9 @@ STDMETHODIMP COPCGroup::ValidateItems(DWORD dwCount, OPCITEMDEF *pItemArray, BOO
                                       HRESULT **ppErrors)
 {
     return ComBoundary([&]() -> HRESULT {
+        GroupCall call(*this);
+        if (!call)
+            return E_FAIL;
         CCallPass pass; // each node is read from the network once per call
         CSingleLock lock(&m_lock);
         TaskMem<OPCITEMRESULT> results;
@@ -173,6 +172,9 @@ STDMETHODIMP COPCGroup::ValidateItems(DWORD dwCount, OPCITEMDEF *pItemArray, BOO
 STDMETHODIMP COPCGroup::RemoveItems(DWORD dwCount, OPCHANDLE *phServer, HRESULT **ppErrors)
 {
     return ComBoundary([&]() -> HRESULT {
+        GroupCall call(*this);
+        if (!call)
+            return E_FAIL;
         return ForEachHandle(dwCount, phServer, ppErrors, [this](DWORD, COPCItem &item) -> HRESULT {
             if (!m_items.Erase(item.ServerHandle())) {
                 INTERNAL_ASSERT_FAILED("item erase");
@@ -186,6 +188,9 @@ STDMETHODIMP COPCGroup::RemoveItems(DWORD dwCount, OPCHANDLE *phServer, HRESULT 
 STDMETHODIMP COPCGroup::SetActiveState(DWORD dwCount, OPCHANDLE *phServer, BOOL bActive, HRESULT **ppErrors)
 {
     return ComBoundary([&]() -> HRESULT {
+        GroupCall call(*this);
+        if (!call)
+            return E_FAIL;
         return ForEachHandle(dwCount, phServer, ppErrors,
                              [bActive](DWORD, COPCItem &item) { return item.SetActive(bActive ? TRUE : FALSE); });
     });
@@ -194,9 +199,12 @@ STDMETHODIMP COPCGroup::SetActiveState(DWORD dwCount, OPCHANDLE *phServer, BOOL 
 STDMETHODIMP COPCGroup::SetClientHandles(DWORD dwCount, OPCHANDLE *phServer, OPCHANDLE *phClient, HRESULT **ppErrors)
 {
     return ComBoundary([&]() -> HRESULT {
+        GroupCall call(*this);
+        if (!call)
+            return E_FAIL;
         if (!IsReadableArray(phClient, dwCount) && IsWritableOut(ppErrors)) {
             *ppErrors = nullptr;
-            return m_removing ? E_FAIL : E_INVALIDARG;
+            return E_INVALIDARG;
         }
         return ForEachHandle(dwCount, phServer, ppErrors, [phClient](DWORD i, COPCItem &item) {
             item.SetClientHandle(phClient[i]);
@@ -209,9 +217,12 @@ STDMETHODIMP COPCGroup::SetDatatypes(DWORD dwCount, OPCHANDLE *phServer, VARTYPE
                                      HRESULT **ppErrors)
 {
     return ComBoundary([&]() -> HRESULT {
+        GroupCall call(*this);
+        if (!call)
+            return E_FAIL;
         if (!IsReadableArray(pRequestedDatatypes, dwCount) && IsWritableOut(ppErrors)) {
             *ppErrors = nullptr;
-            return m_removing ? E_FAIL : E_INVALIDARG;
+            return E_INVALIDARG;
         }
         return ForEachHandle(dwCount, phServer, ppErrors, [pRequestedDatatypes](DWORD i, COPCItem &item) {
             item.SetRequestedType(pRequestedDatatypes[i]);
@@ -223,9 +234,10 @@ STDMETHODIMP COPCGroup::SetDatatypes(DWORD dwCount, OPCHANDLE *phServer, VARTYPE
 STDMETHODIMP COPCGroup::CreateEnumerator(REFIID riid, LPUNKNOWN *ppUnk)
 {
     return ComBoundary([&]() -> HRESULT {
-        CSingleLock lock(&m_lock);
-        if (m_removing)
+        GroupCall call(*this);
+        if (!call)
             return E_FAIL;
+        CSingleLock lock(&m_lock);
         if (!IsWritableOut(ppUnk))
             return E_INVALIDARG;
         *ppUnk = nullptr;

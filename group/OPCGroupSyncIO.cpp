@@ -58,9 +58,10 @@ STDMETHODIMP COPCGroup::Read(OPCDATASOURCE dwSource, DWORD dwCount, OPCHANDLE *p
                              HRESULT **ppErrors)
 {
     return ComBoundary([&]() -> HRESULT {
-        CSingleLock lock(&m_lock);
-        if (m_removing)
+        GroupCall call(*this);
+        if (!call)
             return E_FAIL;
+        CSingleLock lock(&m_lock);
         if (!IsWritableOut(ppItemValues) || !IsWritableOut(ppErrors))
             return E_INVALIDARG;
         *ppItemValues = nullptr;
@@ -90,9 +91,10 @@ STDMETHODIMP COPCGroup::Read(OPCDATASOURCE dwSource, DWORD dwCount, OPCHANDLE *p
 STDMETHODIMP COPCGroup::Write(DWORD dwCount, OPCHANDLE *phServer, VARIANT *pItemValues, HRESULT **ppErrors)
 {
     return ComBoundary([&]() -> HRESULT {
-        CSingleLock lock(&m_lock);
-        if (m_removing)
+        GroupCall call(*this);
+        if (!call)
             return E_FAIL;
+        CSingleLock lock(&m_lock);
         if (!IsWritableOut(ppErrors))
             return E_INVALIDARG;
         *ppErrors = nullptr;

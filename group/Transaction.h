@@ -17,6 +17,7 @@ public:
     // A client cancelled it while it was queued: nothing is sent.
     virtual HRESULT Cancel() { return S_OK; }
     DWORD Id() const { return m_id; }
+    const COPCGroup *Group() const { return m_group; }
 
 protected:
     CTransaction(DWORD id, COPCGroup *group, DWORD request);

@@ -24,6 +24,14 @@ STDMETHODIMP CServerClassFactory::CreateInstance(IUnknown *outer, REFIID riid, v
     *ppv = nullptr;
     if (outer && !IsEqualIID(riid, IID_IUnknown))
         return CLASS_E_NOAGGREGATION;
+    // The creation holds the process until the object holds it itself; once
+    // the process has decided to exit it refuses, and COM's activation
+    // starts another process.
+    if (!ComModule::TryLock())
+        return CO_E_SERVER_STOPPING;
+    struct CreationHold {
+        ~CreationHold() { ComModule::Unlock(); }
+    } hold;
     return ComBoundary([&]() -> HRESULT {
         COPCServer *server = COPCServer::Create(outer);
         if (!server)
@@ -40,9 +48,18 @@ STDMETHODIMP CServerClassFactory::CreateInstance(IUnknown *outer, REFIID riid, v
 
 STDMETHODIMP CServerClassFactory::LockServer(BOOL lock)
 {
-    if (lock)
-        ComModule::Lock();
-    else
+    if (lock) {
+        if (!ComModule::TryLock())
+            return CO_E_SERVER_STOPPING;
+        ++m_serverLocks;
+        return S_OK;
+    }
+    // An unlock without a lock of its own would end the process under other
+    // clients' objects: it is ignored.
+    LONG locks = m_serverLocks.load();
+    while (locks > 0 && !m_serverLocks.compare_exchange_weak(locks, locks - 1)) {
+    }
+    if (locks > 0)
         ComModule::Unlock();
     return S_OK;
 }

@@ -3,6 +3,8 @@
 // it is not counted in the module lock count.
 #include <unknwn.h>
 
+#include <atomic>
+
 class CServerClassFactory : public IClassFactory {
 public:
     STDMETHODIMP QueryInterface(REFIID riid, void **ppv) override;
@@ -11,4 +13,7 @@ public:
 
     STDMETHODIMP CreateInstance(IUnknown *outer, REFIID riid, void **ppv) override;
     STDMETHODIMP LockServer(BOOL lock) override;
+
+private:
+    std::atomic<LONG> m_serverLocks{0}; // outstanding LockServer(TRUE)
 };

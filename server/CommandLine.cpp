@@ -18,3 +18,16 @@ ServerCommand FindServerCommand(const char *commandLine)
     }
     return ServerCommand::Run;
 }
+
+bool StartedByCom(const char *commandLine)
+{
+    if (!commandLine)
+        return false;
+    static const char kSwitch[] = "Embedding";
+    for (const char *p = strpbrk(commandLine, "-/"); p; p = strpbrk(p + 1, "-/")) {
+        const char *end = p + 1 + strlen(kSwitch);
+        if (strncasecmp(p + 1, kSwitch, strlen(kSwitch)) == 0 && (*end == '\0' || *end == ' ' || *end == '\t'))
+            return true;
+    }
+    return false;
+}

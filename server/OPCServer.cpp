@@ -106,8 +106,9 @@ void COPCServer::FinalRelease()
         ServerServices::ServerReleased();
     m_shutdownSink.Close();
     m_shutdownSink.Clear(); // a sink still advised goes with the server (no lock held)
-    CSingleLock registryLock(&m_registry.Lock());
     // No client can reach the object any more: every group goes, by force.
+    // The registry lock is not held while a removal waits: a callback in
+    // flight may look a group up.
     for (OPCHANDLE handle : m_registry.Handles())
         RemoveGroup(handle, TRUE);
     if (m_scanMgr) {
@@ -340,32 +341,46 @@ STDMETHODIMP COPCServer::GetStatus(OPCSERVERSTATUS **ppServerStatus)
 STDMETHODIMP COPCServer::RemoveGroup(OPCHANDLE hServerGroup, BOOL bForce)
 {
     return ComBoundary([&]() -> HRESULT {
-        CSingleLock lock(&m_lock);
-        COPCGroup *group = m_registry.FindHandle(hServerGroup);
-        if (!group)
-            return E_INVALIDARG;
-        if (m_registry.EraseName(group->Name(), group) != 1)
-            INTERNAL_ASSERT_FAILED("group name missing from the name index");
-        if (m_registry.EraseHandle(hServerGroup, group) != 1)
-            INTERNAL_ASSERT_FAILED("group handle missing from the handle index");
-        group->BeginRemoval();
-
-        HRESULT hr;
-        if (!bForce) {
-            hr = group->InnerUnknown()->Release() != 0 ? OPC_S_INUSE : S_OK;
-        } else {
-            hr = CoDisconnectObject(group->InnerUnknown(), 0);
-            // Destroyed now whatever the clients hold; a reference that an
-            // enumerator still keeps reaches only an empty shell that fails
-            // every call, and frees it when released.
-            group->Destroy();
-            group->InnerUnknown()->Release();
+        COPCGroup *group;
+        {
+            // The server lock covers the registry and the count only. The
+            // wait for the group's work below runs without it, on purpose:
+            // a client callback in flight may call this server (GetStatus,
+            // AddGroup) while its group is being removed, and would wait for
+            // the lock for ever. A second removal of the same handle finds
+            // it gone and gets E_INVALIDARG.
+            CSingleLock lock(&m_lock);
+            group = m_registry.FindHandle(hServerGroup);
+            if (!group)
+                return E_INVALIDARG;
+            if (m_registry.EraseName(group->Name(), group) != 1)
+                INTERNAL_ASSERT_FAILED("group name missing from the name index");
+            if (m_registry.EraseHandle(hServerGroup, group) != 1)
+                INTERNAL_ASSERT_FAILED("group handle missing from the handle index");
+            --m_groupCount;
         }
-        if (FAILED(hr))
-            INTERNAL_ASSERT_FAILED("forced group removal");
-        --m_groupCount;
-        return hr;
+        // This call now owns the server's reference, which the registry held.
+        return RemoveUnregisteredGroup(group, bForce);
     });
+}
+
+HRESULT COPCServer::RemoveUnregisteredGroup(COPCGroup *group, BOOL force)
+{
+    group->BeginRemoval();
+    HRESULT hr;
+    if (!force) {
+        hr = group->InnerUnknown()->Release() != 0 ? OPC_S_INUSE : S_OK;
+    } else {
+        hr = CoDisconnectObject(group->InnerUnknown(), 0);
+        // Destroyed now whatever the clients hold; a reference that an
+        // enumerator still keeps reaches only an empty shell that fails
+        // every call, and frees it when released.
+        group->Destroy();
+        group->InnerUnknown()->Release();
+    }
+    if (FAILED(hr))
+        INTERNAL_ASSERT_FAILED("forced group removal");
+    return hr;
 }
 
 STDMETHODIMP COPCServer::CreateGroupEnumerator(OPCENUMSCOPE dwScope, REFIID riid, LPUNKNOWN *ppUnk)

@@ -87,6 +87,9 @@ private:
                            LONG *pTimeBias, FLOAT *pPercentDeadband, DWORD dwLCID, OPCHANDLE *phServerGroup,
                            DWORD *pRevisedUpdateRate, REFIID riid, LPUNKNOWN *ppUnk);
     void UndoAddGroup(COPCGroup *group, LPUNKNOWN *ppUnk);
+    // Removal of a group already taken out of the registry, whose server
+    // reference the caller now holds.
+    HRESULT RemoveUnregisteredGroup(COPCGroup *group, BOOL force);
     HRESULT EnumerateGroups(REFIID riid, LPUNKNOWN *ppUnk);
 
     CUpdateScanMgr *m_scanMgr = nullptr;

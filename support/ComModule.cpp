@@ -1,32 +1,43 @@
 #include "ComModule.h"
 
-#include <objbase.h>
+#include "ServerLifetime.h"
+
+#include <atomic>
 
 namespace {
-volatile LONG g_lockCount = 0;
-volatile DWORD g_mainThreadId = 0;
+std::atomic<LONG> g_lockCount{0};
+std::atomic<CServerLifetime *> g_lifetime{nullptr};
 } // namespace
 
 void ComModule::Lock()
 {
-    InterlockedIncrement(&g_lockCount);
+    ++g_lockCount;
+    if (CServerLifetime *lifetime = g_lifetime.load())
+        lifetime->Lock();
+}
+
+bool ComModule::TryLock()
+{
+    CServerLifetime *lifetime = g_lifetime.load();
+    if (lifetime && !lifetime->TryLock())
+        return false;
+    ++g_lockCount;
+    return true;
 }
 
 void ComModule::Unlock()
 {
-    if (InterlockedDecrement(&g_lockCount) != 0)
-        return;
-    // No delay: the runtime hands out no new objects once suspended.
-    if (CoSuspendClassObjects() == S_OK && g_mainThreadId != 0)
-        PostThreadMessageA(g_mainThreadId, WM_QUIT, 0, 0);
+    --g_lockCount;
+    if (CServerLifetime *lifetime = g_lifetime.load())
+        lifetime->Unlock();
 }
 
 LONG ComModule::LockCount()
 {
-    return g_lockCount;
+    return g_lockCount.load();
 }
 
-void ComModule::SetMainThreadId(DWORD id)
+void ComModule::SetLifetime(CServerLifetime *lifetime)
 {
-    g_mainThreadId = id;
+    g_lifetime.store(lifetime);
 }

@@ -1,14 +1,19 @@
 #pragma once
 // The module lock count: every live COM object of the server and every
-// outstanding LockServer(TRUE) holds one. When it falls to 0 the class objects
-// are suspended and the main thread is told to quit.
+// outstanding LockServer(TRUE) holds one. In the server process the count
+// belongs to its CServerLifetime, which decides when the process leaves;
+// without one (test programs) it is only counted.
 #include <windows.h>
+
+class CServerLifetime;
 
 namespace ComModule {
 void Lock();
 void Unlock();
+// A creation or LockServer(TRUE): false once the process has decided to
+// exit (the caller answers CO_E_SERVER_STOPPING).
+bool TryLock();
 LONG LockCount();
-// The thread whose message loop ends the process; 0 (the default, as in test
-// programs) means nobody is told to quit.
-void SetMainThreadId(DWORD id);
+// The lifetime that the count drives; null detaches it.
+void SetLifetime(CServerLifetime *lifetime);
 } // namespace ComModule

@@ -31,14 +31,20 @@ public:
         return S_OK;
     }
 
+    // The last release destroys the instance after the lock: its thread
+    // may be inside a client callback that creates a new server object in
+    // this process, whose Acquire must not wait for that thread's end.
     static void ReleaseInstance()
     {
-        CSingleLock lock(&s_lock);
-        if (s_count <= 0)
-            return;
-        if (--s_count == 0) {
-            delete s_instance;
-            s_instance = nullptr;
+        std::unique_ptr<T> last;
+        {
+            CSingleLock lock(&s_lock);
+            if (s_count <= 0)
+                return;
+            if (--s_count == 0) {
+                last.reset(s_instance);
+                s_instance = nullptr;
+            }
         }
     }
 

@@ -191,13 +191,39 @@ TEST_F(AsyncTest, ReadAndWriteCompleteFromTheWorker)
 
 TEST_F(AsyncTest, CancelDropsQueuedTransactionsWithoutCallbacks)
 {
-    auto h = Add({kNever, kTemperature});
+    auto h = Add({kTemperature});
     Advise();
-    DWORD slowId = 0, queuedId = 0;
+    // The worker is kept busy by a read of another group that waits about
+    // 3 s for the member that never delivers: that group's lock is held
+    // meanwhile, this one's is free.
+    ComPtr<IOPCItemMgt> slowItems;
+    OPCHANDLE slowGroup = 0;
+    DWORD slowRate = 0;
+    ASSERT_EQ(server->AddGroup(L"slow", TRUE, 50, 1, nullptr, nullptr, 0, &slowGroup, &slowRate, IID_IOPCItemMgt,
+                               reinterpret_cast<IUnknown **>(slowItems.Out())),
+              S_OK);
+    OPCITEMDEF def = {};
+    def.szItemID = const_cast<wchar_t *>(kNever);
+    def.bActive = TRUE;
+    OPCITEMRESULT *results = nullptr;
     HRESULT *errors = nullptr;
-    // The worker spends about 3 s waiting for the member that never delivers.
+    ASSERT_EQ(slowItems->AddItems(1, &def, &results, &errors), S_OK);
+    OPCHANDLE never = results[0].hServer;
+    CoTaskMemFree(results);
+    CoTaskMemFree(errors);
+    TestSink slowSink;
+    ComPtr<IConnectionPointContainer> slowContainer;
+    ComPtr<IConnectionPoint> slowPoint;
+    ASSERT_EQ(slowItems.As(slowContainer), S_OK);
+    ASSERT_EQ(slowContainer->FindConnectionPoint(IID_IOPCDataCallback, slowPoint.Out()), S_OK);
+    DWORD slowCookie = 0;
+    ASSERT_EQ(slowPoint->Advise(&slowSink, &slowCookie), S_OK);
+    ComPtr<IOPCAsyncIO2> slowAsync;
+    ASSERT_EQ(slowItems.As(slowAsync), S_OK);
+
+    DWORD slowId = 0, queuedId = 0;
     unsigned long readsBefore = ReadsSoFar();
-    ASSERT_EQ(async->Read(1, &h[0], 50, &slowId, &errors), S_OK);
+    ASSERT_EQ(slowAsync->Read(1, &never, 50, &slowId, &errors), S_OK);
     CoTaskMemFree(errors);
     // The worker must have taken the slow read before the next one comes (a
     // worker that woke late would take both at once): it has once it has
@@ -205,26 +231,29 @@ TEST_F(AsyncTest, CancelDropsQueuedTransactionsWithoutCallbacks)
     for (int i = 0; i < 1000 && ReadsSoFar() == readsBefore; ++i)
         Sleep(10);
     ASSERT_NE(ReadsSoFar(), readsBefore) << "the worker never read the slow item";
-    ASSERT_EQ(async->Read(1, &h[1], 51, &queuedId, &errors), S_OK);
+    ASSERT_EQ(async->Read(1, &h[0], 51, &queuedId, &errors), S_OK);
     CoTaskMemFree(errors);
+    EXPECT_EQ(slowAsync->Cancel2(queuedId), E_FAIL) << "another group's transaction";
     EXPECT_EQ(async->Cancel2(queuedId), S_OK);
     EXPECT_EQ(async->Cancel2(queuedId), E_FAIL) << "already gone";
     EXPECT_EQ(async->Cancel2(0xFFFFFF), E_FAIL) << "never issued";
-    ASSERT_TRUE(sink.WaitFor([](auto &calls) {
+    ASSERT_TRUE(slowSink.WaitFor([](auto &calls) {
         for (const auto &c : calls)
             if (c.kind == Callback::ReadComplete && c.transid == 50)
                 return true;
         return false;
     }));
     Sleep(100);
-    for (const auto &c : sink.Snapshot()) {
+    for (const auto &c : sink.Snapshot())
         EXPECT_NE(c.transid, 51u) << "a cancelled read sends nothing";
+    for (const auto &c : slowSink.Snapshot())
         if (c.transid == 50) {
             EXPECT_EQ(c.errors, std::vector<HRESULT>{OPC_E_UNKNOWNITEMID});
         }
-    }
-    EXPECT_EQ(async->Cancel2(slowId), E_FAIL) << "already completed";
+    EXPECT_EQ(slowAsync->Cancel2(slowId), E_FAIL) << "already completed";
     EXPECT_EQ(sink.Count(Callback::CancelComplete), 0u);
+    slowPoint->Unadvise(slowCookie);
+    server->RemoveGroup(slowGroup, TRUE);
 }
 
 TEST_F(AsyncTest, ConnectionPointRules)

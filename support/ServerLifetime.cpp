@@ -1,0 +1,122 @@
+#include "ServerLifetime.h"
+
+#include "Trace.h"
+
+CServerLifetime::CServerLifetime(CClassRegistration &registration, const Timing &timing, bool idleFromStart)
+    : m_registration(registration), m_timing(timing), m_wake(CreateEventW(nullptr, FALSE, FALSE, nullptr)),
+      m_exitWhenIdle(idleFromStart), m_since(timing.now())
+{
+    if (!m_wake)
+        INTERNAL_ASSERT_FAILED("CreateEvent for the server lifetime");
+}
+
+void CServerLifetime::Wake()
+{
+    if (m_wake)
+        SetEvent(m_wake.Get());
+}
+
+void CServerLifetime::Lock()
+{
+    CSingleLock lock(&m_lock);
+    ++m_count;
+    if (m_phase == Phase::Draining)
+        Wake(); // the main thread restores the registration
+}
+
+bool CServerLifetime::TryLock()
+{
+    CSingleLock lock(&m_lock);
+    if (m_phase == Phase::Stopped)
+        return false;
+    ++m_count;
+    if (m_phase == Phase::Draining)
+        Restore(); // at once: the same client may ask the registry next
+    return true;
+}
+
+void CServerLifetime::Unlock()
+{
+    CSingleLock lock(&m_lock);
+    if (m_count <= 0) {
+        INTERNAL_ASSERT_FAILED("server lock count below 0");
+        return;
+    }
+    if (--m_count == 0) {
+        m_exitWhenIdle = true;
+        m_since = m_timing.now();
+        Wake();
+    }
+}
+
+LONG CServerLifetime::Count()
+{
+    CSingleLock lock(&m_lock);
+    return m_count;
+}
+
+void CServerLifetime::IncomingCall()
+{
+    // Every call of every client passes here: a word is read, nothing more,
+    // unless the class object has just been revoked.
+    if (InterlockedCompareExchange(&m_draining, 0, 0) == 0)
+        return;
+    CSingleLock lock(&m_lock);
+    if (m_phase == Phase::Draining)
+        Restore();
+}
+
+void CServerLifetime::Restore()
+{
+    // A client is on its way: it finds the class object again before its
+    // call is served, and the grace period starts over.
+    if (FAILED(m_registration.Register()))
+        INTERNAL_ASSERT_FAILED("registering the class object again");
+    m_phase = Phase::Serving;
+    InterlockedExchange(&m_draining, 0);
+    m_since = m_timing.now();
+    Wake();
+}
+
+CServerLifetime::Phase CServerLifetime::Advance(DWORD &waitMs)
+{
+    CSingleLock lock(&m_lock);
+    waitMs = INFINITE;
+    ULONGLONG now = m_timing.now();
+    switch (m_phase) {
+    case Phase::Serving:
+        if (m_count > 0 || !m_exitWhenIdle)
+            break;
+        if (now - m_since < m_timing.graceMs) {
+            waitMs = static_cast<DWORD>(m_timing.graceMs - (now - m_since));
+            break;
+        }
+        m_registration.Revoke();
+        m_phase = Phase::Draining;
+        InterlockedExchange(&m_draining, 1);
+        m_since = now;
+        waitMs = m_timing.drainMs;
+        break;
+    case Phase::Draining:
+        if (m_count > 0) {
+            Restore();
+            break;
+        }
+        if (now - m_since < m_timing.drainMs) {
+            waitMs = static_cast<DWORD>(m_timing.drainMs - (now - m_since));
+            break;
+        }
+        m_phase = Phase::Stopped;
+        InterlockedExchange(&m_draining, 0);
+        break;
+    case Phase::Stopped:
+        break;
+    }
+    return m_phase;
+}
+
+CServerLifetime::Phase CServerLifetime::CurrentPhase()
+{
+    CSingleLock lock(&m_lock);
+    return m_phase;
+}
