@@ -48,6 +48,6 @@ public:
     ConnectionList All();
 
 private:
-    CCriticalSection m_lock;
+    CCriticalSection m_lock{LockOrder::Inner};
     std::list<std::shared_ptr<CConnectionData>> m_connections;
 };

@@ -34,7 +34,7 @@ private:
     using Singleton = CRefSingleton<CAsyncIOMgr>;
     void Run(HANDLE stopEvent);
 
-    CCriticalSection m_lock; // the queue only; never held while executing
+    CCriticalSection m_lock{LockOrder::Inner}; // the queue only; never held while executing
     std::list<std::unique_ptr<CTransaction>> m_queue;
     UniqueHandle m_work; // manual reset: signalled while the queue is not empty
     CWorkerThread m_thread;

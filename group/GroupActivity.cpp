@@ -24,7 +24,7 @@ LogicalCaller LogicalCaller::Current()
 }
 
 namespace {
-CCriticalSection g_callbacksLock; // innermost
+CCriticalSection g_callbacksLock(LockOrder::Leaf);
 std::vector<LogicalCaller> g_callbacks;
 } // namespace
 

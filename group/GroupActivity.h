@@ -75,7 +75,7 @@ private:
     LONG Blocking(const LogicalCaller &remover) const;
     void Changed();
 
-    CCriticalSection m_lock;
+    CCriticalSection m_lock{LockOrder::Activity};
     CONDITION_VARIABLE m_changed = CONDITION_VARIABLE_INIT;
     bool m_removing = false;
     LONG m_work = 0;

@@ -30,7 +30,7 @@ public:
     CCriticalSection &Lock() { return m_lock; }
 
 private:
-    CCriticalSection m_lock;
+    CCriticalSection m_lock{LockOrder::Inner};
     std::map<std::wstring, COPCGroup *> m_byName;
     std::map<OPCHANDLE, COPCGroup *> m_byHandle;
 };

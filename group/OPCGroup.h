@@ -299,7 +299,7 @@ private:
     COPCGroup();
     ~COPCGroup() override;
 
-    CCriticalSection m_lock; // guards every field below
+    CCriticalSection m_lock{LockOrder::Group}; // guards every field below
     CGroupActivity m_activity; // client calls, callbacks and work in flight
     CGroupOwner *m_owner = nullptr;
     CItemTable m_items;

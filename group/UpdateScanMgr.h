@@ -46,7 +46,7 @@ private:
     void Push(COPCGroup *group, LONGLONG due);
     void ScanOne(COPCGroup *group);
 
-    CCriticalSection m_lock;
+    CCriticalSection m_lock{LockOrder::Inner};
     std::vector<Entry> m_heap;
     int m_yield = 100;
     UniqueHandle m_wake;

@@ -94,9 +94,9 @@ private:
 
     CUpdateScanMgr *m_scanMgr = nullptr;
     CAsyncIOMgr *m_asyncMgr = nullptr;
-    CCriticalSection m_lock;
+    CCriticalSection m_lock{LockOrder::Server};
     FILETIME m_startTime = {};
-    CCriticalSection m_updateTimeLock; // innermost
+    CCriticalSection m_updateTimeLock{LockOrder::Leaf};
     FILETIME m_lastUpdateTime = {};
     DWORD m_groupCount = 0;
     CGroupRegistry m_registry;
@@ -106,7 +106,7 @@ private:
     std::wstring m_clientName;
     bool m_counted = false; // counted among the server objects of the process
     // Calls from groups into this object; innermost lock.
-    CCriticalSection m_groupCallLock;
+    CCriticalSection m_groupCallLock{LockOrder::Leaf};
     LONG m_groupCalls = 0;
     bool m_closing = false; // final release has begun: AddGroup refuses
 };

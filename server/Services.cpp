@@ -10,7 +10,7 @@
 #include <memory>
 
 namespace {
-CCriticalSection g_servicesLock;
+CCriticalSection g_servicesLock(LockOrder::Services);
 LONG g_serverCount = 0;
 OPCCadroClient *g_realTimeClient = nullptr;
 OPCCadroBrowser *g_browser = nullptr;

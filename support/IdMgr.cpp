@@ -13,7 +13,8 @@ CIdMgr g_idMgr;
 
 CIdMgr::CIdMgr() : CIdMgr(1, 0xFFFFFFFFul) {}
 
-CIdMgr::CIdMgr(unsigned long low, unsigned long high) : m_first(low, high), m_available(&m_first), m_released(&m_second)
+CIdMgr::CIdMgr(unsigned long low, unsigned long high)
+    : CCriticalSection(LockOrder::Leaf), m_first(low, high), m_available(&m_first), m_released(&m_second)
 {
 }
 

@@ -81,7 +81,7 @@ private:
     CClassRegistration &m_registration;
     const Timing m_timing;
     UniqueHandle m_wake;
-    CCriticalSection m_lock; // innermost but for the registration's own
+    CCriticalSection m_lock{LockOrder::Leaf};
     LONG m_count = 0;
     Phase m_phase = Phase::Serving;
     bool m_exitWhenIdle;

@@ -56,7 +56,7 @@ private:
     const IID &m_iid;
     const DWORD m_cookie;
     IUnknown *const m_container;
-    CCriticalSection m_lock; // innermost: guards the two below
+    CCriticalSection m_lock{LockOrder::Inner}; // guards the two below
     ComPtr<IUnknown> m_sink;
     bool m_closed = false;
 };

@@ -1,5 +1,7 @@
 #pragma once
 // Lockable objects and the scoped lock holder used for every lock in the server.
+#include "LockOrder.h"
+
 #include <windows.h>
 
 #include <atomic>
@@ -17,7 +19,12 @@ public:
 // that slept at once would make them wait for each other item after item.
 class CCriticalSection : public CSyncObject {
 public:
-    CCriticalSection() { InitializeCriticalSectionEx(&m_cs, kSpinCount, CRITICAL_SECTION_NO_DEBUG_INFO); }
+    // level: its place in the lock order (LockOrder.h), checked in debug
+    // builds when it is taken.
+    explicit CCriticalSection(LockOrder::Level level = LockOrder::Unchecked) : m_level(level)
+    {
+        InitializeCriticalSectionEx(&m_cs, kSpinCount, CRITICAL_SECTION_NO_DEBUG_INFO);
+    }
     static constexpr DWORD kSpinCount = 4000;
     ~CCriticalSection() override { DeleteCriticalSection(&m_cs); }
     CCriticalSection(const CCriticalSection &) = delete;
@@ -25,12 +32,18 @@ public:
 
     BOOL Lock(DWORD = INFINITE) override
     {
+#ifndef NDEBUG
+        LockOrder::Acquire(this, m_level);
+#endif
         EnterCriticalSection(&m_cs);
         return TRUE;
     }
     BOOL Unlock() override
     {
         LeaveCriticalSection(&m_cs);
+#ifndef NDEBUG
+        LockOrder::Release(this);
+#endif
         return TRUE;
     }
     // For condition variables (entered exactly once by the sleeper).
@@ -38,6 +51,7 @@ public:
 
 private:
     CRITICAL_SECTION m_cs;
+    LockOrder::Level m_level;
 };
 
 // A slim lock for objects that exist by the ten thousand (the items): one

@@ -5,6 +5,7 @@
 #include <chrono>
 #include <condition_variable>
 #include <cstring>
+#include <functional>
 #include <mutex>
 #include <vector>
 
@@ -49,10 +50,16 @@ public:
                 s.bytes.assign(p, p + size);
             GlobalUnlock(medium->hGlobal);
         }
-        std::lock_guard<std::mutex> l(m_lock);
-        m_streams.push_back(std::move(s));
-        m_changed.notify_all();
+        {
+            std::lock_guard<std::mutex> l(m_lock);
+            m_streams.push_back(std::move(s));
+            m_changed.notify_all();
+        }
+        if (onData)
+            onData();
     }
+    // Runs inside OnDataChange after recording (re-entrancy tests).
+    std::function<void()> onData;
     STDMETHODIMP_(void) OnViewChange(DWORD, LONG) override {}
     STDMETHODIMP_(void) OnRename(IMoniker *) override {}
     STDMETHODIMP_(void) OnSave() override {}

@@ -45,6 +45,53 @@ struct Creation {
 };
 } // namespace
 
+namespace {
+std::atomic<bool> g_abandoned{false};
+constexpr DWORD kRetryPauseMs = 200;
+
+// One activation on a thread of its own; E_PENDING when it has not ended
+// within waitMs (it is left to finish or fail on its own).
+HRESULT CreateOnce(const CLSID &clsid, DWORD waitMs, ComPtr<IOPCServer> &server)
+{
+    Creation *creation = Creation::New(clsid);
+    UniqueHandle thread(CreateThread(nullptr, 0, Creation::Run, creation, 0, nullptr));
+    if (!thread) {
+        Creation::Run(creation); // gives back the thread's reference only
+    } else if (WaitForSingleObject(thread.Get(), waitMs) == WAIT_TIMEOUT) {
+        g_abandoned = true;
+        creation->Release();
+        return E_PENDING;
+    }
+    HRESULT hr = creation->result;
+    if (SUCCEEDED(hr)) {
+        server = ComPtr<IOPCServer>::Attach(creation->server);
+        creation->server = nullptr;
+    }
+    creation->Release();
+    return hr;
+}
+} // namespace
+
+bool Connection::IsTransient(HRESULT hr)
+{
+    switch (hr) {
+    case CO_E_SERVER_STOPPING:
+    case HRESULT_FROM_WIN32(RPC_S_SERVER_UNAVAILABLE):
+    case HRESULT_FROM_WIN32(RPC_S_CALL_FAILED):
+    case HRESULT_FROM_WIN32(RPC_S_CALL_FAILED_DNE):
+    case RPC_E_DISCONNECTED:
+    case E_NOINTERFACE: // the process that was starting for it went away
+        return true;
+    default:
+        return false;
+    }
+}
+
+bool Connection::CreationAbandoned()
+{
+    return g_abandoned;
+}
+
 int Connection::Open(const std::wstring &name, double timeoutSeconds, Output &out)
 {
     CLSID clsid;
@@ -55,24 +102,23 @@ int Connection::Open(const std::wstring &name, double timeoutSeconds, Output &ou
         return kExitNoServer;
     }
     // COM waits for a server that hangs while it starts as long as the
-    // server lives; opc gives up after the timeout and leaves the creation
-    // to finish or fail on its own thread.
-    Creation *creation = Creation::New(clsid);
-    UniqueHandle thread(CreateThread(nullptr, 0, Creation::Run, creation, 0, nullptr));
-    if (!thread) {
-        Creation::Run(creation); // gives back the thread's reference only
-    } else if (WaitForSingleObject(thread.Get(), static_cast<DWORD>(timeoutSeconds * 1000)) == WAIT_TIMEOUT) {
-        creation->Release();
-        out.Error(L"the OPC server \"" + name + L"\" did not answer within " +
-                  std::to_wstring(static_cast<long>(timeoutSeconds)) + L" s");
-        return kExitNoServer;
+    // server lives; opc gives up after the timeout. A server that was
+    // stopping, or that went away while it was being reached, is asked again
+    // while time is left.
+    const ULONGLONG deadline = GetTickCount64() + static_cast<ULONGLONG>(timeoutSeconds * 1000);
+    for (;;) {
+        ULONGLONG now = GetTickCount64();
+        DWORD left = now < deadline ? static_cast<DWORD>(deadline - now) : 0;
+        hr = CreateOnce(clsid, left, m_server);
+        if (hr == E_PENDING) {
+            out.Error(L"the OPC server \"" + name + L"\" did not answer within " +
+                      std::to_wstring(static_cast<long>(timeoutSeconds)) + L" s");
+            return kExitNoServer;
+        }
+        if (!IsTransient(hr) || GetTickCount64() + kRetryPauseMs >= deadline)
+            break;
+        Sleep(kRetryPauseMs);
     }
-    hr = creation->result;
-    if (SUCCEEDED(hr)) {
-        m_server = ComPtr<IOPCServer>::Attach(creation->server);
-        creation->server = nullptr;
-    }
-    creation->Release();
     if (FAILED(hr)) {
         out.Error(L"cannot reach the OPC server \"" + name + L"\": " + SystemErrorText(hr) + L" (" + HexCode(hr) +
                   L")");

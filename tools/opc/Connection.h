@@ -27,6 +27,13 @@ public:
     // server has none.
     std::wstring Describe(HRESULT code) const;
 
+    // An activation that fails this way is tried again while time is left:
+    // the server was stopping, or went away while it was being reached.
+    static bool IsTransient(HRESULT hr);
+    // True once opc gave up waiting for a creation that is still running:
+    // COM's cleanup would wait for it, so opc must leave without it.
+    static bool CreationAbandoned();
+
 private:
     ComPtr<IOPCServer> m_server;
 };

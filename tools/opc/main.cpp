@@ -192,6 +192,13 @@ int wmain()
     CoInitializeSecurity(nullptr, -1, nullptr, nullptr, RPC_C_AUTHN_LEVEL_NONE, RPC_C_IMP_LEVEL_IDENTIFY, nullptr,
                          EOAC_NONE, nullptr);
     int code = Run();
+    if (Connection::CreationAbandoned()) {
+        // A creation is still waiting for a server that does not answer:
+        // COM's cleanup would wait with it.
+        fflush(stdout);
+        fflush(stderr);
+        TerminateProcess(GetCurrentProcess(), static_cast<UINT>(code));
+    }
     CoUninitialize();
     return code;
 }
