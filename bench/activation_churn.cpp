@@ -93,14 +93,14 @@ struct Totals {
 
 void RunRound(int round, int clients, std::mt19937 &random, Totals &totals)
 {
-    std::wstring eventName = L"activation_churn_" + std::to_wstring(GetCurrentProcessId()) + L"_" +
-                             std::to_wstring(round);
+    std::wstring eventName =
+        L"activation_churn_" + std::to_wstring(GetCurrentProcessId()) + L"_" + std::to_wstring(round);
     UniqueHandle go(CreateEventW(nullptr, TRUE, FALSE, eventName.c_str()));
     std::uniform_int_distribution<int> spread(0, 999);
     std::vector<Client> started;
     for (int i = 0; i < clients; ++i)
-        started.push_back(Start(L"\"" + BesideMe(L"activation_client.exe") + L"\" --event " + eventName +
-                                L" --delay " + std::to_wstring(spread(random))));
+        started.push_back(Start(L"\"" + BesideMe(L"activation_client.exe") + L"\" --event " + eventName + L" --delay " +
+                                std::to_wstring(spread(random))));
     Sleep(300); // every client is waiting for the event
     SetEvent(go.Get());
     int failed = 0, hung = 0;

@@ -300,7 +300,7 @@ private:
     ~COPCGroup() override;
 
     CCriticalSection m_lock{LockOrder::Group}; // guards every field below
-    CGroupActivity m_activity; // client calls, callbacks and work in flight
+    CGroupActivity m_activity;                 // client calls, callbacks and work in flight
     CGroupOwner *m_owner = nullptr;
     CItemTable m_items;
     CActiveItemList m_activeItems;

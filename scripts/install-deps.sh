@@ -1,7 +1,7 @@
 #!/bin/sh
 # Installs the Debian packages the project needs (idempotent).
 set -eu
-PACKAGES="g++-mingw-w64-x86-64-posix mingw-w64-tools binutils-mingw-w64-x86-64 wine64 wine libwine-dev cmake make googletest"
+PACKAGES="g++-mingw-w64-x86-64-posix mingw-w64-tools binutils-mingw-w64-x86-64 wine64 wine libwine-dev cmake make googletest clang-format"
 
 missing=""
 for p in $PACKAGES; do

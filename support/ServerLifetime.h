@@ -85,6 +85,6 @@ private:
     LONG m_count = 0;
     Phase m_phase = Phase::Serving;
     bool m_exitWhenIdle;
-    ULONGLONG m_since; // idle since (serving) or revoked since (draining)
+    ULONGLONG m_since;            // idle since (serving) or revoked since (draining)
     volatile LONG m_draining = 0; // read without the lock on every call
 };

@@ -47,7 +47,10 @@ public:
         return TRUE;
     }
     // For condition variables (entered exactly once by the sleeper).
-    CRITICAL_SECTION *Native() { return &m_cs; }
+    CRITICAL_SECTION *Native()
+    {
+        return &m_cs;
+    }
 
 private:
     CRITICAL_SECTION m_cs;

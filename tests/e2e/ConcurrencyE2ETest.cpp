@@ -30,8 +30,8 @@ const DWORD kServerExitMs = kServerTiming.graceMs + kServerTiming.drainMs + 2000
 std::vector<std::string> RunClients(const std::vector<DWORD> &delaysMs)
 {
     static int round = 0;
-    std::wstring eventName = L"concurrency_e2e_" + std::to_wstring(GetCurrentProcessId()) + L"_" +
-                             std::to_wstring(++round);
+    std::wstring eventName =
+        L"concurrency_e2e_" + std::to_wstring(GetCurrentProcessId()) + L"_" + std::to_wstring(++round);
     UniqueHandle go(CreateEventW(nullptr, TRUE, FALSE, eventName.c_str()));
     std::vector<std::string> outputs(delaysMs.size());
     std::vector<std::thread> threads;
@@ -139,8 +139,8 @@ struct ReentrantClient {
         OPCHANDLE other = 0;
         DWORD rate = 0;
         ComPtr<IUnknown> unknown;
-        addResult = server->AddGroup(L"", FALSE, 1000, 2, nullptr, nullptr, 0, &other, &rate, IID_IUnknown,
-                                     unknown.Out());
+        addResult =
+            server->AddGroup(L"", FALSE, 1000, 2, nullptr, nullptr, 0, &other, &rate, IID_IUnknown, unknown.Out());
         unknown.Reset();
         if (other)
             server->RemoveGroup(other, TRUE);
@@ -234,8 +234,8 @@ TEST_F(ConcurrencyE2E, ACallbackThatCallsTheServerWhileItsGroupIsRemovedNeverFre
             } else {
                 adviseSink.onData = [&client] { client.InsideCallback(); };
                 ASSERT_EQ(client.items.As(data), S_OK);
-                FORMATETC format = {static_cast<CLIPFORMAT>(RegisterClipboardFormatA("OPCSTMFORMATDATATIME")),
-                                    nullptr, DVASPECT_CONTENT, -1, TYMED_HGLOBAL};
+                FORMATETC format = {static_cast<CLIPFORMAT>(RegisterClipboardFormatA("OPCSTMFORMATDATATIME")), nullptr,
+                                    DVASPECT_CONTENT, -1, TYMED_HGLOBAL};
                 ASSERT_EQ(data->DAdvise(&format, 0, &adviseSink, &cookie), S_OK);
             }
             client.armed = true;

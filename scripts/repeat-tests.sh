@@ -1,0 +1,50 @@
+#!/bin/sh
+# Runs the whole test suite N times in a row and prints each run's result and
+# the tests that failed; --load runs a processor hog (one busy process per
+# core) beside every run. The build must exist (./test.sh makes it).
+#
+#   scripts/repeat-tests.sh N [--load]
+#
+# Each run's full output goes to build/repeat-logs/run-K.log.
+set -eu
+ROOT=$(cd "$(dirname "$0")/.." && pwd)
+BUILD_DIR=${BUILD_DIR:-$ROOT/build}
+N=${1:?usage: repeat-tests.sh N [--load]}
+LOAD=${2:-}
+LOGS="$BUILD_DIR/repeat-logs"
+mkdir -p "$LOGS"
+
+hogs=""
+stop_hogs() {
+    for pid in $hogs; do kill "$pid" 2>/dev/null || true; done
+    hogs=""
+}
+trap stop_hogs EXIT INT TERM
+
+passed=0
+failed=0
+k=1
+while [ "$k" -le "$N" ]; do
+    if [ "$LOAD" = "--load" ]; then
+        for _ in $(seq "$(nproc)"); do
+            sh -c 'while :; do :; done' &
+            hogs="$hogs $!"
+        done
+    fi
+    start=$(date +%s)
+    if (cd "$BUILD_DIR" && ctest --output-on-failure -j 2) >"$LOGS/run-$k.log" 2>&1; then
+        result=passed
+        passed=$((passed + 1))
+    else
+        result=FAILED
+        failed=$((failed + 1))
+    fi
+    stop_hogs
+    echo "run $k/$N${LOAD:+ (with load)}: $result in $(($(date +%s) - start)) s"
+    if [ "$result" = FAILED ]; then
+        sed -n '/The following tests FAILED/,$p' "$LOGS/run-$k.log" | sed 's/^/    /'
+    fi
+    k=$((k + 1))
+done
+echo "$N runs${LOAD:+ with load}: $passed passed, $failed failed"
+[ "$failed" -eq 0 ]
