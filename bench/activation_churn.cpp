@@ -13,15 +13,16 @@
 // activations, the clients that hung (no end within a minute), the longest
 // activation, and the server processes left 30 s after the last round.
 // The server must be registered and no other server process running.
+#include "ChildProcess.h"
 #include "Handle.h"
-
-#include <tlhelp32.h>
+#include "ServerProcesses.h"
 
 #include <algorithm>
 #include <cstdio>
 #include <cstdlib>
 #include <random>
 #include <string>
+#include <thread>
 #include <vector>
 
 namespace {
@@ -35,57 +36,6 @@ std::wstring BesideMe(const wchar_t *file)
     return path.substr(0, path.find_last_of(L'\\') + 1) + file;
 }
 
-int ServerProcesses()
-{
-    UniqueHandle snapshot(CreateToolhelp32Snapshot(TH32CS_SNAPPROCESS, 0));
-    PROCESSENTRY32W entry = {};
-    entry.dwSize = sizeof entry;
-    int count = 0;
-    for (BOOL more = Process32FirstW(snapshot.Get(), &entry); more; more = Process32NextW(snapshot.Get(), &entry))
-        if (_wcsicmp(entry.szExeFile, L"Local.exe") == 0)
-            ++count;
-    return count;
-}
-
-struct Client {
-    UniqueHandle process;
-    UniqueHandle output; // read end of its standard output
-};
-
-Client Start(const std::wstring &commandLine)
-{
-    Client c;
-    SECURITY_ATTRIBUTES sa = {sizeof sa, nullptr, TRUE};
-    HANDLE readEnd = nullptr, writeEnd = nullptr;
-    if (!CreatePipe(&readEnd, &writeEnd, &sa, 0))
-        return c;
-    c.output.Reset(readEnd);
-    UniqueHandle writer(writeEnd);
-    SetHandleInformation(readEnd, HANDLE_FLAG_INHERIT, 0);
-    STARTUPINFOW si = {};
-    si.cb = sizeof si;
-    si.dwFlags = STARTF_USESTDHANDLES;
-    si.hStdOutput = writeEnd;
-    si.hStdError = writeEnd;
-    PROCESS_INFORMATION pi = {};
-    std::wstring line = commandLine;
-    if (CreateProcessW(nullptr, line.data(), nullptr, nullptr, TRUE, 0, nullptr, nullptr, &si, &pi)) {
-        c.process.Reset(pi.hProcess);
-        CloseHandle(pi.hThread);
-    }
-    return c;
-}
-
-std::string ReadAll(HANDLE pipe)
-{
-    std::string text;
-    char buffer[256];
-    DWORD got = 0;
-    while (ReadFile(pipe, buffer, sizeof buffer, &got, nullptr) && got)
-        text.append(buffer, got);
-    return text;
-}
-
 struct Totals {
     int started = 0, failed = 0, hung = 0;
     unsigned long long longestMs = 0;
@@ -97,30 +47,29 @@ void RunRound(int round, int clients, std::mt19937 &random, Totals &totals)
         L"activation_churn_" + std::to_wstring(GetCurrentProcessId()) + L"_" + std::to_wstring(round);
     UniqueHandle go(CreateEventW(nullptr, TRUE, FALSE, eventName.c_str()));
     std::uniform_int_distribution<int> spread(0, 999);
-    std::vector<Client> started;
-    for (int i = 0; i < clients; ++i)
-        started.push_back(Start(L"\"" + BesideMe(L"activation_client.exe") + L"\" --event " + eventName + L" --delay " +
-                                std::to_wstring(spread(random))));
+    std::vector<std::string> outputs(clients);
+    std::vector<long> codes(clients, 0);
+    std::vector<std::thread> runners;
+    for (int i = 0; i < clients; ++i) {
+        std::wstring commandLine = L"\"" + BesideMe(L"activation_client.exe") + L"\" --event " + eventName +
+                                   L" --delay " + std::to_wstring(spread(random));
+        runners.emplace_back(
+            [&, i, commandLine] { codes[i] = RunAndCapture(commandLine, outputs[i], kClientTimeoutMs); });
+    }
     Sleep(300); // every client is waiting for the event
     SetEvent(go.Get());
+    for (auto &runner : runners)
+        runner.join();
     int failed = 0, hung = 0;
     unsigned long long longest = 0;
     std::string failures;
-    for (Client &c : started) {
+    for (int i = 0; i < clients; ++i) {
         ++totals.started;
-        if (!c.process) {
-            ++failed;
-            failures += " (not started)";
-            continue;
-        }
-        if (WaitForSingleObject(c.process.Get(), kClientTimeoutMs) != WAIT_OBJECT_0) {
-            ++hung;
-            TerminateProcess(c.process.Get(), 2);
-            continue;
-        }
-        std::string out = ReadAll(c.output.Get());
+        std::string &out = outputs[i];
         unsigned long long ms = 0;
-        if (sscanf(out.c_str(), "ok %llu", &ms) == 1) {
+        if (codes[i] == -1 && out.empty()) {
+            ++hung; // not started, or no end within the time limit
+        } else if (sscanf(out.c_str(), "ok %llu", &ms) == 1) {
             longest = std::max(longest, ms);
         } else {
             ++failed;
@@ -133,7 +82,7 @@ void RunRound(int round, int clients, std::mt19937 &random, Totals &totals)
     totals.hung += hung;
     totals.longestMs = std::max(totals.longestMs, longest);
     printf("round %3d: %d clients, %d failed, %d hung, longest activation %llu ms, server processes %d%s\n", round,
-           clients, failed, hung, longest, ServerProcesses(), failures.c_str());
+           clients, failed, hung, longest, CountServerProcesses(), failures.c_str());
     fflush(stdout);
 }
 
@@ -164,7 +113,7 @@ int wmain(int argc, wchar_t **argv)
         fprintf(stderr, "usage: activation_churn [clients] [rounds]\n");
         return 2;
     }
-    if (ServerProcesses() != 0) {
+    if (CountServerProcesses() != 0) {
         fprintf(stderr, "a server process is running already: stop it first\n");
         return 2;
     }
@@ -179,7 +128,7 @@ int wmain(int argc, wchar_t **argv)
     printf("waiting 30 s for the server to exit...\n");
     fflush(stdout);
     Sleep(30000);
-    int left = ServerProcesses();
+    int left = CountServerProcesses();
     printf("\n%d clients x %d rounds in %.0f s: %d activations, %d failed, %d hung, longest activation %llu ms, "
            "server processes left after 30 s: %d\n",
            clients, rounds, (GetTickCount64() - begin) / 1000.0, totals.started, totals.failed, totals.hung,

@@ -22,6 +22,7 @@
 #include "ComPtr.h"
 #include "Handle.h"
 #include "ItemDefinitions.h"
+#include "ServerProcesses.h"
 #include "opcda.h"
 
 #include <psapi.h>
@@ -93,18 +94,6 @@ bool WriteFile(const std::wstring &path, const std::string &text)
     DWORD written = 0;
     return file && ::WriteFile(file.Get(), text.data(), static_cast<DWORD>(text.size()), &written, nullptr) &&
            written == text.size();
-}
-
-int CountServerProcesses()
-{
-    UniqueHandle snapshot(CreateToolhelp32Snapshot(TH32CS_SNAPPROCESS, 0));
-    PROCESSENTRY32W entry = {};
-    entry.dwSize = sizeof entry;
-    int count = 0;
-    for (BOOL more = Process32FirstW(snapshot.Get(), &entry); more; more = Process32NextW(snapshot.Get(), &entry))
-        if (_wcsicmp(entry.szExeFile, L"Local.exe") == 0)
-            ++count;
-    return count;
 }
 
 UniqueHandle OpenProcessOf(const wchar_t *image)

@@ -92,6 +92,27 @@ TEST_F(ConcurrencyE2E, ClientsRacingForAStoppingServerEachGetIt)
 }
 
 namespace {
+// An active 20 ms group of one item that counts every 10 ms: a callback
+// whenever it is scanned.
+HRESULT AddCountingGroup(IOPCServer *server, const wchar_t *name, OPCHANDLE client, OPCHANDLE &handle,
+                         ComPtr<IOPCItemMgt> &items)
+{
+    DWORD rate = 0;
+    HRESULT hr = server->AddGroup(name, TRUE, 20, client, nullptr, nullptr, 0, &handle, &rate, IID_IOPCItemMgt,
+                                  reinterpret_cast<IUnknown **>(items.Out()));
+    if (FAILED(hr))
+        return hr;
+    OPCITEMDEF def = {};
+    def.szItemID = const_cast<wchar_t *>(L"\\\\.\\proc1\\Counters.fast");
+    def.bActive = TRUE;
+    OPCITEMRESULT *results = nullptr;
+    HRESULT *errors = nullptr;
+    hr = items->AddItems(1, &def, &results, &errors);
+    CoTaskMemFree(results);
+    CoTaskMemFree(errors);
+    return hr;
+}
+
 // A client whose data sink calls the server and the group from inside a
 // callback, while another of its threads removes the group.
 struct ReentrantClient {
@@ -108,18 +129,7 @@ struct ReentrantClient {
         ASSERT_EQ(CoCreateInstance(CLSID_SkylarcOPCServerE2E, nullptr, CLSCTX_LOCAL_SERVER, IID_IOPCServer,
                                    reinterpret_cast<void **>(server.Out())),
                   S_OK);
-        DWORD rate = 0;
-        ASSERT_EQ(server->AddGroup(L"reentrant", TRUE, 20, 1, nullptr, nullptr, 0, &group, &rate, IID_IOPCItemMgt,
-                                   reinterpret_cast<IUnknown **>(items.Out())),
-                  S_OK);
-        OPCITEMDEF def = {};
-        def.szItemID = const_cast<wchar_t *>(L"\\\\.\\proc1\\Counters.fast");
-        def.bActive = TRUE;
-        OPCITEMRESULT *results = nullptr;
-        HRESULT *errors = nullptr;
-        ASSERT_EQ(items->AddItems(1, &def, &results, &errors), S_OK);
-        CoTaskMemFree(results);
-        CoTaskMemFree(errors);
+        ASSERT_EQ(AddCountingGroup(server.Get(), L"reentrant", 1, group, items), S_OK);
     }
 
     // Inside the first callback after arming: tell the remover, give it
@@ -183,11 +193,8 @@ struct ReentrantClient {
 void ExpectServerStillDelivers(IOPCServer *server)
 {
     OPCHANDLE handle = 0;
-    DWORD rate = 0;
     ComPtr<IOPCItemMgt> items;
-    ASSERT_EQ(server->AddGroup(L"after", TRUE, 20, 3, nullptr, nullptr, 0, &handle, &rate, IID_IOPCItemMgt,
-                               reinterpret_cast<IUnknown **>(items.Out())),
-              S_OK);
+    ASSERT_EQ(AddCountingGroup(server, L"after", 3, handle, items), S_OK);
     TestSink sink;
     ComPtr<IConnectionPointContainer> container;
     ComPtr<IConnectionPoint> point;
@@ -195,14 +202,6 @@ void ExpectServerStillDelivers(IOPCServer *server)
     ASSERT_EQ(items.As(container), S_OK);
     ASSERT_EQ(container->FindConnectionPoint(IID_IOPCDataCallback, point.Out()), S_OK);
     ASSERT_EQ(point->Advise(&sink, &cookie), S_OK);
-    OPCITEMDEF def = {};
-    def.szItemID = const_cast<wchar_t *>(L"\\\\.\\proc1\\Counters.fast");
-    def.bActive = TRUE;
-    OPCITEMRESULT *results = nullptr;
-    HRESULT *errors = nullptr;
-    ASSERT_EQ(items->AddItems(1, &def, &results, &errors), S_OK);
-    CoTaskMemFree(results);
-    CoTaskMemFree(errors);
     EXPECT_TRUE(sink.WaitFor([](const std::vector<Callback> &calls) { return calls.size() >= 2; }, 20000))
         << "the server froze";
     point->Unadvise(cookie);

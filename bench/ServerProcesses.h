@@ -1,0 +1,3 @@
+#pragma once
+// The server processes (Local.exe) of this Wine prefix or machine.
+int CountServerProcesses();
