@@ -2,6 +2,7 @@
 // streams (which come from another process and are checked before use), its
 // arguments, and how it shows types, qualities, times and values.
 #include "Arguments.h"
+#include "Connection.h"
 #include "DataStream.h"
 #include "Format.h"
 #include "StreamBuilder.h"
@@ -139,4 +140,14 @@ TEST(OpcClient, ArgumentsAndHowValuesAreShown)
     V_ARRAY(list.Get()) = array;
     EXPECT_EQ(ValueJson(list.Value()), L"[0,10,20]");
     EXPECT_EQ(ValueText(list.Value()), L"[0, 10, 20]");
+}
+
+TEST(OpcClient, OnlyAServerThatStoppedOrVanishedIsAskedAgain)
+{
+    for (HRESULT transient :
+         {CO_E_SERVER_STOPPING, HRESULT_FROM_WIN32(RPC_S_SERVER_UNAVAILABLE), HRESULT_FROM_WIN32(RPC_S_CALL_FAILED),
+          HRESULT_FROM_WIN32(RPC_S_CALL_FAILED_DNE), RPC_E_DISCONNECTED, E_NOINTERFACE})
+        EXPECT_TRUE(Connection::IsTransient(transient)) << std::hex << transient;
+    for (HRESULT final : {S_OK, REGDB_E_CLASSNOTREG, E_ACCESSDENIED, E_OUTOFMEMORY, CO_E_SERVER_EXEC_FAILURE, E_FAIL})
+        EXPECT_FALSE(Connection::IsTransient(final)) << std::hex << final;
 }
