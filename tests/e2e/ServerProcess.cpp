@@ -90,8 +90,28 @@ const bool g_nodeReset = [] {
 
 long RunCadroctl(const std::wstring &arguments, std::string &output)
 {
-    return RunAndCapture(
-        L"\"" + BinPath(L"cadroctl.exe") + L"\" --pid " + std::to_wstring(NodeProcessId()) + L" " + arguments, output);
+    // Without a node to name, cadroctl would reach this test program's own
+    // network instead.
+    DWORD pid = NodeProcessId();
+    if (pid == 0) {
+        output = "no network node runs";
+        return -1;
+    }
+    return RunAndCapture(L"\"" + BinPath(L"cadroctl.exe") + L"\" --pid " + std::to_wstring(pid) + L" " + arguments,
+                         output);
+}
+
+bool EnsureNode(DWORD timeoutMs)
+{
+    if (NodeProcessId() == 0) {
+        // Started as the servers' libraries start it; a second one that
+        // loses the race for the pipe leaves by itself.
+        UniqueHandle node(StartProcess(L"\"" + BinPath(L"cadronode.exe") + L"\""));
+    }
+    for (DWORD waited = 0; waited < timeoutMs; waited += 100, Sleep(100))
+        if (NodeProcessId() != 0)
+            return true;
+    return false;
 }
 
 bool WaitForNoServerProcess(DWORD timeoutMs)

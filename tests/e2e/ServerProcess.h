@@ -17,8 +17,11 @@ int CountProcesses(const wchar_t *image);
 DWORD ServerProcessId();
 DWORD NodeProcessId();
 // Runs cadroctl against the network node only (test programs serve
-// networks of their own too).
+// networks of their own too); -1 when no node runs.
 long RunCadroctl(const std::wstring &arguments, std::string &output);
+// Starts the machine's network node unless one runs; false when none
+// answers within timeoutMs.
+bool EnsureNode(DWORD timeoutMs);
 // Waits up to timeoutMs for no server process to be left.
 bool WaitForNoServerProcess(DWORD timeoutMs);
 bool WaitForNoProcess(const wchar_t *image, DWORD timeoutMs);
