@@ -12,6 +12,9 @@ if [ ! -f "$WINEPREFIX/system.reg" ]; then
     wineserver -w
 fi
 
+# One wineserver for the whole run (ended by prefix-stop.sh): a program that
+# starts just as an idle wineserver leaves can be killed with it.
+wineserver -p || true
 "$RUN" regsvr32 /s "$BUILD_DIR/bin/SkylarcOPCProxy.dll"
 # The executable carries no type library, so "RegServer" writes every record
 # and then exits with the type-library failure; check the records instead.

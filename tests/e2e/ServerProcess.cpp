@@ -79,7 +79,13 @@ class NodeReset : public testing::EmptyTestEventListener {
             RunAndCapture(L"\"" + BinPath(L"cadroctl.exe") + L"\" --pid " + std::to_wstring(pid) + L" reset", output);
         }
     }
-    void OnTestProgramEnd(const testing::UnitTest &) override { CadroSim_StopNode(); }
+    void OnTestProgramEnd(const testing::UnitTest &) override
+    {
+        // A server still in its grace period would start a node again once
+        // this one is gone: the servers go first.
+        WaitForNoServerProcess(30000);
+        CadroSim_StopNode();
+    }
 };
 
 const bool g_nodeReset = [] {
