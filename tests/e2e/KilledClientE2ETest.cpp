@@ -1,8 +1,7 @@
 // A client process killed while the server calls it back. Its references are
 // never released under Wine (Windows collects them after some minutes of
-// missed pings), so the server outlives this test and is ended by it; the
-// class registration it leaves behind makes this the last test of the suite
-// (its own CTest entry).
+// missed pings), so the server outlives this test and is ended by it, and
+// with it the class registration it could not revoke.
 #include "ComPtr.h"
 #include "Handle.h"
 #include "OpcRunner.h"
@@ -39,6 +38,21 @@ TEST(KilledClientE2E, TheServerGoesOnServingOtherClients)
 
     server.Reset();
     UniqueHandle stale(OpenProcess(PROCESS_TERMINATE | SYNCHRONIZE, FALSE, ServerProcessId()));
-    if (stale && WaitForSingleObject(stale.Get(), 2000) == WAIT_TIMEOUT)
+    if (stale && WaitForSingleObject(stale.Get(), 2000) == WAIT_TIMEOUT) {
         TerminateProcess(stale.Get(), 0);
+        WaitForSingleObject(stale.Get(), 10000);
+        // The ended server never revoked its class object, and Wine's rpcss
+        // would hand it out to every later client: a new rpcss, which COM
+        // starts at the next activation, knows nothing of it.
+        UniqueHandle rpcss(OpenProcess(PROCESS_TERMINATE | SYNCHRONIZE, FALSE, ProcessIdOf(L"rpcss.exe")));
+        if (rpcss) {
+            TerminateProcess(rpcss.Get(), 0);
+            WaitForSingleObject(rpcss.Get(), 10000);
+        }
+    }
+    // The prefix is left as later tests need it.
+    ComPtr<IOPCServer> again;
+    EXPECT_EQ(CoCreateInstance(CLSID_SkylarcOPCServerE2E, nullptr, CLSCTX_LOCAL_SERVER, IID_IOPCServer,
+                               reinterpret_cast<void **>(again.Out())),
+              S_OK);
 }

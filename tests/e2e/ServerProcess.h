@@ -15,6 +15,7 @@ int CountProcesses(const wchar_t *image);
 // The id of a running Local.exe, or of the machine's network node, 0 when
 // none.
 DWORD ServerProcessId();
+DWORD ProcessIdOf(const wchar_t *image);
 DWORD NodeProcessId();
 // Runs cadroctl against the network node only (test programs serve
 // networks of their own too); -1 when no node runs.
