@@ -59,7 +59,7 @@ bool CGroupActivity::EnterCall(const LogicalCaller &caller)
 
 void CGroupActivity::LeaveCall(const LogicalCaller &caller)
 {
-    EndCallback(caller, Kind::Call);
+    Remove(caller, Kind::Call);
 }
 
 CGroupActivity::Kind CGroupActivity::BeginCallback(const LogicalCaller &caller)
@@ -73,6 +73,11 @@ CGroupActivity::Kind CGroupActivity::BeginCallback(const LogicalCaller &caller)
 }
 
 void CGroupActivity::EndCallback(const LogicalCaller &caller, Kind kind)
+{
+    Remove(caller, kind);
+}
+
+void CGroupActivity::Remove(const LogicalCaller &caller, Kind kind)
 {
     CSingleLock lock(&m_lock);
     auto it = std::find_if(m_entries.begin(), m_entries.end(),

@@ -73,6 +73,7 @@ private:
         Kind kind;
     };
     LONG Blocking(const LogicalCaller &remover) const;
+    void Remove(const LogicalCaller &caller, Kind kind);
     void Changed();
 
     CCriticalSection m_lock{LockOrder::Activity};

@@ -186,10 +186,7 @@ STDMETHODIMP COPCGroup::GetState(DWORD *pUpdateRate, BOOL *pActive, LPWSTR *ppNa
                                  FLOAT *pPercentDeadband, DWORD *pLCID, OPCHANDLE *phClientGroup,
                                  OPCHANDLE *phServerGroup)
 {
-    return ComBoundary([&]() -> HRESULT {
-        GroupCall call(*this);
-        if (!call)
-            return E_FAIL;
+    return GroupBoundary([&]() -> HRESULT {
         CSingleLock lock(&m_lock);
         if (!IsWritableOut(pUpdateRate) || !IsWritableOut(pActive) || !IsWritableOut(ppName) ||
             !IsWritableOut(pTimeBias) || !IsWritableOut(pPercentDeadband) || !IsWritableOut(pLCID) ||
@@ -210,10 +207,7 @@ STDMETHODIMP COPCGroup::GetState(DWORD *pUpdateRate, BOOL *pActive, LPWSTR *ppNa
 STDMETHODIMP COPCGroup::SetState(DWORD *pRequestedUpdateRate, DWORD *pRevisedUpdateRate, BOOL *pActive, LONG *pTimeBias,
                                  FLOAT *pPercentDeadband, DWORD *pLCID, OPCHANDLE *phClientGroup)
 {
-    return ComBoundary([&]() -> HRESULT {
-        GroupCall call(*this);
-        if (!call)
-            return E_FAIL;
+    return GroupBoundary([&]() -> HRESULT {
         CSingleLock lock(&m_lock);
         if (!IsWritableOut(pRevisedUpdateRate))
             return E_INVALIDARG;
@@ -249,10 +243,7 @@ STDMETHODIMP COPCGroup::SetState(DWORD *pRequestedUpdateRate, DWORD *pRevisedUpd
 
 STDMETHODIMP COPCGroup::SetName(LPCWSTR szName)
 {
-    return ComBoundary([&]() -> HRESULT {
-        GroupCall call(*this);
-        if (!call)
-            return E_FAIL;
+    return GroupBoundary([&]() -> HRESULT {
         CSingleLock lock(&m_lock);
         if (!m_owner)
             return E_FAIL;
@@ -286,10 +277,7 @@ STDMETHODIMP COPCGroup::SetName(LPCWSTR szName)
 
 STDMETHODIMP COPCGroup::CloneGroup(LPCWSTR szName, REFIID riid, LPUNKNOWN *ppUnk)
 {
-    return ComBoundary([&]() -> HRESULT {
-        GroupCall call(*this);
-        if (!call)
-            return E_FAIL;
+    return GroupBoundary([&]() -> HRESULT {
         // The copy of the state is taken under the group lock, which is then
         // released: AddGroup and RemoveGroup take the server lock, which
         // comes before any group lock. The owner is entered while the group

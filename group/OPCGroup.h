@@ -4,6 +4,7 @@
 #include "AdvisoryConnectionMgr.h"
 #include "ComObject.h"
 #include "ComPtr.h"
+#include "ComUtil.h"
 #include "GroupActivity.h"
 #include "GroupOwner.h"
 #include "GroupRegistry.h"
@@ -202,9 +203,18 @@ private:
 
     COPCItem *FindItem(OPCHANDLE handle);
     class ScanColumns;
-    // The one way into the group for a client's call: false once removal
-    // has begun (the method returns E_FAIL); otherwise the call counts as
-    // work in flight until it returns.
+    // The one way into the group for a client's call: every method's body
+    // runs in it, inside the COM boundary. E_FAIL once removal has begun;
+    // otherwise the call counts as work in flight until it returns.
+    template <class Body> HRESULT GroupBoundary(Body body)
+    {
+        return ComBoundary([&]() -> HRESULT {
+            GroupCall call(*this);
+            if (!call)
+                return E_FAIL;
+            return body();
+        });
+    }
     class GroupCall {
     public:
         explicit GroupCall(COPCGroup &group);

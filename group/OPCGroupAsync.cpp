@@ -17,18 +17,12 @@
 
 STDMETHODIMP COPCGroup::FindConnectionPoint(REFIID riid, IConnectionPoint **ppCP)
 {
-    GroupCall call(*this);
-    if (!call)
-        return E_FAIL;
-    return m_callback.Find(riid, ppCP);
+    return GroupBoundary([&]() -> HRESULT { return m_callback.Find(riid, ppCP); });
 }
 
 STDMETHODIMP COPCGroup::EnumConnectionPoints(IEnumConnectionPoints **ppEnum)
 {
-    GroupCall call(*this);
-    if (!call)
-        return E_FAIL;
-    return m_callback.Enumerate(ppEnum);
+    return GroupBoundary([&]() -> HRESULT { return m_callback.Enumerate(ppEnum); });
 }
 
 // ---- IOPCAsyncIO2 ----------------------------------------------------
@@ -113,10 +107,7 @@ HRESULT COPCGroup::CallbackConnection()
 STDMETHODIMP COPCGroup::Read(DWORD dwCount, OPCHANDLE *phServer, DWORD dwTransactionID, DWORD *pdwCancelID,
                              HRESULT **ppErrors)
 {
-    return ComBoundary([&]() -> HRESULT {
-        GroupCall call(*this);
-        if (!call)
-            return E_FAIL;
+    return GroupBoundary([&]() -> HRESULT {
         CSingleLock lock(&m_lock);
         RequestChecks checks;
         checks.connection = CallbackConnection();
@@ -136,10 +127,7 @@ STDMETHODIMP COPCGroup::Read(DWORD dwCount, OPCHANDLE *phServer, DWORD dwTransac
 STDMETHODIMP COPCGroup::Write(DWORD dwCount, OPCHANDLE *phServer, VARIANT *pItemValues, DWORD dwTransactionID,
                               DWORD *pdwCancelID, HRESULT **ppErrors)
 {
-    return ComBoundary([&]() -> HRESULT {
-        GroupCall call(*this);
-        if (!call)
-            return E_FAIL;
+    return GroupBoundary([&]() -> HRESULT {
         CSingleLock lock(&m_lock);
         RequestChecks checks;
         checks.argumentsValid = IsReadableArray(pItemValues, dwCount);
@@ -152,10 +140,7 @@ STDMETHODIMP COPCGroup::Write(DWORD dwCount, OPCHANDLE *phServer, VARIANT *pItem
 
 STDMETHODIMP COPCGroup::Refresh2(OPCDATASOURCE dwSource, DWORD dwTransactionID, DWORD *pdwCancelID)
 {
-    return ComBoundary([&]() -> HRESULT {
-        GroupCall call(*this);
-        if (!call)
-            return E_FAIL;
+    return GroupBoundary([&]() -> HRESULT {
         CSingleLock lock(&m_lock);
         return QueueRefresh(dwSource, CallbackConnection(), pdwCancelID, [&](DWORD id) {
             return std::make_unique<CRefresh2Transaction>(id, this, dwTransactionID, dwSource);
@@ -165,10 +150,7 @@ STDMETHODIMP COPCGroup::Refresh2(OPCDATASOURCE dwSource, DWORD dwTransactionID, 
 
 STDMETHODIMP COPCGroup::Cancel2(DWORD dwCancelID)
 {
-    return ComBoundary([&]() -> HRESULT {
-        GroupCall call(*this);
-        if (!call)
-            return E_FAIL;
+    return GroupBoundary([&]() -> HRESULT {
         // Only a transaction of this group: another group's ids are not
         // this client's to cancel.
         CAsyncIOMgr *manager = CAsyncIOMgr::Instance();
@@ -181,24 +163,24 @@ STDMETHODIMP COPCGroup::Cancel2(DWORD dwCancelID)
 
 STDMETHODIMP COPCGroup::SetEnable(BOOL bEnable)
 {
-    GroupCall call(*this);
-    if (!call)
-        return E_FAIL;
-    CSingleLock lock(&m_lock);
-    if (!m_callback.IsFilled())
-        return CONNECT_E_NOCONNECTION;
-    m_enable = bEnable;
-    return S_OK;
+    return GroupBoundary([&]() -> HRESULT {
+        CSingleLock lock(&m_lock);
+        if (!m_callback.IsFilled())
+            return CONNECT_E_NOCONNECTION;
+        m_enable = bEnable;
+        return S_OK;
+    });
 }
 
 STDMETHODIMP COPCGroup::GetEnable(BOOL *pbEnable)
 {
-    GroupCall call(*this);
-    if (!call || !IsWritableOut(pbEnable))
-        return E_FAIL;
-    CSingleLock lock(&m_lock);
-    *pbEnable = m_enable;
-    return m_callback.IsFilled() ? S_OK : CONNECT_E_NOCONNECTION;
+    return GroupBoundary([&]() -> HRESULT {
+        if (!IsWritableOut(pbEnable))
+            return E_FAIL;
+        CSingleLock lock(&m_lock);
+        *pbEnable = m_enable;
+        return m_callback.IsFilled() ? S_OK : CONNECT_E_NOCONNECTION;
+    });
 }
 
 // ---- Transactions ----------------------------------------------------

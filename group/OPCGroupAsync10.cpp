@@ -37,11 +37,10 @@ HRESULT COPCGroup::SendStreamTo(CSingleLock &lock, const ConnectionList &connect
 {
     CallbackInFlight inFlight(*this);
     lock.Unlock();
-    HRESULT hr = SendStream(memory, [&](STGMEDIUM &m) {
+    return SendStream(memory, [&](STGMEDIUM &m) {
         SendToConnections(connections, m);
         return S_OK;
     });
-    return hr;
 }
 
 HRESULT COPCGroup::NotifyAdviseSinks(CSingleLock &lock, DWORD count, const OPCHANDLE *clients, const VARIANT *values,
@@ -171,10 +170,7 @@ HRESULT COPCGroup::AdviseConnection(DWORD connection, bool write)
 STDMETHODIMP COPCGroup::Read(DWORD dwConnection, OPCDATASOURCE dwSource, DWORD dwCount, OPCHANDLE *phServer,
                              DWORD *pTransactionID, HRESULT **ppErrors)
 {
-    return ComBoundary([&]() -> HRESULT {
-        GroupCall call(*this);
-        if (!call)
-            return E_FAIL;
+    return GroupBoundary([&]() -> HRESULT {
         CSingleLock lock(&m_lock);
         RequestChecks checks;
         checks.argumentsValid = dwSource == OPC_DS_CACHE || dwSource == OPC_DS_DEVICE;
@@ -193,10 +189,7 @@ STDMETHODIMP COPCGroup::Read(DWORD dwConnection, OPCDATASOURCE dwSource, DWORD d
 STDMETHODIMP COPCGroup::Write(DWORD dwConnection, DWORD dwCount, OPCHANDLE *phServer, VARIANT *pItemValues,
                               DWORD *pTransactionID, HRESULT **ppErrors)
 {
-    return ComBoundary([&]() -> HRESULT {
-        GroupCall call(*this);
-        if (!call)
-            return E_FAIL;
+    return GroupBoundary([&]() -> HRESULT {
         CSingleLock lock(&m_lock);
         RequestChecks checks;
         checks.argumentsValid = IsReadableArray(pItemValues, dwCount);
@@ -209,10 +202,7 @@ STDMETHODIMP COPCGroup::Write(DWORD dwConnection, DWORD dwCount, OPCHANDLE *phSe
 
 STDMETHODIMP COPCGroup::Refresh(DWORD dwConnection, OPCDATASOURCE dwSource, DWORD *pTransactionID)
 {
-    return ComBoundary([&]() -> HRESULT {
-        GroupCall call(*this);
-        if (!call)
-            return E_FAIL;
+    return GroupBoundary([&]() -> HRESULT {
         CSingleLock lock(&m_lock);
         return QueueRefresh(dwSource, AdviseConnection(dwConnection, false), pTransactionID, [&](DWORD id) {
             return std::make_unique<CRefreshTransaction>(id, this, dwConnection, dwSource);
@@ -229,10 +219,7 @@ STDMETHODIMP COPCGroup::Cancel(DWORD dwTransactionID)
 
 STDMETHODIMP COPCGroup::DAdvise(FORMATETC *pformatetc, DWORD advf, IAdviseSink *pAdvSink, DWORD *pdwConnection)
 {
-    return ComBoundary([&]() -> HRESULT {
-        GroupCall call(*this);
-        if (!call)
-            return E_FAIL;
+    return GroupBoundary([&]() -> HRESULT {
         // Null pointers are refused rather than followed.
         if (!pformatetc || !pAdvSink || !IsWritableOut(pdwConnection))
             return E_INVALIDARG;
@@ -260,27 +247,26 @@ STDMETHODIMP COPCGroup::DAdvise(FORMATETC *pformatetc, DWORD advf, IAdviseSink *
 
 STDMETHODIMP COPCGroup::DUnadvise(DWORD dwConnection)
 {
-    GroupCall call(*this);
-    if (!call)
+    return GroupBoundary([&]() -> HRESULT {
+        // Each list has a lock of its own; the group lock is not taken, so
+        // that the client's sink is released with no lock of the group held.
+        for (CAdvisoryConnectionMgr *manager : {&m_dataTimeAdvise, &m_dataAdvise, &m_writeAdvise})
+            if (manager->Remove(dwConnection) == S_OK)
+                return S_OK;
         return E_FAIL;
-    CSingleLock lock(&m_lock);
-    for (CAdvisoryConnectionMgr *manager : {&m_dataTimeAdvise, &m_dataAdvise, &m_writeAdvise})
-        if (manager->Remove(dwConnection) == S_OK)
-            return S_OK;
-    return E_FAIL;
+    });
 }
 
 STDMETHODIMP COPCGroup::QueryGetData(FORMATETC *f)
 {
-    GroupCall call(*this);
-    if (!call)
-        return E_FAIL;
-    if (!f)
-        return DV_E_FORMATETC;
-    CLIPFORMAT cf = f->cfFormat;
-    if (cf != OpcStreams::Data() && cf != OpcStreams::DataTime() && cf != OpcStreams::WriteComplete())
-        return DV_E_FORMATETC;
-    if (f->dwAspect != DVASPECT_CONTENT || f->ptd || f->tymed != TYMED_HGLOBAL)
-        return DV_E_FORMATETC;
-    return f->lindex == -1 ? S_OK : DV_E_LINDEX;
+    return GroupBoundary([&]() -> HRESULT {
+        if (!f)
+            return DV_E_FORMATETC;
+        CLIPFORMAT cf = f->cfFormat;
+        if (cf != OpcStreams::Data() && cf != OpcStreams::DataTime() && cf != OpcStreams::WriteComplete())
+            return DV_E_FORMATETC;
+        if (f->dwAspect != DVASPECT_CONTENT || f->ptd || f->tymed != TYMED_HGLOBAL)
+            return DV_E_FORMATETC;
+        return f->lindex == -1 ? S_OK : DV_E_LINDEX;
+    });
 }

@@ -68,10 +68,7 @@ HRESULT COPCGroup::BeginItemDefinitions(DWORD count, const OPCITEMDEF *items, OP
 STDMETHODIMP COPCGroup::AddItems(DWORD dwCount, OPCITEMDEF *pItemArray, OPCITEMRESULT **ppAddResults,
                                  HRESULT **ppErrors)
 {
-    return ComBoundary([&]() -> HRESULT {
-        GroupCall call(*this);
-        if (!call)
-            return E_FAIL;
+    return GroupBoundary([&]() -> HRESULT {
         CCallPass pass; // each node is read from the network once per call
         CSingleLock lock(&m_lock);
         TaskMem<OPCITEMRESULT> results;
@@ -127,10 +124,7 @@ HRESULT COPCGroup::AddItemsLocked(DWORD count, const OPCITEMDEF *items, OPCITEMR
 STDMETHODIMP COPCGroup::ValidateItems(DWORD dwCount, OPCITEMDEF *pItemArray, BOOL, OPCITEMRESULT **ppValidationResults,
                                       HRESULT **ppErrors)
 {
-    return ComBoundary([&]() -> HRESULT {
-        GroupCall call(*this);
-        if (!call)
-            return E_FAIL;
+    return GroupBoundary([&]() -> HRESULT {
         CCallPass pass; // each node is read from the network once per call
         CSingleLock lock(&m_lock);
         TaskMem<OPCITEMRESULT> results;
@@ -171,10 +165,7 @@ STDMETHODIMP COPCGroup::ValidateItems(DWORD dwCount, OPCITEMDEF *pItemArray, BOO
 
 STDMETHODIMP COPCGroup::RemoveItems(DWORD dwCount, OPCHANDLE *phServer, HRESULT **ppErrors)
 {
-    return ComBoundary([&]() -> HRESULT {
-        GroupCall call(*this);
-        if (!call)
-            return E_FAIL;
+    return GroupBoundary([&]() -> HRESULT {
         return ForEachHandle(dwCount, phServer, ppErrors, [this](DWORD, COPCItem &item) -> HRESULT {
             if (!m_items.Erase(item.ServerHandle())) {
                 INTERNAL_ASSERT_FAILED("item erase");
@@ -187,10 +178,7 @@ STDMETHODIMP COPCGroup::RemoveItems(DWORD dwCount, OPCHANDLE *phServer, HRESULT 
 
 STDMETHODIMP COPCGroup::SetActiveState(DWORD dwCount, OPCHANDLE *phServer, BOOL bActive, HRESULT **ppErrors)
 {
-    return ComBoundary([&]() -> HRESULT {
-        GroupCall call(*this);
-        if (!call)
-            return E_FAIL;
+    return GroupBoundary([&]() -> HRESULT {
         return ForEachHandle(dwCount, phServer, ppErrors,
                              [bActive](DWORD, COPCItem &item) { return item.SetActive(bActive ? TRUE : FALSE); });
     });
@@ -198,10 +186,7 @@ STDMETHODIMP COPCGroup::SetActiveState(DWORD dwCount, OPCHANDLE *phServer, BOOL 
 
 STDMETHODIMP COPCGroup::SetClientHandles(DWORD dwCount, OPCHANDLE *phServer, OPCHANDLE *phClient, HRESULT **ppErrors)
 {
-    return ComBoundary([&]() -> HRESULT {
-        GroupCall call(*this);
-        if (!call)
-            return E_FAIL;
+    return GroupBoundary([&]() -> HRESULT {
         if (!IsReadableArray(phClient, dwCount) && IsWritableOut(ppErrors)) {
             *ppErrors = nullptr;
             return E_INVALIDARG;
@@ -216,10 +201,7 @@ STDMETHODIMP COPCGroup::SetClientHandles(DWORD dwCount, OPCHANDLE *phServer, OPC
 STDMETHODIMP COPCGroup::SetDatatypes(DWORD dwCount, OPCHANDLE *phServer, VARTYPE *pRequestedDatatypes,
                                      HRESULT **ppErrors)
 {
-    return ComBoundary([&]() -> HRESULT {
-        GroupCall call(*this);
-        if (!call)
-            return E_FAIL;
+    return GroupBoundary([&]() -> HRESULT {
         if (!IsReadableArray(pRequestedDatatypes, dwCount) && IsWritableOut(ppErrors)) {
             *ppErrors = nullptr;
             return E_INVALIDARG;
@@ -233,10 +215,7 @@ STDMETHODIMP COPCGroup::SetDatatypes(DWORD dwCount, OPCHANDLE *phServer, VARTYPE
 
 STDMETHODIMP COPCGroup::CreateEnumerator(REFIID riid, LPUNKNOWN *ppUnk)
 {
-    return ComBoundary([&]() -> HRESULT {
-        GroupCall call(*this);
-        if (!call)
-            return E_FAIL;
+    return GroupBoundary([&]() -> HRESULT {
         CSingleLock lock(&m_lock);
         if (!IsWritableOut(ppUnk))
             return E_INVALIDARG;

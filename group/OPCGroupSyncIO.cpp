@@ -57,10 +57,7 @@ void COPCGroup::WritePass(const std::vector<OPCHANDLE> &handles, const std::vect
 STDMETHODIMP COPCGroup::Read(OPCDATASOURCE dwSource, DWORD dwCount, OPCHANDLE *phServer, OPCITEMSTATE **ppItemValues,
                              HRESULT **ppErrors)
 {
-    return ComBoundary([&]() -> HRESULT {
-        GroupCall call(*this);
-        if (!call)
-            return E_FAIL;
+    return GroupBoundary([&]() -> HRESULT {
         CSingleLock lock(&m_lock);
         if (!IsWritableOut(ppItemValues) || !IsWritableOut(ppErrors))
             return E_INVALIDARG;
@@ -90,10 +87,7 @@ STDMETHODIMP COPCGroup::Read(OPCDATASOURCE dwSource, DWORD dwCount, OPCHANDLE *p
 
 STDMETHODIMP COPCGroup::Write(DWORD dwCount, OPCHANDLE *phServer, VARIANT *pItemValues, HRESULT **ppErrors)
 {
-    return ComBoundary([&]() -> HRESULT {
-        GroupCall call(*this);
-        if (!call)
-            return E_FAIL;
+    return GroupBoundary([&]() -> HRESULT {
         CSingleLock lock(&m_lock);
         if (!IsWritableOut(ppErrors))
             return E_INVALIDARG;

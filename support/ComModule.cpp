@@ -9,32 +9,36 @@ std::atomic<LONG> g_lockCount{0};
 std::atomic<CServerLifetime *> g_lifetime{nullptr};
 } // namespace
 
+// The count is the lifetime's when the process has one; only programs
+// without one (tests) count here.
 void ComModule::Lock()
 {
-    ++g_lockCount;
     if (CServerLifetime *lifetime = g_lifetime.load())
         lifetime->Lock();
+    else
+        ++g_lockCount;
 }
 
 bool ComModule::TryLock()
 {
-    CServerLifetime *lifetime = g_lifetime.load();
-    if (lifetime && !lifetime->TryLock())
-        return false;
+    if (CServerLifetime *lifetime = g_lifetime.load())
+        return lifetime->TryLock();
     ++g_lockCount;
     return true;
 }
 
 void ComModule::Unlock()
 {
-    --g_lockCount;
     if (CServerLifetime *lifetime = g_lifetime.load())
         lifetime->Unlock();
+    else
+        --g_lockCount;
 }
 
 LONG ComModule::LockCount()
 {
-    return g_lockCount.load();
+    CServerLifetime *lifetime = g_lifetime.load();
+    return lifetime ? lifetime->Count() : g_lockCount.load();
 }
 
 void ComModule::SetLifetime(CServerLifetime *lifetime)

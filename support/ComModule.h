@@ -14,6 +14,6 @@ void Unlock();
 // exit (the caller answers CO_E_SERVER_STOPPING).
 bool TryLock();
 LONG LockCount();
-// The lifetime that the count drives; null detaches it.
+// The lifetime that holds the count, set once before any object exists.
 void SetLifetime(CServerLifetime *lifetime);
 } // namespace ComModule

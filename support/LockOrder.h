@@ -14,8 +14,9 @@
 //     Connections    a list of DA 1.0 advise connections,
 //     SinkSlot       a connection point's one sink
 //   5 Activity       a group's calls, callbacks and work in flight
-//   6 Leaf           locks that call nothing while held (identifiers, the
-//                    server's last update time, the callbacks in flight)
+//   6 Leaf           locks under which no other lock of the server is taken
+//                    (identifiers, the server's last update time, the
+//                    callbacks in flight, the process's lifetime)
 //
 // The locks of the item side (items, the real-time client, the address
 // space) are taken under a group lock and take none of these.

@@ -59,7 +59,7 @@ void CServerLifetime::IncomingCall()
 {
     // Every call of every client passes here: a word is read, nothing more,
     // unless the class object has just been revoked.
-    if (InterlockedCompareExchange(&m_draining, 0, 0) == 0)
+    if (m_phase.load(std::memory_order_acquire) != Phase::Draining)
         return;
     CSingleLock lock(&m_lock);
     if (m_phase == Phase::Draining)
@@ -73,7 +73,6 @@ void CServerLifetime::Restore()
     if (FAILED(m_registration.Register()))
         INTERNAL_ASSERT_FAILED("registering the class object again");
     m_phase = Phase::Serving;
-    InterlockedExchange(&m_draining, 0);
     m_since = m_timing.now();
     Wake();
 }
@@ -93,7 +92,6 @@ CServerLifetime::Phase CServerLifetime::Advance(DWORD &waitMs)
         }
         m_registration.Revoke();
         m_phase = Phase::Draining;
-        InterlockedExchange(&m_draining, 1);
         m_since = now;
         waitMs = m_timing.drainMs;
         break;
@@ -107,7 +105,6 @@ CServerLifetime::Phase CServerLifetime::Advance(DWORD &waitMs)
             break;
         }
         m_phase = Phase::Stopped;
-        InterlockedExchange(&m_draining, 0);
         break;
     case Phase::Stopped:
         break;

@@ -31,6 +31,8 @@
 
 #include <windows.h>
 
+#include <atomic>
+
 // What the lifetime does to the class object.
 class CClassRegistration {
 public:
@@ -81,10 +83,9 @@ private:
     CClassRegistration &m_registration;
     const Timing m_timing;
     UniqueHandle m_wake;
-    CCriticalSection m_lock{LockOrder::Leaf};
+    CCriticalSection m_lock{LockOrder::Leaf}; // the registration is called under it
     LONG m_count = 0;
-    Phase m_phase = Phase::Serving;
+    std::atomic<Phase> m_phase{Phase::Serving}; // changed under the lock; read without it by IncomingCall
     bool m_exitWhenIdle;
-    ULONGLONG m_since;            // idle since (serving) or revoked since (draining)
-    volatile LONG m_draining = 0; // read without the lock on every call
+    ULONGLONG m_since; // idle since (serving) or revoked since (draining)
 };
