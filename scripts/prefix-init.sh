@@ -13,9 +13,12 @@ if [ ! -f "$WINEPREFIX/system.reg" ]; then
 fi
 
 # One wineserver for the whole run (ended by prefix-stop.sh): a program that
-# starts just as an idle wineserver leaves can be killed with it. Its output
-# goes nowhere: a runner that captures this script would wait for it.
+# starts just as an idle wineserver leaves can be killed with it. It and the
+# prefix's system processes (started with the first program) stay, so they
+# are given no output to hold: a runner that captures the output of this
+# script, or of a test, would wait for them.
 wineserver -p </dev/null >/dev/null 2>&1 || true
+"$RUN" cmd /c exit </dev/null >/dev/null 2>&1 || true
 "$RUN" regsvr32 /s "$BUILD_DIR/bin/SkylarcOPCProxy.dll"
 # The executable carries no type library, so "RegServer" writes every record
 # and then exits with the type-library failure; check the records instead.
