@@ -1,6 +1,6 @@
 #!/bin/sh
 # Creates the build's private Wine prefix (once) and registers the proxy/stub
-# DLL and the server in it. Usage: prefix-init.sh BUILD_DIR
+# DLL, the server and the server list in it. Usage: prefix-init.sh BUILD_DIR
 set -eu
 BUILD_DIR=$(cd "$1" && pwd)
 RUN="$BUILD_DIR/wine-run.sh"
@@ -27,4 +27,11 @@ wineserver -p </dev/null >/dev/null 2>&1 || true
     echo "prefix-init: the server did not register" >&2
     exit 1
 }
-echo "Server and proxy/stub registered in $WINEPREFIX"
+# The server list registers itself only where no other server list is (exit
+# code 1 then); the prefix's own list is this one.
+"$RUN" "$BUILD_DIR/bin/SkylarcServerList.exe" /RegServer || true
+"$RUN" reg query 'HKCR\CLSID\{13486D51-4821-11D2-A494-3CB306C10000}\LocalServer32' >/dev/null 2>&1 || {
+    echo "prefix-init: the server list did not register" >&2
+    exit 1
+}
+echo "Server, server list and proxy/stub registered in $WINEPREFIX"

@@ -1,5 +1,5 @@
 #pragma once
-// Vector enumerator for IEnumUnknown and IEnumString. The owner holds the
+// Vector enumerator for IEnumUnknown, IEnumString and the like. The owner holds the
 // snapshot array; clones share it and keep the owner alive with a reference.
 #include "ComObject.h"
 #include "ComPtr.h"
@@ -18,6 +18,7 @@
 template <class I> struct EnumCopyInterface {
     using Item = I *;
     static constexpr bool kEmptyFails = true;
+    static constexpr bool kZeroNeedsNoArray = false;
     static bool Copy(Item &to, Item from)
     {
         to = from;
@@ -37,6 +38,7 @@ using EnumCopyUnknown = EnumCopyInterface<IUnknown>;
 struct EnumCopyConnection {
     using Item = CONNECTDATA;
     static constexpr bool kEmptyFails = false;
+    static constexpr bool kZeroNeedsNoArray = false;
     static bool Copy(Item &to, const Item &from)
     {
         to = from;
@@ -54,12 +56,27 @@ struct EnumCopyConnection {
 struct EnumCopyString {
     using Item = LPOLESTR;
     static constexpr bool kEmptyFails = true;
+    static constexpr bool kZeroNeedsNoArray = false;
     static bool Copy(Item &to, Item from)
     {
         to = from ? TaskStrDup(from) : nullptr;
         return to != nullptr || from == nullptr;
     }
     static void Destroy(Item item) { CoTaskMemFree(item); }
+};
+
+// Plain values (GUIDs), copied as they are; an empty enumerator just runs out.
+// A request for no element needs no array: a proxy sends none for it.
+template <class T> struct EnumCopyValue {
+    using Item = T;
+    static constexpr bool kEmptyFails = false;
+    static constexpr bool kZeroNeedsNoArray = true;
+    static bool Copy(Item &to, const Item &from)
+    {
+        to = from;
+        return true;
+    }
+    static void Destroy(const Item &) {}
 };
 
 template <class Interface, class Policy> class CComEnum2 : public CComObjectRoot, public Interface {
@@ -87,6 +104,8 @@ public:
     {
         if (pceltFetched)
             *pceltFetched = 0;
+        if (celt == 0 && Policy::kZeroNeedsNoArray)
+            return S_OK;
         if (!rgelt || (celt != 1 && !pceltFetched))
             return E_POINTER;
         CSingleLock lock(&m_lock);

@@ -25,6 +25,8 @@ protected:
     {
         server.Reset();
         EXPECT_TRUE(WaitForNoServerProcess(20000)) << "the server did not exit";
+        // opc servers asks the server list, a process of its own.
+        EXPECT_TRUE(WaitForNoProcess(L"SkylarcServerList.exe", 20000)) << "the server list did not exit";
     }
     ComPtr<IOPCServer> server;
 };

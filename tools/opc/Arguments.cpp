@@ -22,9 +22,9 @@ std::wstring LongName(const std::wstring &option)
 
 const std::vector<std::wstring> &Arguments::ValueOptions()
 {
-    static const std::vector<std::wstring> options = {L"server",   L"source",   L"type",   L"rate",
-                                                      L"duration", L"count",    L"filter", L"access",
-                                                      L"depth",    L"deadband", L"timeout"};
+    static const std::vector<std::wstring> options = {L"server",   L"source",   L"type",    L"rate",
+                                                      L"duration", L"count",    L"filter",  L"access",
+                                                      L"depth",    L"deadband", L"timeout", L"host"};
     return options;
 }
 

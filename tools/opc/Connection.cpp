@@ -10,25 +10,29 @@
 const wchar_t Connection::kDefaultServer[] = L"Tarnwell.SkylarcOPCServer";
 
 namespace {
-// The creation of a server on a thread of its own, so that the caller can
+// The creation of an object on a thread of its own, so that the caller can
 // give up waiting. Shared with that thread, which may outlive the wait.
 struct Creation {
     CLSID clsid;
-    IOPCServer *server = nullptr;
+    IID iid;
+    std::wstring host; // empty: this machine
+    IUnknown *object = nullptr;
     HRESULT result = E_PENDING;
     std::atomic<long> refs{2}; // the caller's and the thread's
 
-    static Creation *New(const CLSID &clsid)
+    static Creation *New(const CLSID &clsid, REFIID iid, const std::wstring &host)
     {
         auto *creation = new Creation();
         creation->clsid = clsid;
+        creation->iid = iid;
+        creation->host = host;
         return creation;
     }
     void Release()
     {
         if (--refs == 0) {
-            if (server)
-                server->Release();
+            if (object)
+                object->Release();
             delete this;
         }
     }
@@ -36,8 +40,17 @@ struct Creation {
     {
         auto *self = static_cast<Creation *>(context);
         CoInitializeEx(nullptr, COINIT_MULTITHREADED);
-        self->result = CoCreateInstance(self->clsid, nullptr, CLSCTX_LOCAL_SERVER, IID_IOPCServer,
-                                        reinterpret_cast<void **>(&self->server));
+        COSERVERINFO server = {};
+        server.pwszName = const_cast<wchar_t *>(self->host.c_str());
+        MULTI_QI query = {&self->iid, nullptr, S_OK};
+        bool remote = !self->host.empty();
+        self->result = CoCreateInstanceEx(self->clsid, nullptr, remote ? CLSCTX_REMOTE_SERVER : CLSCTX_LOCAL_SERVER,
+                                          remote ? &server : nullptr, 1, &query);
+        if (SUCCEEDED(self->result))
+            self->result = query.hr;
+        self->object = SUCCEEDED(self->result) ? query.pItf : nullptr;
+        if (FAILED(self->result) && query.pItf)
+            query.pItf->Release();
         CoUninitialize(); // the pointer lives on in the process's apartment
         self->Release();
         return 0;
@@ -51,9 +64,9 @@ constexpr DWORD kRetryPauseMs = 200;
 
 // One activation on a thread of its own; E_PENDING when it has not ended
 // within waitMs (it is left to finish or fail on its own).
-HRESULT CreateOnce(const CLSID &clsid, DWORD waitMs, ComPtr<IOPCServer> &server)
+HRESULT CreateOnce(const CLSID &clsid, REFIID iid, const std::wstring &host, DWORD waitMs, ComPtr<IUnknown> &object)
 {
-    Creation *creation = Creation::New(clsid);
+    Creation *creation = Creation::New(clsid, iid, host);
     UniqueHandle thread(CreateThread(nullptr, 0, Creation::Run, creation, 0, nullptr));
     if (!thread) {
         Creation::Run(creation); // gives back the thread's reference only
@@ -64,13 +77,31 @@ HRESULT CreateOnce(const CLSID &clsid, DWORD waitMs, ComPtr<IOPCServer> &server)
     }
     HRESULT hr = creation->result;
     if (SUCCEEDED(hr)) {
-        server = ComPtr<IOPCServer>::Attach(creation->server);
-        creation->server = nullptr;
+        object = ComPtr<IUnknown>::Attach(creation->object);
+        creation->object = nullptr;
     }
     creation->Release();
     return hr;
 }
 } // namespace
+
+HRESULT CreateOutOfProcess(const CLSID &clsid, REFIID iid, const std::wstring &host, double timeoutSeconds,
+                           ComPtr<IUnknown> &object)
+{
+    // COM waits for a server that hangs while it starts as long as the
+    // server lives; opc gives up after the timeout. A server that was
+    // stopping, or that went away while it was being reached, is asked again
+    // while time is left.
+    const ULONGLONG deadline = GetTickCount64() + static_cast<ULONGLONG>(timeoutSeconds * 1000);
+    for (;;) {
+        ULONGLONG now = GetTickCount64();
+        DWORD left = now < deadline ? static_cast<DWORD>(deadline - now) : 0;
+        HRESULT hr = CreateOnce(clsid, iid, host, left, object);
+        if (hr == E_PENDING || !Connection::IsTransient(hr) || GetTickCount64() + kRetryPauseMs >= deadline)
+            return hr;
+        Sleep(kRetryPauseMs);
+    }
+}
 
 bool Connection::IsTransient(HRESULT hr)
 {
@@ -101,24 +132,15 @@ int Connection::Open(const std::wstring &name, double timeoutSeconds, Output &ou
         out.Error(L"no OPC server is registered as \"" + name + L"\"");
         return kExitNoServer;
     }
-    // COM waits for a server that hangs while it starts as long as the
-    // server lives; opc gives up after the timeout. A server that was
-    // stopping, or that went away while it was being reached, is asked again
-    // while time is left.
-    const ULONGLONG deadline = GetTickCount64() + static_cast<ULONGLONG>(timeoutSeconds * 1000);
-    for (;;) {
-        ULONGLONG now = GetTickCount64();
-        DWORD left = now < deadline ? static_cast<DWORD>(deadline - now) : 0;
-        hr = CreateOnce(clsid, left, m_server);
-        if (hr == E_PENDING) {
-            out.Error(L"the OPC server \"" + name + L"\" did not answer within " +
-                      std::to_wstring(static_cast<long>(timeoutSeconds)) + L" s");
-            return kExitNoServer;
-        }
-        if (!IsTransient(hr) || GetTickCount64() + kRetryPauseMs >= deadline)
-            break;
-        Sleep(kRetryPauseMs);
+    ComPtr<IUnknown> object;
+    hr = CreateOutOfProcess(clsid, IID_IOPCServer, L"", timeoutSeconds, object);
+    if (hr == E_PENDING) {
+        out.Error(L"the OPC server \"" + name + L"\" did not answer within " +
+                  std::to_wstring(static_cast<long>(timeoutSeconds)) + L" s");
+        return kExitNoServer;
     }
+    if (SUCCEEDED(hr))
+        hr = object.As(m_server);
     if (FAILED(hr)) {
         out.Error(L"cannot reach the OPC server \"" + name + L"\": " + SystemErrorText(hr) + L" (" + HexCode(hr) +
                   L")");

@@ -38,6 +38,13 @@ private:
     ComPtr<IOPCServer> m_server;
 };
 
+// Creates clsid out of process, on host (this machine when empty), and asks
+// it for iid; an activation that fails with a transient code (IsTransient)
+// is tried again while time is left. E_PENDING when a creation has not
+// ended within the timeout.
+HRESULT CreateOutOfProcess(const CLSID &clsid, REFIID iid, const std::wstring &host, double timeoutSeconds,
+                           ComPtr<IUnknown> &object);
+
 // The system's text for an error code, or empty.
 std::wstring SystemErrorText(HRESULT code);
 

@@ -1,7 +1,11 @@
-// opc servers: the OPC DA servers registered on this machine, found through
-// the component categories and through the OPC key of their ProgIDs.
+// opc servers: the OPC DA servers registered on a machine. They are asked of
+// the machine's server list object when one is registered (always for
+// another machine); without one, this machine's component categories and the
+// OPC keys of its ProgIDs are read here.
 #include "Commands.h"
 #include "Format.h"
+#include "ServerListIds.h"
+#include "opccomn.h"
 
 #include <comcat.h>
 
@@ -16,6 +20,7 @@ struct ServerEntry {
     std::wstring progId, vendor, description;
     bool da10 = false, da20 = false;
 };
+using ServerMap = std::map<std::wstring, ServerEntry>;
 
 std::wstring GuidText(const GUID &guid)
 {
@@ -33,7 +38,7 @@ std::wstring ReadText(const std::wstring &path)
     return data;
 }
 
-void AddCategory(ICatInformation *categories, const CATID &category, std::map<std::wstring, ServerEntry> &found)
+void AddCategory(ICatInformation *categories, const CATID &category, ServerMap &found)
 {
     ComPtr<IEnumCLSID> classes;
     CATID wanted = category;
@@ -49,7 +54,7 @@ void AddCategory(ICatInformation *categories, const CATID &category, std::map<st
 }
 
 // ProgIDs with an OPC key: the DA 1.0 way of saying "I am an OPC server".
-void AddProgIdKeys(std::map<std::wstring, ServerEntry> &found)
+void AddProgIdKeys(ServerMap &found)
 {
     wchar_t name[256];
     for (DWORD i = 0;; ++i) {
@@ -70,26 +75,20 @@ void AddProgIdKeys(std::map<std::wstring, ServerEntry> &found)
     }
 }
 
-void Describe(const std::wstring &clsid, ServerEntry &entry)
+// The names of a class; the vendor only where this machine's registry has
+// it (the list does not tell it).
+void Describe(ServerEntry &entry, const std::wstring &versioned, const std::wstring &independent,
+              const std::wstring &userType, bool local)
 {
-    std::wstring key = L"CLSID\\" + clsid;
-    entry.description = ReadText(key);
-    std::wstring independent = ReadText(key + L"\\VersionIndependentProgID");
-    std::wstring versioned = ReadText(key + L"\\ProgID");
+    entry.description = userType;
     entry.progId = !independent.empty() ? independent : versioned;
     for (const std::wstring &id : {independent, versioned})
-        if (entry.vendor.empty() && !id.empty())
+        if (local && entry.vendor.empty() && !id.empty())
             entry.vendor = ReadText(id + L"\\OPC\\Vendor");
 }
-} // namespace
 
-int ListServers(const Arguments &args, Output &out)
+void FromRegistry(ServerMap &found)
 {
-    if (!args.Positional().empty()) {
-        out.Error(L"servers takes no arguments");
-        return kExitUsage;
-    }
-    std::map<std::wstring, ServerEntry> found;
     ComPtr<ICatInformation> categories;
     if (SUCCEEDED(CoCreateInstance(CLSID_StdComponentCategoriesMgr, nullptr, CLSCTX_INPROC_SERVER, IID_ICatInformation,
                                    reinterpret_cast<void **>(categories.Out())))) {
@@ -97,12 +96,107 @@ int ListServers(const Arguments &args, Output &out)
         AddCategory(categories.Get(), kDa20, found);
     }
     AddProgIdKeys(found);
+    for (auto &pair : found) {
+        std::wstring key = L"CLSID\\" + pair.first;
+        Describe(pair.second, ReadText(key + L"\\ProgID"), ReadText(key + L"\\VersionIndependentProgID"), ReadText(key),
+                 true);
+    }
+}
 
+// Takes over a string the list allocated.
+std::wstring TakeString(LPOLESTR text)
+{
+    std::wstring copy = text ? text : L"";
+    CoTaskMemFree(text);
+    return copy;
+}
+
+template <class Enumerator> HRESULT AddClasses(Enumerator *classes, const CATID &category, ServerMap &found)
+{
+    CLSID batch[64];
+    for (;;) {
+        ULONG fetched = 0;
+        HRESULT hr = classes->Next(64, batch, &fetched);
+        if (FAILED(hr))
+            return hr;
+        for (ULONG i = 0; i < fetched && i < 64; ++i) {
+            ServerEntry &entry = found[GuidText(batch[i])];
+            (IsEqualGUID(category, kDa10) ? entry.da10 : entry.da20) = true;
+        }
+        if (hr != S_OK || fetched == 0)
+            return S_OK;
+    }
+}
+
+// Through IOPCServerList2 when the list has it, else through IOPCServerList.
+HRESULT FromServerList(IUnknown *list, bool local, ServerMap &found)
+{
+    ComPtr<IOPCServerList2> list2;
+    ComPtr<IOPCServerList> list1;
+    ComPtr<IUnknown>(list).As(list2);
+    if (!list2 && FAILED(ComPtr<IUnknown>(list).As(list1)))
+        return E_NOINTERFACE;
+    for (const CATID &category : {kDa10, kDa20}) {
+        CATID wanted = category;
+        HRESULT hr;
+        if (list2) {
+            ComPtr<IOPCEnumGUID> classes;
+            hr = list2->EnumClassesOfCategories(1, &wanted, 0, nullptr, classes.Out());
+            if (SUCCEEDED(hr) && classes)
+                hr = AddClasses(classes.Get(), category, found);
+        } else {
+            ComPtr<IEnumGUID> classes;
+            hr = list1->EnumClassesOfCategories(1, &wanted, 0, nullptr, classes.Out());
+            if (SUCCEEDED(hr) && classes)
+                hr = AddClasses(classes.Get(), category, found);
+        }
+        if (FAILED(hr))
+            return hr;
+    }
+    for (auto &pair : found) {
+        CLSID clsid;
+        CLSIDFromString(pair.first.c_str(), &clsid);
+        LPOLESTR progId = nullptr, userType = nullptr, independent = nullptr;
+        HRESULT hr = list2 ? list2->GetClassDetails(clsid, &progId, &userType, &independent)
+                           : list1->GetClassDetails(clsid, &progId, &userType);
+        std::wstring versioned = TakeString(progId), type = TakeString(userType), free = TakeString(independent);
+        if (SUCCEEDED(hr))
+            Describe(pair.second, versioned, free, type, local);
+    }
+    return S_OK;
+}
+
+bool ServerListRegistered()
+{
+    HKEY key = nullptr;
+    if (RegOpenKeyExW(HKEY_CLASSES_ROOT, (L"CLSID\\" + GuidText(CLSID_OPCServerList)).c_str(), 0, KEY_READ, &key) !=
+        ERROR_SUCCESS)
+        return false;
+    RegCloseKey(key);
+    return true;
+}
+
+// The names of this machine that a --host may give.
+bool IsThisMachine(const std::wstring &host)
+{
+    if (host.empty() || _wcsicmp(host.c_str(), L"localhost") == 0 || host == L"." || host == L"127.0.0.1" ||
+        host == L"::1")
+        return true;
+    for (COMPUTER_NAME_FORMAT format : {ComputerNameNetBIOS, ComputerNameDnsHostname, ComputerNameDnsFullyQualified}) {
+        wchar_t name[256] = {};
+        DWORD size = 256;
+        if (GetComputerNameExW(format, name, &size) && _wcsicmp(name, host.c_str()) == 0)
+            return true;
+    }
+    return false;
+}
+
+void Print(ServerMap &found, const std::wstring &where, Output &out)
+{
     if (!out.Json() && !found.empty())
         out.Line(L"PROGID                               VERSIONS      VENDOR                CLSID");
     for (auto &pair : found) {
         ServerEntry &entry = pair.second;
-        Describe(pair.first, entry);
         std::wstring versions = entry.da10 && entry.da20 ? L"DA 1.0, 2.0" : entry.da20 ? L"DA 2.0" : L"DA 1.0";
         if (out.Json()) {
             std::wstring list = std::wstring(L"[") + (entry.da10 ? L"\"1.0\"" : L"") +
@@ -122,6 +216,40 @@ int ListServers(const Arguments &args, Output &out)
         }
     }
     if (found.empty() && !out.Json())
-        out.Line(L"No OPC Data Access server is registered on this machine.");
+        out.Line(L"No OPC Data Access server is registered on " + where + L".");
+}
+} // namespace
+
+int ListServers(const Arguments &args, Output &out)
+{
+    if (!args.Positional().empty()) {
+        out.Error(L"servers takes no arguments");
+        return kExitUsage;
+    }
+    double timeout = kDefaultTimeoutSeconds;
+    if (args.Has(L"timeout"))
+        ParseNumber(args.Value(L"timeout"), 1, 86400, timeout); // checked before
+    const std::wstring host = args.Value(L"host");
+    const bool local = IsThisMachine(host);
+    ServerMap found;
+    HRESULT hr = S_FALSE; // not asked
+    if (!local || ServerListRegistered()) {
+        ComPtr<IUnknown> list;
+        hr = CreateOutOfProcess(CLSID_OPCServerList, IID_IUnknown, local ? L"" : host, timeout, list);
+        if (SUCCEEDED(hr))
+            hr = FromServerList(list.Get(), local, found);
+    }
+    if (FAILED(hr) && !local) {
+        out.Error(L"cannot reach the OPC server list of \"" + host + L"\": " +
+                  (hr == E_PENDING ? L"no answer within " + std::to_wstring(static_cast<long>(timeout)) + L" s"
+                                   : SystemErrorText(hr) + L" (" + HexCode(hr) + L")"));
+        return kExitNoServer;
+    }
+    if (hr != S_OK) {
+        // No list here, or one that failed: this machine's registry says the same.
+        found.clear();
+        FromRegistry(found);
+    }
+    Print(found, host.empty() ? L"this machine" : host, out);
     return kExitOk;
 }

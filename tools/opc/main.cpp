@@ -30,10 +30,15 @@ const wchar_t kCommonOptions[] =
 
 const Command kCommands[] = {
     {L"servers",
-     L"list the OPC Data Access servers registered on this machine",
-     L"\n\nLists every class of the OPC DA 1.0 and 2.0 component categories, and every ProgID\n"
-     L"that carries an OPC key: ProgID, versions, vendor, CLSID and description.\n",
-     {},
+     L"list the OPC Data Access servers registered on a machine",
+     L" [--host NAME]\n\n"
+     L"Lists every class of the OPC DA 1.0 and 2.0 component categories, and every ProgID\n"
+     L"that carries an OPC key: ProgID, versions, vendor, CLSID and description. They are\n"
+     L"asked of the machine's OPC server list (OPC.ServerList) when one is registered;\n"
+     L"without one, this machine's registry is read.\n"
+     L"  --host NAME         the machine to ask (default this one); the vendor is only\n"
+     L"                      known for this machine\n",
+     {L"host"},
      RunListServers,
      nullptr},
     {L"status",

@@ -1,0 +1,71 @@
+#include "LocalServerRun.h"
+
+#include "CallWatcher.h"
+#include "ComModule.h"
+#include "ExitWatchdog.h"
+#include "ServerLifetime.h"
+
+#include <objbase.h>
+
+namespace {
+// Once the process has decided to exit, the rest of its exit (COM's
+// uninitialisation included) may take this long before the process is ended.
+constexpr DWORD kExitBoundMs = 5000;
+
+class CClassObjectRegistration : public CClassRegistration {
+public:
+    CClassObjectRegistration(REFCLSID clsid, IClassFactory &factory) : m_clsid(clsid), m_factory(factory) {}
+
+    HRESULT Register() override
+    {
+        if (m_cookie != 0)
+            return S_OK;
+        return CoRegisterClassObject(m_clsid, &m_factory, CLSCTX_LOCAL_SERVER | CLSCTX_REMOTE_SERVER,
+                                     REGCLS_MULTIPLEUSE, &m_cookie);
+    }
+    void Revoke() override
+    {
+        if (m_cookie != 0)
+            CoRevokeClassObject(m_cookie);
+        m_cookie = 0;
+    }
+
+private:
+    CLSID m_clsid;
+    IClassFactory &m_factory;
+    DWORD m_cookie = 0;
+};
+
+void WaitForStep(HANDLE wake, DWORD waitMs)
+{
+    MsgWaitForMultipleObjects(1, &wake, FALSE, waitMs, QS_ALLINPUT);
+    MSG msg;
+    while (PeekMessageA(&msg, nullptr, 0, 0, PM_REMOVE))
+        DispatchMessageA(&msg);
+}
+} // namespace
+
+int RunLocalServer(REFCLSID clsid, IClassFactory &factory, bool startedByCom)
+{
+    // One run per process: the lifetime and the call hook stay for the
+    // process's life (COM keeps the hook).
+    static CClassObjectRegistration registration(clsid, factory);
+    HRESULT hr = registration.Register();
+    if (FAILED(hr))
+        return static_cast<int>(hr);
+    static CServerLifetime lifetime(registration, CServerLifetime::Timing(), startedByCom);
+    ComModule::SetLifetime(&lifetime);
+    static CCallWatcher watcher(lifetime);
+    watcher.Install();
+    DWORD waitMs = INFINITE;
+    while (lifetime.Advance(waitMs) != CServerLifetime::Phase::Stopped)
+        WaitForStep(lifetime.WakeEvent(), waitMs);
+    return 0; // the class object is already revoked
+}
+
+int EndLocalServer(int exitCode)
+{
+    CExitWatchdog watchdog(kExitBoundMs, static_cast<UINT>(exitCode));
+    CoUninitialize();
+    return exitCode;
+}

@@ -1,0 +1,16 @@
+#pragma once
+// The run of a COM local server process: its class object registered for as
+// long as its lifetime decides (ServerLifetime.h), the main thread waiting
+// for the lifetime's steps and dispatching whatever messages arrive.
+#include <unknwn.h>
+
+// Registers factory as the class object of clsid and serves until the
+// lifetime decides to stop; the class object is revoked on return.
+// startedByCom: the process is idle from its start. 0, or the registration's
+// failure: a process whose class object cannot be registered leaves at once
+// instead of idling forever.
+int RunLocalServer(REFCLSID clsid, IClassFactory &factory, bool startedByCom);
+
+// Uninitialises COM and returns exitCode; the uninitialisation may take at
+// most a few seconds before the process is ended with exitCode.
+int EndLocalServer(int exitCode);
