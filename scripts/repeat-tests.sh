@@ -19,7 +19,15 @@ stop_hogs() {
     for pid in $hogs; do kill "$pid" 2>/dev/null || true; done
     hogs=""
 }
-trap stop_hogs EXIT INT TERM
+# Interrupted: the hogs, the run in progress and the prefix's processes go too.
+run_pid=""
+stop_all() {
+    stop_hogs
+    if [ -n "$run_pid" ]; then kill "$run_pid" 2>/dev/null || true; fi
+    "$ROOT/scripts/prefix-stop.sh" "$BUILD_DIR" >/dev/null 2>&1 || true
+}
+trap stop_hogs EXIT
+trap 'stop_all; exit 130' INT TERM
 
 passed=0
 failed=0
@@ -32,13 +40,16 @@ while [ "$k" -le "$N" ]; do
         done
     fi
     start=$(date +%s)
-    if (cd "$BUILD_DIR" && ctest --output-on-failure -j 2) >"$LOGS/run-$k.log" 2>&1; then
+    (cd "$BUILD_DIR" && exec ctest --output-on-failure -j 2) >"$LOGS/run-$k.log" 2>&1 &
+    run_pid=$!
+    if wait "$run_pid"; then
         result=passed
         passed=$((passed + 1))
     else
         result=FAILED
         failed=$((failed + 1))
     fi
+    run_pid=""
     stop_hogs
     echo "run $k/$N${LOAD:+ (with load)}: $result in $(($(date +%s) - start)) s"
     if [ "$result" = FAILED ]; then
