@@ -1,41 +1,15 @@
 #include "ClassCatalog.h"
 
 #include "ComPtr.h"
+#include "RegistryText.h"
 
 #include <algorithm>
 
 namespace {
 const CATID kOpcDa10 = {0x63d5f430, 0xcfe4, 0x11d1, {0xb2, 0xc8, 0x00, 0x60, 0x08, 0x3b, 0xa1, 0xfb}};
 
-// A value of HKEY_CLASSES_ROOT\path, or empty.
-std::wstring ReadText(const std::wstring &path, const wchar_t *value = nullptr)
-{
-    DWORD size = 0;
-    if (RegGetValueW(HKEY_CLASSES_ROOT, path.c_str(), value, RRF_RT_REG_SZ, nullptr, nullptr, &size) != ERROR_SUCCESS ||
-        size < sizeof(wchar_t))
-        return L"";
-    std::wstring text(size / sizeof(wchar_t), L'\0');
-    if (RegGetValueW(HKEY_CLASSES_ROOT, path.c_str(), value, RRF_RT_REG_SZ, nullptr, &text[0], &size) != ERROR_SUCCESS)
-        return L"";
-    text.resize(wcsnlen(text.c_str(), text.size()));
-    return text;
-}
-
-bool KeyExists(const std::wstring &path)
-{
-    HKEY key = nullptr;
-    if (RegOpenKeyExW(HKEY_CLASSES_ROOT, path.c_str(), 0, KEY_READ, &key) != ERROR_SUCCESS)
-        return false;
-    RegCloseKey(key);
-    return true;
-}
-
-std::wstring GuidText(const GUID &guid)
-{
-    wchar_t text[40] = {};
-    StringFromGUID2(guid, text, 40);
-    return text;
-}
+using RegistryText::GuidText;
+using RegistryText::KeyExists;
 
 void AddOnce(std::vector<CLSID> &classes, const CLSID &clsid)
 {
@@ -73,7 +47,7 @@ void AddOpcProgIds(std::vector<CLSID> &classes)
         if (r != ERROR_SUCCESS || name[0] == L'.' || name[0] == L'{' || !KeyExists(std::wstring(name) + L"\\OPC"))
             continue;
         CLSID clsid;
-        std::wstring text = ReadText(std::wstring(name) + L"\\CLSID");
+        std::wstring text = RegistryText::Read(std::wstring(name) + L"\\CLSID");
         if (!text.empty() && SUCCEEDED(CLSIDFromString(text.c_str(), &clsid)))
             AddOnce(classes, clsid);
     }
@@ -100,9 +74,9 @@ HRESULT Details(REFCLSID clsid, ClassDetails &details)
     std::wstring key = L"CLSID\\" + GuidText(clsid);
     if (!KeyExists(key))
         return REGDB_E_CLASSNOTREG;
-    details.userType = ReadText(key);
-    details.progId = ReadText(key + L"\\ProgID");
-    details.versionIndependentProgId = ReadText(key + L"\\VersionIndependentProgID");
+    details.userType = RegistryText::Read(key);
+    details.progId = RegistryText::Read(key + L"\\ProgID");
+    details.versionIndependentProgId = RegistryText::Read(key + L"\\VersionIndependentProgID");
     return S_OK;
 }
 

@@ -1,5 +1,6 @@
 #include "ServerListRegistration.h"
 
+#include "RegistryText.h"
 #include "ServerListIds.h"
 
 #include <objbase.h>
@@ -12,34 +13,12 @@ const wchar_t kDescription[] = L"OPC Server List";
 const wchar_t kProgId[] = L"OPC.ServerList.1";
 const wchar_t kIndependentProgId[] = L"OPC.ServerList";
 
-std::wstring GuidText(const GUID &guid)
-{
-    wchar_t text[40] = {};
-    StringFromGUID2(guid, text, 40);
-    return text;
-}
+using RegistryText::GuidText;
+using RegistryText::KeyExists;
 
 std::wstring ClassKey()
 {
     return L"CLSID\\" + GuidText(CLSID_OPCServerList);
-}
-
-std::wstring ReadText(const std::wstring &path, const wchar_t *value = nullptr)
-{
-    wchar_t data[1024] = {};
-    DWORD size = sizeof(data) - sizeof(wchar_t);
-    if (RegGetValueW(HKEY_CLASSES_ROOT, path.c_str(), value, RRF_RT_REG_SZ, nullptr, data, &size) != ERROR_SUCCESS)
-        return L"";
-    return data;
-}
-
-bool KeyExists(const std::wstring &path)
-{
-    HKEY key = nullptr;
-    if (RegOpenKeyExW(HKEY_CLASSES_ROOT, path.c_str(), 0, KEY_READ, &key) != ERROR_SUCCESS)
-        return false;
-    RegCloseKey(key);
-    return true;
 }
 
 bool WriteText(const std::wstring &path, const wchar_t *value, const std::wstring &text)
@@ -84,7 +63,7 @@ bool RegisteredElsewhere(const std::wstring &exePath)
 {
     if (!KeyExists(ClassKey()))
         return false;
-    std::wstring server = ReadText(ClassKey() + L"\\LocalServer32");
+    std::wstring server = RegistryText::Read(ClassKey() + L"\\LocalServer32");
     return server.empty() || ProgramName(server) != ProgramName(exePath);
 }
 
@@ -95,7 +74,7 @@ bool ProgIdIsOurs(const wchar_t *progId)
     if (!KeyExists(progId))
         return true;
     CLSID clsid;
-    std::wstring text = ReadText(std::wstring(progId) + L"\\CLSID");
+    std::wstring text = RegistryText::Read(std::wstring(progId) + L"\\CLSID");
     return !text.empty() && SUCCEEDED(CLSIDFromString(text.c_str(), &clsid)) &&
            IsEqualCLSID(clsid, CLSID_OPCServerList);
 }

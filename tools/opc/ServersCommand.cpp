@@ -2,15 +2,17 @@
 // the machine's server list object when one is registered (always for
 // another machine); without one, this machine's component categories and the
 // OPC keys of its ProgIDs are read here.
+#include "ClassCatalog.h"
 #include "Commands.h"
 #include "Format.h"
+#include "RegistryText.h"
 #include "ServerListIds.h"
 #include "opccomn.h"
 
 #include <comcat.h>
 
-#include <algorithm>
 #include <map>
+#include <vector>
 
 namespace {
 const CATID kDa10 = {0x63d5f430, 0xcfe4, 0x11d1, {0xb2, 0xc8, 0x00, 0x60, 0x08, 0x3b, 0xa1, 0xfb}};
@@ -22,57 +24,12 @@ struct ServerEntry {
 };
 using ServerMap = std::map<std::wstring, ServerEntry>;
 
-std::wstring GuidText(const GUID &guid)
-{
-    wchar_t text[40] = {};
-    StringFromGUID2(guid, text, 40);
-    return text;
-}
+using RegistryText::GuidText;
 
-std::wstring ReadText(const std::wstring &path)
+void Mark(ServerMap &found, const CLSID &clsid, const CATID &category)
 {
-    wchar_t data[512] = {};
-    DWORD size = sizeof(data) - sizeof(wchar_t);
-    if (RegGetValueW(HKEY_CLASSES_ROOT, path.c_str(), nullptr, RRF_RT_REG_SZ, nullptr, data, &size) != ERROR_SUCCESS)
-        return L"";
-    return data;
-}
-
-void AddCategory(ICatInformation *categories, const CATID &category, ServerMap &found)
-{
-    ComPtr<IEnumCLSID> classes;
-    CATID wanted = category;
-    if (FAILED(categories->EnumClassesOfCategories(1, &wanted, static_cast<ULONG>(-1), nullptr, classes.Out())) ||
-        !classes)
-        return;
-    CLSID clsid;
-    ULONG fetched = 0;
-    while (classes->Next(1, &clsid, &fetched) == S_OK && fetched == 1) {
-        ServerEntry &entry = found[GuidText(clsid)];
-        (IsEqualGUID(category, kDa10) ? entry.da10 : entry.da20) = true;
-    }
-}
-
-// ProgIDs with an OPC key: the DA 1.0 way of saying "I am an OPC server".
-void AddProgIdKeys(ServerMap &found)
-{
-    wchar_t name[256];
-    for (DWORD i = 0;; ++i) {
-        DWORD length = 256;
-        LONG r = RegEnumKeyExW(HKEY_CLASSES_ROOT, i, name, &length, nullptr, nullptr, nullptr, nullptr);
-        if (r == ERROR_NO_MORE_ITEMS)
-            break;
-        if (r != ERROR_SUCCESS || name[0] == L'.' || name[0] == L'{')
-            continue;
-        HKEY opc = nullptr;
-        if (RegOpenKeyExW(HKEY_CLASSES_ROOT, (std::wstring(name) + L"\\OPC").c_str(), 0, KEY_READ, &opc) !=
-            ERROR_SUCCESS)
-            continue;
-        RegCloseKey(opc);
-        CLSID clsid;
-        if (SUCCEEDED(CLSIDFromString(ReadText(std::wstring(name) + L"\\CLSID").c_str(), &clsid)))
-            found[GuidText(clsid)].da10 = true; // one spelling for every CLSID
-    }
+    ServerEntry &entry = found[GuidText(clsid)]; // one spelling for every CLSID
+    (IsEqualGUID(category, kDa10) ? entry.da10 : entry.da20) = true;
 }
 
 // The names of a class; the vendor only where this machine's registry has
@@ -84,22 +41,23 @@ void Describe(ServerEntry &entry, const std::wstring &versioned, const std::wstr
     entry.progId = !independent.empty() ? independent : versioned;
     for (const std::wstring &id : {independent, versioned})
         if (local && entry.vendor.empty() && !id.empty())
-            entry.vendor = ReadText(id + L"\\OPC\\Vendor");
+            entry.vendor = RegistryText::Read(id + L"\\OPC\\Vendor");
 }
 
+// This machine's registry, read here as a server list reads it.
 void FromRegistry(ServerMap &found)
 {
-    ComPtr<ICatInformation> categories;
-    if (SUCCEEDED(CoCreateInstance(CLSID_StdComponentCategoriesMgr, nullptr, CLSCTX_INPROC_SERVER, IID_ICatInformation,
-                                   reinterpret_cast<void **>(categories.Out())))) {
-        AddCategory(categories.Get(), kDa10, found);
-        AddCategory(categories.Get(), kDa20, found);
+    for (const CATID &category : {kDa10, kDa20}) {
+        std::vector<CLSID> classes;
+        ClassCatalog::ClassesOfCategories(1, &category, 0, nullptr, classes);
+        for (const CLSID &clsid : classes)
+            Mark(found, clsid, category);
     }
-    AddProgIdKeys(found);
     for (auto &pair : found) {
-        std::wstring key = L"CLSID\\" + pair.first;
-        Describe(pair.second, ReadText(key + L"\\ProgID"), ReadText(key + L"\\VersionIndependentProgID"), ReadText(key),
-                 true);
+        CLSID clsid;
+        ClassCatalog::ClassDetails details;
+        if (SUCCEEDED(CLSIDFromString(pair.first.c_str(), &clsid)) && SUCCEEDED(ClassCatalog::Details(clsid, details)))
+            Describe(pair.second, details.progId, details.versionIndependentProgId, details.userType, true);
     }
 }
 
@@ -119,10 +77,8 @@ template <class Enumerator> HRESULT AddClasses(Enumerator *classes, const CATID 
         HRESULT hr = classes->Next(64, batch, &fetched);
         if (FAILED(hr))
             return hr;
-        for (ULONG i = 0; i < fetched && i < 64; ++i) {
-            ServerEntry &entry = found[GuidText(batch[i])];
-            (IsEqualGUID(category, kDa10) ? entry.da10 : entry.da20) = true;
-        }
+        for (ULONG i = 0; i < fetched && i < 64; ++i)
+            Mark(found, batch[i], category);
         if (hr != S_OK || fetched == 0)
             return S_OK;
     }
@@ -168,12 +124,7 @@ HRESULT FromServerList(IUnknown *list, bool local, ServerMap &found)
 
 bool ServerListRegistered()
 {
-    HKEY key = nullptr;
-    if (RegOpenKeyExW(HKEY_CLASSES_ROOT, (L"CLSID\\" + GuidText(CLSID_OPCServerList)).c_str(), 0, KEY_READ, &key) !=
-        ERROR_SUCCESS)
-        return false;
-    RegCloseKey(key);
-    return true;
+    return RegistryText::KeyExists(L"CLSID\\" + GuidText(CLSID_OPCServerList));
 }
 
 // The names of this machine that a --host may give.
