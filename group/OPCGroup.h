@@ -119,8 +119,7 @@ public:
     void SetFailedScans(DWORD count);
     DWORD IncrementFailedScans();
     // A scanner entry or a transaction takes a work unit and a reference to
-    // the group, and lets go of both; each returns the work units left.
-    // While a removal waits, the reference goes to the removal, so that the
+    // the group, and lets go of both. While a removal waits, the reference goes to the removal, so that the
     // removal sees the client's references alone.
     void AddWork();
     void ReleaseWork();
@@ -242,8 +241,14 @@ private:
         const LogicalCaller m_caller;
         CGroupActivity::Kind m_kind;
     };
-    // Sends one built stream to the connections; the lock is released for it.
-    HRESULT SendStreamTo(CSingleLock &lock, const ConnectionList &connections, HGLOBAL memory);
+    // A built DA 1.0 stream and the connections it goes to.
+    struct StreamSend {
+        ConnectionList connections;
+        HGLOBAL memory = nullptr;
+    };
+    // Sends each built stream and frees it; the lock (held on entry) is
+    // released before the first sink is called.
+    void SendStreams(CSingleLock &lock, StreamSend *sends, size_t count);
     // A DA 1.0 read of the handles and its completion to one connection.
     HRESULT ReadAndSend(CSingleLock &lock, DWORD connection, DWORD id, OPCDATASOURCE source,
                         const std::vector<OPCHANDLE> &handles);

@@ -33,23 +33,22 @@ template <class Send> HRESULT SendStream(HGLOBAL memory, Send send)
 // is released, as IOPCDataCallback is: a sink may call the group back from
 // another thread of its process, and a removal may be waiting meanwhile.
 
-HRESULT COPCGroup::SendStreamTo(CSingleLock &lock, const ConnectionList &connections, HGLOBAL memory)
+void COPCGroup::SendStreams(CSingleLock &lock, StreamSend *sends, size_t count)
 {
     CallbackInFlight inFlight(*this);
     lock.Unlock();
-    return SendStream(memory, [&](STGMEDIUM &m) {
-        SendToConnections(connections, m);
-        return S_OK;
-    });
+    for (size_t i = 0; i < count; ++i)
+        if (sends[i].memory)
+            SendStream(sends[i].memory, [&](STGMEDIUM &m) {
+                SendToConnections(sends[i].connections, m);
+                return S_OK;
+            });
 }
 
 HRESULT COPCGroup::NotifyAdviseSinks(CSingleLock &lock, DWORD count, const OPCHANDLE *clients, const VARIANT *values,
                                      const WORD *qualities, const FILETIME *times)
 {
-    struct Send {
-        ConnectionList connections;
-        HGLOBAL memory = nullptr;
-    } sends[2];
+    StreamSend sends[2];
     bool any = false;
     for (int i = 0; i < 2; ++i) {
         bool withTime = i == 0; // the connections with time stamps first
@@ -61,7 +60,7 @@ HRESULT COPCGroup::NotifyAdviseSinks(CSingleLock &lock, DWORD count, const OPCHA
                                            &sends[i].memory);
         if (FAILED(hr)) {
             INTERNAL_ASSERT_FAILED("building a data stream");
-            for (Send &built : sends)
+            for (StreamSend &built : sends)
                 if (built.memory)
                     GlobalFree(built.memory);
             lock.Unlock();
@@ -72,14 +71,7 @@ HRESULT COPCGroup::NotifyAdviseSinks(CSingleLock &lock, DWORD count, const OPCHA
         lock.Unlock();
         return S_FALSE;
     }
-    CallbackInFlight inFlight(*this);
-    lock.Unlock();
-    for (Send &send : sends)
-        if (send.memory)
-            SendStream(send.memory, [&](STGMEDIUM &m) {
-                SendToConnections(send.connections, m);
-                return S_OK;
-            });
+    SendStreams(lock, sends, 2);
     return S_OK;
 }
 
@@ -102,7 +94,9 @@ HRESULT COPCGroup::SendReadComplete(CSingleLock &lock, DWORD connection, DWORD i
         lock.Unlock();
         return hr;
     }
-    return SendStreamTo(lock, target, memory);
+    StreamSend send{std::move(target), memory};
+    SendStreams(lock, &send, 1);
+    return S_OK;
 }
 
 HRESULT COPCGroup::SendWriteComplete(CSingleLock &lock, DWORD connection, DWORD id, HRESULT overall, DWORD count,
@@ -120,7 +114,9 @@ HRESULT COPCGroup::SendWriteComplete(CSingleLock &lock, DWORD connection, DWORD 
         lock.Unlock();
         return hr;
     }
-    return SendStreamTo(lock, target, memory);
+    StreamSend send{std::move(target), memory};
+    SendStreams(lock, &send, 1);
+    return S_OK;
 }
 
 // ---- Transaction work ------------------------------------------------

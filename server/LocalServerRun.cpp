@@ -2,6 +2,7 @@
 
 #include "CallWatcher.h"
 #include "ComModule.h"
+#include "CommandLine.h"
 #include "ExitWatchdog.h"
 #include "ServerLifetime.h"
 
@@ -68,4 +69,23 @@ int EndLocalServer(int exitCode)
     CExitWatchdog watchdog(kExitBoundMs, static_cast<UINT>(exitCode));
     CoUninitialize();
     return exitCode;
+}
+
+int LocalServerMain(REFCLSID clsid, IClassFactory &factory, int (*registerServer)(), int (*unregisterServer)())
+{
+    const char *commandLine = GetCommandLineA();
+    CoInitializeEx(nullptr, COINIT_MULTITHREADED);
+    int exitCode = 0;
+    switch (FindServerCommand(commandLine)) {
+    case ServerCommand::UnregServer:
+        exitCode = unregisterServer();
+        break;
+    case ServerCommand::RegServer:
+        exitCode = registerServer();
+        break;
+    case ServerCommand::Run:
+        exitCode = RunLocalServer(clsid, factory, StartedByCom(commandLine));
+        break;
+    }
+    return EndLocalServer(exitCode);
 }

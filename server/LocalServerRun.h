@@ -14,3 +14,9 @@ int RunLocalServer(REFCLSID clsid, IClassFactory &factory, bool startedByCom);
 // Uninitialises COM and returns exitCode; the uninitialisation may take at
 // most a few seconds before the process is ended with exitCode.
 int EndLocalServer(int exitCode);
+
+// The whole run of a local server executable, from its WinMain: COM in the
+// multithreaded apartment; "RegServer" and "UnregServer" run the given
+// switch (its result is the exit code); anything else serves clsid through
+// factory. Returns the exit code.
+int LocalServerMain(REFCLSID clsid, IClassFactory &factory, int (*registerServer)(), int (*unregisterServer)());

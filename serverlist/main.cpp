@@ -4,14 +4,11 @@
 //
 // Exit codes of the switches: 0 done; 1 another installation's server list
 // is registered and was left as it is; an HRESULT when the registry refused.
-#include "CommandLine.h"
 #include "LocalClassFactory.h"
 #include "LocalServerRun.h"
 #include "ServerList.h"
 #include "ServerListIds.h"
 #include "ServerListRegistration.h"
-
-#include <objbase.h>
 
 #include <string>
 
@@ -31,22 +28,8 @@ int SwitchResult(HRESULT hr)
 
 int WINAPI WinMain(HINSTANCE, HINSTANCE, LPSTR, int)
 {
-    const char *commandLine = GetCommandLineA();
-    CoInitializeEx(nullptr, COINIT_MULTITHREADED);
-
-    int exitCode = 0;
-    switch (FindServerCommand(commandLine)) {
-    case ServerCommand::UnregServer:
-        exitCode = SwitchResult(ServerListRegistration::Unregister(ModulePath()));
-        break;
-    case ServerCommand::RegServer:
-        exitCode = SwitchResult(ServerListRegistration::Register(ModulePath()));
-        break;
-    case ServerCommand::Run: {
-        static CLocalClassFactory factory(&COPCServerList::Create);
-        exitCode = RunLocalServer(CLSID_OPCServerList, factory, StartedByCom(commandLine));
-        break;
-    }
-    }
-    return EndLocalServer(exitCode);
+    static CLocalClassFactory factory(&COPCServerList::Create);
+    return LocalServerMain(
+        CLSID_OPCServerList, factory, [] { return SwitchResult(ServerListRegistration::Register(ModulePath())); },
+        [] { return SwitchResult(ServerListRegistration::Unregister(ModulePath())); });
 }
