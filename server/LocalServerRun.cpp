@@ -49,15 +49,17 @@ void WaitForStep(HANDLE wake, DWORD waitMs)
 int RunLocalServer(REFCLSID clsid, IClassFactory &factory, bool startedByCom)
 {
     // One run per process: the lifetime and the call hook stay for the
-    // process's life (COM keeps the hook).
+    // process's life (COM keeps the hook). Both are in place before the
+    // class object is registered: a client may create an object the moment
+    // it is, and its count must go to the lifetime.
     static CClassObjectRegistration registration(clsid, factory);
-    HRESULT hr = registration.Register();
-    if (FAILED(hr))
-        return static_cast<int>(hr);
     static CServerLifetime lifetime(registration, CServerLifetime::Timing(), startedByCom);
     ComModule::SetLifetime(&lifetime);
     static CCallWatcher watcher(lifetime);
     watcher.Install();
+    HRESULT hr = registration.Register();
+    if (FAILED(hr))
+        return static_cast<int>(hr);
     DWORD waitMs = INFINITE;
     while (lifetime.Advance(waitMs) != CServerLifetime::Phase::Stopped)
         WaitForStep(lifetime.WakeEvent(), waitMs);

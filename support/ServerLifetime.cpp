@@ -90,9 +90,13 @@ CServerLifetime::Phase CServerLifetime::Advance(DWORD &waitMs)
             waitMs = static_cast<DWORD>(m_timing.graceMs - (now - m_since));
             break;
         }
-        m_registration.Revoke();
+        // Draining before the revocation: the platform forgets the class
+        // object here before it stops handing it out, and a client that
+        // fetched it in between must find IncomingCall restoring it (it
+        // waits for this lock), not a process that looks as if serving.
         m_phase = Phase::Draining;
-        m_since = now;
+        m_registration.Revoke();
+        m_since = m_timing.now();
         waitMs = m_timing.drainMs;
         break;
     case Phase::Draining:

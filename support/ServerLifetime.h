@@ -52,7 +52,8 @@ public:
     };
     enum class Phase { Serving, Draining, Stopped };
 
-    // The class object is registered when the lifetime begins.
+    // The caller registers the class object once the lifetime is in place;
+    // the lifetime revokes it and registers it again.
     // idleFromStart: the process counts as idle from now (COM started it).
     CServerLifetime(CClassRegistration &registration, const Timing &timing, bool idleFromStart);
     CServerLifetime(const CServerLifetime &) = delete;

@@ -89,6 +89,7 @@ TEST_F(OpcToolE2E, BrowseReadWriteAndProperties)
     EXPECT_EQ(read.code, 0) << read.output;
     EXPECT_TRUE(Has(read.output, R"("value":42.5,"type":"double","quality":192,"qualityText":"good")")) << read.output;
     OpcRun asText = Opc(std::string("read ") + kTemperature + " --type string");
+    EXPECT_EQ(asText.code, 0) << asText.output;
     EXPECT_TRUE(Has(asText.output, "42.5")) << asText.output;
     EXPECT_TRUE(Has(asText.output, "string")) << asText.output;
 

@@ -11,6 +11,8 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
+#include <climits>
 #include <string>
 #include <thread>
 #include <vector>
@@ -18,6 +20,7 @@
 namespace {
 const DWORD kCount = 1000;
 const int kCalls = 20;
+const int kRounds = 3;
 
 // Bytes in use in every heap of this process.
 unsigned long long BusyBytes()
@@ -83,15 +86,21 @@ void MeasureThroughProxy(IStream *marshalled, Growth &out)
                 validate();
                 write();
             }
-            unsigned long long before = BusyBytes();
-            for (int i = 0; i < kCalls; ++i)
-                validate();
-            unsigned long long middle = BusyBytes();
-            for (int i = 0; i < kCalls; ++i)
-                write();
-            unsigned long long after = BusyBytes();
-            out.validateBytes = static_cast<long long>(middle - before);
-            out.writeBytes = static_cast<long long>(after - middle);
+            // Other threads of this process (the network's intake, the
+            // scanner) allocate too: the smallest growth of a few rounds is
+            // the stub's, since a leak shows in every round.
+            out.validateBytes = out.writeBytes = LLONG_MAX;
+            for (int round = 0; round < kRounds; ++round) {
+                unsigned long long before = BusyBytes();
+                for (int i = 0; i < kCalls; ++i)
+                    validate();
+                unsigned long long middle = BusyBytes();
+                for (int i = 0; i < kCalls; ++i)
+                    write();
+                unsigned long long after = BusyBytes();
+                out.validateBytes = std::min(out.validateBytes, static_cast<long long>(middle - before));
+                out.writeBytes = std::min(out.writeBytes, static_cast<long long>(after - middle));
+            }
             for (VARIANT &v : values)
                 VariantClear(&v);
         }
@@ -114,8 +123,9 @@ TEST(StubMemory, ArraysTheStubAllocatesAreFreedAfterEachCall)
     caller.join();
     ASSERT_EQ(growth.setUp, S_OK);
     // What a leak would keep: every call's array (OPCITEMDEF is 48 bytes,
-    // VARIANT 24). A tenth of that is left for the heaps' own bookkeeping.
-    EXPECT_LT(growth.validateBytes, static_cast<long long>(kCalls * kCount * sizeof(OPCITEMDEF) / 10));
-    EXPECT_LT(growth.writeBytes, static_cast<long long>(kCalls * kCount * sizeof(VARIANT) / 10));
+    // VARIANT 24). A quarter of that is left for the heaps' own bookkeeping
+    // and what other threads hold at the moment of measuring.
+    EXPECT_LT(growth.validateBytes, static_cast<long long>(kCalls * kCount * sizeof(OPCITEMDEF) / 4));
+    EXPECT_LT(growth.writeBytes, static_cast<long long>(kCalls * kCount * sizeof(VARIANT) / 4));
     server->RemoveGroup(group.handle, TRUE);
 }

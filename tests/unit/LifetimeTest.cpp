@@ -12,6 +12,7 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
+#include <functional>
 #include <thread>
 
 namespace {
@@ -24,6 +25,7 @@ ULONGLONG TestClock()
 struct FakeRegistration : CClassRegistration {
     bool registered = true;
     int registrations = 0, revocations = 0;
+    std::function<void()> whileRevoking;
     HRESULT Register() override
     {
         registered = true;
@@ -34,6 +36,10 @@ struct FakeRegistration : CClassRegistration {
     {
         registered = false;
         ++revocations;
+        if (auto once = std::move(whileRevoking)) {
+            whileRevoking = nullptr;
+            once();
+        }
     }
 };
 
@@ -119,6 +125,34 @@ TEST(Lifetime, AnythingThatArrivesBeforeTheDecisionKeepsTheServer)
     EXPECT_EQ(life.Advance(wait), Phase::Stopped);
     life.IncomingCall();
     EXPECT_FALSE(reg.registered) << "nothing comes back after the decision";
+}
+
+TEST(Lifetime, ACallArrivingDuringTheRevocationRestoresTheClassObject)
+{
+    // The platform forgets the class object before it stops handing it out:
+    // a client's call can reach the process while the revocation is still
+    // under way, and must find the class object again.
+    g_now = 0;
+    FakeRegistration reg;
+    CServerLifetime life(reg, TestTiming(), true);
+    std::thread caller;
+    std::atomic<bool> returned{false};
+    reg.whileRevoking = [&] {
+        caller = std::thread([&] {
+            life.IncomingCall();
+            returned = true;
+        });
+        // A call that took no notice ends at once; one that waits for the
+        // revocation to finish is still waiting.
+        for (int i = 0; i < 20 && !returned; ++i)
+            Sleep(10);
+    };
+    g_now = 5000;
+    DWORD wait = 0;
+    EXPECT_EQ(life.Advance(wait), Phase::Draining);
+    caller.join();
+    EXPECT_TRUE(reg.registered) << "the call found no class object";
+    EXPECT_EQ(life.Advance(wait), Phase::Serving);
 }
 
 TEST(Lifetime, TheWakeEventTellsTheMainThreadOfTheLastRelease)
