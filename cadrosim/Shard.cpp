@@ -74,9 +74,18 @@ void Shard::Schedule(const std::shared_ptr<Member> &member)
     if (member->scheduled || member->source.kind == SourceKind::Const || member->source.period == 0)
         return;
     member->scheduled = true;
-    // A member without a value yet produces its first at once.
-    auto first = member->hasValue ? std::chrono::milliseconds(member->source.period) : std::chrono::milliseconds(0);
-    m_heap.push({Clock::now() + first, member});
+    // Nothing computed the member while nobody received it: a value it holds
+    // is as old as its last subscriber, and the new one gets a value of now.
+    // A counter or toggle takes one step, as at any tick. A member without a
+    // value yet produces its first at the next tick, at once.
+    Clock::time_point now = Clock::now();
+    Member &m = *member;
+    if (m.hasValue && !m.stalled && m.machine && m.machine->connected) {
+        m.value = NextValue(m, m_engine.ElapsedMs(now), m_engine.Random());
+        GetSystemTimeAsFileTime(&m.time);
+    }
+    auto first = m.hasValue ? std::chrono::milliseconds(m.source.period) : std::chrono::milliseconds(0);
+    m_heap.push({now + first, member});
     m_wake.notify_one();
 }
 

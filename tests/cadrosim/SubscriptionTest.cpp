@@ -329,3 +329,47 @@ TEST_F(SimTest, AMachineOfAnotherNodeThatCannotBeReachedWaitsForIt)
     // Loading another network lets go of the node's link.
     EXPECT_EQ(Command(L"reset"), L"ok\n");
 }
+
+TEST_F(SimTest, AComputedMemberNobodyHeardGivesANewSubscriberACurrentValue)
+{
+    // Nobody receives the counter for a while, so nothing computes it; the
+    // next subscriber still gets a value of now, not the last one computed.
+    CadroDataItem *first = Subscribe(L"\\\\.\\p\\o.fast");
+    ASSERT_TRUE(first);
+    void *firstCookie = LastCookie();
+    ASSERT_TRUE(recorder.WaitFor([&](auto &all) { return DataCount(all, firstCookie) >= 2; }));
+    Drop(first);
+    double lastHeard = 0;
+    for (const Delivery &d : Of(recorder.Snapshot(), firstCookie))
+        if (d.kind == Delivery::Data)
+            lastHeard = d.number;
+    Sleep(200);
+
+    FILETIME before = {};
+    GetSystemTimeAsFileTime(&before);
+    ASSERT_TRUE(Subscribe(L"\\\\.\\p\\o.fast"));
+    void *cookie = LastCookie();
+    ASSERT_TRUE(recorder.WaitFor([&](auto &all) { return DataCount(all, cookie) >= 1; }));
+    for (const Delivery &d : Of(recorder.Snapshot(), cookie)) {
+        if (d.kind != Delivery::Data)
+            continue;
+        EXPECT_GE(CompareFileTime(&d.time, &before), 0) << "the first value is stamped before the subscription";
+        EXPECT_GT(d.number, lastHeard) << "the first value is the one computed last";
+        break;
+    }
+
+    // A member that only takes published values keeps the published one.
+    Command(L"publish \\\\.\\p\\o.num 9");
+    Sleep(50);
+    FILETIME published = {};
+    GetSystemTimeAsFileTime(&published);
+    ASSERT_TRUE(Subscribe(L"\\\\.\\p\\o.num"));
+    void *constCookie = LastCookie();
+    ASSERT_TRUE(recorder.WaitFor([&](auto &all) { return DataCount(all, constCookie) >= 1; }));
+    for (const Delivery &d : Of(recorder.Snapshot(), constCookie))
+        if (d.kind == Delivery::Data) {
+            EXPECT_EQ(d.number, 9);
+            EXPECT_LT(CompareFileTime(&d.time, &published), 0) << "a published value keeps its time stamp";
+            break;
+        }
+}
