@@ -19,12 +19,14 @@
 namespace {
 const CLSID kServer = {0x5b1e7a20, 0x4c3d, 0x11d3, {0x9a, 0x44, 0x00, 0xa0, 0xc9, 0xe2, 0xb7, 0xf1}};
 
-int Report(HRESULT hr, ULONGLONG activationMs, const char *step)
+// A failure says when the activation began (the system's tick count, the
+// same in every process) so that it can be laid beside the server's traces.
+int Report(HRESULT hr, ULONGLONG begin, ULONGLONG activationMs, const char *step)
 {
     if (SUCCEEDED(hr))
         printf("ok %llu\n", activationMs);
     else
-        printf("fail 0x%08lX %llu %s\n", static_cast<unsigned long>(hr), activationMs, step);
+        printf("fail 0x%08lX %llu %s at %llu\n", static_cast<unsigned long>(hr), activationMs, step, begin);
     fflush(stdout);
     return SUCCEEDED(hr) ? 0 : 1;
 }
@@ -107,7 +109,7 @@ int wmain(int argc, wchar_t **argv)
         hr = ReadOne(server.Get(), item, step);
     Sleep(holdMs);
     server.Reset();
-    int code = Report(hr, activationMs, step);
+    int code = Report(hr, begin, activationMs, step);
     // Leaves without COM's uninitialisation, which a client has no need of
     // and which could only add a hang of its own to the figures.
     ExitProcess(static_cast<UINT>(code));

@@ -57,9 +57,15 @@ LONG CServerLifetime::Count()
 
 void CServerLifetime::IncomingCall()
 {
-    // Every call of every client passes here: a word is read, nothing more,
-    // unless the class object has just been revoked.
-    if (m_phase.load(std::memory_order_acquire) != Phase::Draining)
+    // Every call of every client passes here: a time is stored and a word
+    // read, nothing more, unless the class object has just been revoked.
+    // The call may be the platform's own request for the class object, on
+    // its way to a lookup that a revocation now would make fail: the stored
+    // time keeps the revocation away (Advance reads it after it says it is
+    // draining, this reads the phase after storing the time; with both in
+    // sequential order one of the two sees the other).
+    m_lastCall.store(m_timing.now());
+    if (m_phase.load() != Phase::Draining)
         return;
     CSingleLock lock(&m_lock);
     if (m_phase == Phase::Draining)
@@ -70,7 +76,10 @@ void CServerLifetime::Restore()
 {
     // A client is on its way: it finds the class object again before its
     // call is served, and the grace period starts over.
-    if (FAILED(m_registration.Register()))
+    HRESULT hr = m_registration.Register();
+    Trace("lifetime %lu at %llu: class object registered again (0x%08lX)\n", GetCurrentProcessId(), m_timing.now(),
+          static_cast<unsigned long>(hr));
+    if (FAILED(hr))
         INTERNAL_ASSERT_FAILED("registering the class object again");
     m_phase = Phase::Serving;
     m_since = m_timing.now();
@@ -95,8 +104,16 @@ CServerLifetime::Phase CServerLifetime::Advance(DWORD &waitMs)
         // fetched it in between must find IncomingCall restoring it (it
         // waits for this lock), not a process that looks as if serving.
         m_phase = Phase::Draining;
+        if (ULONGLONG lastCall = m_lastCall.load(); lastCall > m_since && lastCall + m_timing.graceMs > now) {
+            // A call came in during the grace period: idle counts from it.
+            m_phase = Phase::Serving;
+            m_since = lastCall;
+            waitMs = static_cast<DWORD>(lastCall + m_timing.graceMs - now);
+            break;
+        }
         m_registration.Revoke();
         m_since = m_timing.now();
+        Trace("lifetime %lu at %llu: class object revoked\n", GetCurrentProcessId(), m_since);
         waitMs = m_timing.drainMs;
         break;
     case Phase::Draining:
@@ -109,6 +126,7 @@ CServerLifetime::Phase CServerLifetime::Advance(DWORD &waitMs)
             break;
         }
         m_phase = Phase::Stopped;
+        Trace("lifetime %lu at %llu: stopped\n", GetCurrentProcessId(), now);
         break;
     case Phase::Stopped:
         break;

@@ -11,8 +11,8 @@
 // the revocation keeps new clients away. So the protocol is:
 //
 //   serving   the class object is registered. When the count is 0 and has
-//             stayed 0 for the grace period, the class object is revoked
-//             and the process is draining. A process that COM started and
+//             stayed 0, with no call coming in, for the grace period, the
+//             class object is revoked and the process is draining. A process that COM started and
 //             that never receives an object counts as idle from its start.
 //   draining  new activations no longer find this process and start another.
 //             A client that fetched the class object just before the
@@ -87,6 +87,7 @@ private:
     CCriticalSection m_lock{LockOrder::Leaf}; // the registration is called under it
     LONG m_count = 0;
     std::atomic<Phase> m_phase{Phase::Serving}; // changed under the lock; read without it by IncomingCall
+    std::atomic<ULONGLONG> m_lastCall{0};       // when a call last came in; written without the lock
     bool m_exitWhenIdle;
     ULONGLONG m_since; // idle since (serving) or revoked since (draining)
 };

@@ -19,11 +19,19 @@ bool TraceToStderr()
     return enabled;
 }
 
+// A file that traces are appended to, for processes whose output nobody
+// reads (a server that COM started): SKYLARC_TRACE_FILE names it.
+const char *TraceFile()
+{
+    static const char *const path = getenv("SKYLARC_TRACE_FILE");
+    return path && *path ? path : nullptr;
+}
+
 // Status traces come per item (three for every subscription made): nothing
 // is formatted unless someone reads the text.
 bool Heard()
 {
-    return IsDebuggerPresent() || TraceToStderr();
+    return IsDebuggerPresent() || TraceToStderr() || TraceFile();
 }
 
 void Emit(const char *text)
@@ -35,6 +43,12 @@ void Emit(const char *text)
         OutputDebugStringA(text);
     if (TraceToStderr())
         fputs(text, stderr);
+    if (const char *path = TraceFile()) {
+        if (FILE *file = fopen(path, "a")) {
+            fputs(text, file);
+            fclose(file);
+        }
+    }
 }
 } // namespace
 

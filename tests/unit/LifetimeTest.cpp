@@ -127,6 +127,25 @@ TEST(Lifetime, AnythingThatArrivesBeforeTheDecisionKeepsTheServer)
     EXPECT_FALSE(reg.registered) << "nothing comes back after the decision";
 }
 
+TEST(Lifetime, CallsDuringTheGracePeriodPutTheRevocationOff)
+{
+    // The platform's own request for the class object is such a call: the
+    // class object must not go between its arrival and its lookup.
+    g_now = 0;
+    FakeRegistration reg;
+    CServerLifetime life(reg, TestTiming(), true);
+    g_now = 4000;
+    life.IncomingCall();
+    DWORD wait = 0;
+    g_now = 5000;
+    EXPECT_EQ(life.Advance(wait), Phase::Serving);
+    EXPECT_EQ(wait, 4000u) << "idle from the last call";
+    EXPECT_TRUE(reg.registered);
+    g_now = 9000;
+    EXPECT_EQ(life.Advance(wait), Phase::Draining);
+    EXPECT_EQ(reg.revocations, 1);
+}
+
 TEST(Lifetime, ACallArrivingDuringTheRevocationRestoresTheClassObject)
 {
     // The platform forgets the class object before it stops handing it out:
