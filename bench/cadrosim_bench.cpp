@@ -139,7 +139,8 @@ int main(int argc, char **argv)
     }
 
     printf("network: %d members, period %d ms; %d subscriptions\n", members, period, subscriptions);
-    double baseMiB = WorkingSetMiB();
+    HANDLE nodeProcess = node ? OpenProcess(PROCESS_QUERY_LIMITED_INFORMATION, FALSE, NodeProcessId()) : nullptr;
+    double baseMiB = WorkingSetMiB(), nodeBaseMiB = ProcessWorkingSetMiB(nodeProcess);
     std::vector<CadroDataItem *> items(subscriptions);
     start = Clock::now();
     for (int i = 0; i < subscriptions; ++i) {
@@ -154,7 +155,11 @@ int main(int argc, char **argv)
            subscriptions / subscribeSeconds, WorkingSetMiB() - baseMiB);
 
     Sleep(1000); // every subscription active and delivering
-    HANDLE nodeProcess = node ? OpenProcess(PROCESS_QUERY_LIMITED_INFORMATION, FALSE, NodeProcessId()) : nullptr;
+    if (nodeProcess) {
+        double grown = ProcessWorkingSetMiB(nodeProcess) - nodeBaseMiB;
+        printf("node memory: %.3f KB per subscription (working set +%.1f MiB for %d subscriptions)\n",
+               grown * 1024 / subscriptions, grown, subscriptions);
+    }
     for (int run = 0; run < 3; ++run) {
         unsigned long long before = receiver.updates.load();
         double selfBefore = ProcessCpuSeconds(GetCurrentProcess()), nodeBefore = ProcessCpuSeconds(nodeProcess);
