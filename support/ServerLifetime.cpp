@@ -2,6 +2,8 @@
 
 #include "Trace.h"
 
+#include <algorithm>
+
 CServerLifetime::CServerLifetime(CClassRegistration &registration, const Timing &timing, bool idleFromStart)
     : m_registration(registration), m_timing(timing), m_wake(CreateEventW(nullptr, FALSE, FALSE, nullptr)),
       m_exitWhenIdle(idleFromStart), m_since(timing.now())
@@ -95,20 +97,16 @@ CServerLifetime::Phase CServerLifetime::Advance(DWORD &waitMs)
     case Phase::Serving:
         if (m_count > 0 || !m_exitWhenIdle)
             break;
-        if (now - m_since < m_timing.graceMs) {
-            waitMs = static_cast<DWORD>(m_timing.graceMs - (now - m_since));
-            break;
-        }
-        // Draining before the revocation: the platform forgets the class
-        // object here before it stops handing it out, and a client that
-        // fetched it in between must find IncomingCall restoring it (it
-        // waits for this lock), not a process that looks as if serving.
+        // Draining before the grace period is even looked at: the platform
+        // forgets the class object here before it stops handing it out, and
+        // a call that comes in meanwhile must either be seen here (its time)
+        // or see the draining phase and wait for this lock to restore it.
+        // Idle counts from the last release or the last call, whichever
+        // came later.
         m_phase = Phase::Draining;
-        if (ULONGLONG lastCall = m_lastCall.load(); lastCall > m_since && lastCall + m_timing.graceMs > now) {
-            // A call came in during the grace period: idle counts from it.
+        if (ULONGLONG idleSince = std::max(m_since, m_lastCall.load()); idleSince + m_timing.graceMs > now) {
             m_phase = Phase::Serving;
-            m_since = lastCall;
-            waitMs = static_cast<DWORD>(lastCall + m_timing.graceMs - now);
+            waitMs = static_cast<DWORD>(idleSince + m_timing.graceMs - now);
             break;
         }
         m_registration.Revoke();

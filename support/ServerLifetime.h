@@ -12,8 +12,9 @@
 //
 //   serving   the class object is registered. When the count is 0 and has
 //             stayed 0, with no call coming in, for the grace period, the
-//             class object is revoked and the process is draining. A process that COM started and
-//             that never receives an object counts as idle from its start.
+//             class object is revoked and the process is draining. A process
+//             that COM started and that never receives an object counts as
+//             idle from its start.
 //   draining  new activations no longer find this process and start another.
 //             A client that fetched the class object just before the
 //             revocation may still arrive: any call that reaches the process

@@ -113,6 +113,15 @@ inline bool HasData(const std::vector<Delivery> &all, void *cookie, double numbe
     return false;
 }
 
+// The first value delivered to cookie; a Status record when none came.
+inline Delivery FirstData(const std::vector<Delivery> &all, void *cookie)
+{
+    for (const auto &d : all)
+        if (d.cookie == cookie && d.kind == Delivery::Data)
+            return d;
+    return {};
+}
+
 inline size_t DataCount(const std::vector<Delivery> &all, void *cookie)
 {
     size_t n = 0;

@@ -350,13 +350,9 @@ TEST_F(SimTest, AComputedMemberNobodyHeardGivesANewSubscriberACurrentValue)
     ASSERT_TRUE(Subscribe(L"\\\\.\\p\\o.fast"));
     void *cookie = LastCookie();
     ASSERT_TRUE(recorder.WaitFor([&](auto &all) { return DataCount(all, cookie) >= 1; }));
-    for (const Delivery &d : Of(recorder.Snapshot(), cookie)) {
-        if (d.kind != Delivery::Data)
-            continue;
-        EXPECT_GE(CompareFileTime(&d.time, &before), 0) << "the first value is stamped before the subscription";
-        EXPECT_GT(d.number, lastHeard) << "the first value is the one computed last";
-        break;
-    }
+    Delivery fresh = FirstData(recorder.Snapshot(), cookie);
+    EXPECT_GE(CompareFileTime(&fresh.time, &before), 0) << "the first value is stamped before the subscription";
+    EXPECT_GT(fresh.number, lastHeard) << "the first value is the one computed last";
 
     // A member that only takes published values keeps the published one.
     Command(L"publish \\\\.\\p\\o.num 9");
@@ -366,10 +362,7 @@ TEST_F(SimTest, AComputedMemberNobodyHeardGivesANewSubscriberACurrentValue)
     ASSERT_TRUE(Subscribe(L"\\\\.\\p\\o.num"));
     void *constCookie = LastCookie();
     ASSERT_TRUE(recorder.WaitFor([&](auto &all) { return DataCount(all, constCookie) >= 1; }));
-    for (const Delivery &d : Of(recorder.Snapshot(), constCookie))
-        if (d.kind == Delivery::Data) {
-            EXPECT_EQ(d.number, 9);
-            EXPECT_LT(CompareFileTime(&d.time, &published), 0) << "a published value keeps its time stamp";
-            break;
-        }
+    Delivery kept = FirstData(recorder.Snapshot(), constCookie);
+    EXPECT_EQ(kept.number, 9);
+    EXPECT_LT(CompareFileTime(&kept.time, &published), 0) << "a published value keeps its time stamp";
 }

@@ -14,6 +14,7 @@
 #include <atomic>
 #include <functional>
 #include <thread>
+#include <utility>
 
 namespace {
 ULONGLONG g_now = 0;
@@ -36,10 +37,8 @@ struct FakeRegistration : CClassRegistration {
     {
         registered = false;
         ++revocations;
-        if (auto once = std::move(whileRevoking)) {
-            whileRevoking = nullptr;
+        if (auto once = std::exchange(whileRevoking, nullptr))
             once();
-        }
     }
 };
 
