@@ -264,6 +264,12 @@ bool Engine::HasMember(const std::wstring &url)
     return FindMember(url) != nullptr;
 }
 
+void Engine::Catalogue(std::vector<uint64_t> &out)
+{
+    std::lock_guard<SlimMutex> l(m_networkLock);
+    m_network->Catalogue(out);
+}
+
 std::shared_ptr<Member> Engine::FindMember(const std::wstring &url, Machine **machine)
 {
     std::lock_guard<SlimMutex> l(m_networkLock);

@@ -156,6 +156,8 @@ public:
     // Whether a subscription to url will find its member: known here, or
     // confirmed by a listing of the node that serves its machine.
     bool HasMember(const std::wstring &url);
+    // Network::Catalogue of this engine's network.
+    void Catalogue(std::vector<uint64_t> &out);
     // Who ends the process when "shutdown" is asked (only a network node).
     void SetShutdownHandler(std::function<void()> handler);
 

@@ -1,5 +1,7 @@
 #include "Network.h"
 
+#include "Wire.h"
+
 #include <algorithm>
 #include <cwctype>
 
@@ -34,6 +36,12 @@ bool ReadName(const std::wstring &url, size_t &pos, std::wstring &name)
     while (pos < url.size() && url[pos] != L'\\' && url[pos] != L'.')
         name += url[pos++];
     return !name.empty();
+}
+
+// Whether a URL can spell the name as it is: ReadName takes it whole.
+bool Plain(const std::wstring &name)
+{
+    return !name.empty() && name[0] != L'\'' && name.find_first_of(L"\\.") == std::wstring::npos;
 }
 
 BrowseEntry Branch(const std::wstring &name)
@@ -93,6 +101,48 @@ Machine *Network::FindMachine(const std::wstring &name)
         if (EqualNoCase(m->name, wanted))
             return m.get();
     return nullptr;
+}
+
+void Network::Catalogue(std::vector<uint64_t> &out) const
+{
+    out.clear();
+    for (auto &machine : m_machines) {
+        if (!machine->node.empty())
+            continue; // another node's: only that node knows its members
+        std::wstring lower = machine->name;
+        for (wchar_t &c : lower)
+            c = static_cast<wchar_t>(towlower(c));
+        std::vector<std::wstring> spellings{lower};
+        if (EqualNoCase(machine->name, m_host))
+            spellings.push_back(L".");
+        for (const std::wstring &name : spellings) {
+            uint64_t machineHash = wire::UrlHash(L"\\\\" + name);
+            for (auto &process : machine->processes) {
+                if (!Plain(process->name))
+                    continue;
+                uint64_t processHash = wire::UrlHash(L"\\" + process->name, machineHash);
+                for (auto &object : process->objects)
+                    CatalogueObject(*object, processHash, out);
+            }
+        }
+    }
+    std::sort(out.begin(), out.end());
+    out.erase(std::unique(out.begin(), out.end()), out.end());
+}
+
+void Network::CatalogueObject(const Object &object, uint64_t parentHash, std::vector<uint64_t> &out)
+{
+    if (!Plain(object.name))
+        return;
+    uint64_t objectHash = wire::UrlHash(L"\\" + object.name, parentHash);
+    for (auto &member : object.members) {
+        if (member->idPart.empty())
+            out.push_back(objectHash); // "(implicit)": the object's URL
+        else if (Plain(member->idPart))
+            out.push_back(wire::UrlHash(L"." + member->idPart, objectHash));
+    }
+    for (auto &child : object.objects)
+        CatalogueObject(*child, objectHash, out);
 }
 
 Object *Network::FindObject(Process &process, const std::vector<std::wstring> &names, size_t count)

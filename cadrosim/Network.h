@@ -108,6 +108,10 @@ public:
     // Whether the URL a library builds from the listed name of one of
     // object's members is known to name a member (BrowseEntry::named).
     static bool NamesAMember(const Object &object, const std::wstring &name);
+    // The wire::CatalogueHash of every member of the machines served here,
+    // as its plain spelling names it (a name that only a quoted spelling
+    // reaches is left out): sorted, without repeats.
+    void Catalogue(std::vector<uint64_t> &out) const;
 
     // The object an object URL names, created with its path when missing;
     // null (with error) when the URL names no process.
@@ -135,6 +139,8 @@ private:
         for (auto &sub : o.objects)
             ForEachInObject(*sub, m, f);
     }
+
+    static void CatalogueObject(const Object &object, uint64_t parentHash, std::vector<uint64_t> &out);
 
     struct Path {
         Machine *machine = nullptr;

@@ -367,6 +367,7 @@ void NodeLink::Disconnected()
         if (m_state == State::Connected)
             m_state = State::Down;
         m_knownUrls.Clear();
+        ForgetCatalogue();
         for (auto &entry : m_pending)
             entry.second->done = true; // unanswered
         m_pending.clear();
@@ -738,13 +739,63 @@ void NodeLink::TopologyChanged()
     {
         std::lock_guard<SlimMutex> l(m_lock);
         m_knownUrls.Clear();
+        ForgetCatalogue();
         receivers = m_browserReceivers;
         for (auto *r : receivers)
             r->AddRef();
     }
+    m_changed.notify_all(); // subscribers waiting for a catalogue now out of date
     for (auto *r : receivers) {
         r->BrowseItemChanged();
         r->Release();
+    }
+}
+
+void NodeLink::ForgetCatalogue()
+{
+    std::vector<uint64_t>().swap(m_catalogue);
+    m_catalogueState = CatalogueState::Stale;
+    ++m_catalogueEpoch;
+}
+
+bool NodeLink::Catalogued(const wchar_t *url)
+{
+    const uint64_t hash = wire::CatalogueHash(url);
+    std::unique_lock<SlimMutex> l(m_lock);
+    for (;;) {
+        switch (m_catalogueState) {
+        case CatalogueState::Current:
+            return std::binary_search(m_catalogue.begin(), m_catalogue.end(), hash);
+        case CatalogueState::Refused:
+            return false;
+        case CatalogueState::Fetching:
+            m_changed.wait(l); // the fetch always ends: Ask has a deadline
+            continue;
+        case CatalogueState::Stale:
+            break;
+        }
+        m_catalogueState = CatalogueState::Fetching;
+        const unsigned epoch = m_catalogueEpoch;
+        l.unlock();
+        std::string reply;
+        bool answered = Ask(
+            wire::Kind::Catalogue, [](wire::Out &) {}, reply);
+        std::vector<uint64_t> hashes;
+        wire::In in(reply.data(), reply.size());
+        uint32_t count = answered ? in.U32() : 0;
+        bool whole = answered && in.Ok() && reply.size() - 4 == uint64_t{count} * sizeof(uint64_t);
+        if (whole) {
+            hashes.resize(count);
+            memcpy(hashes.data(), reply.data() + 4, count * sizeof(uint64_t));
+            if (!std::is_sorted(hashes.begin(), hashes.end()))
+                std::sort(hashes.begin(), hashes.end());
+        }
+        l.lock();
+        m_changed.notify_all();
+        if (epoch != m_catalogueEpoch)
+            return false; // out of date on arrival; the next subscriber fetches anew
+        m_catalogueState = whole ? CatalogueState::Current : CatalogueState::Refused;
+        m_catalogue.swap(hashes);
     }
 }
 
@@ -848,8 +899,13 @@ HRESULT NodeLink::Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeRece
             id, [](RemoteSubscription &s) { s.receiver->StatusChange(s.cookie, kCadroStatusConnecting, 0, 0); });
         return S_OK;
     }
-    bool known = m_knownUrls.Contains(wire::UrlHash(url));
-    if (known || OnLinkThread()) {
+    bool known = OnLinkThread() || m_knownUrls.Contains(wire::UrlHash(url));
+    if (!known) {
+        l.unlock();
+        known = Catalogued(url);
+        l.lock();
+    }
+    if (known) {
         Send(wire::Kind::Subscribe, [&](wire::Out &o) {
             o.U32(0);
             o.U32(sub->id);

@@ -214,6 +214,14 @@ private:
     // Calls a subscription pinned under the lock, then unpins it.
     template <class Call> void CallPinned(RemoteSubscription *sub, Call call);
     void TopologyChanged();
+    // Whether the node's catalogue names url's member: then its subscription
+    // cannot fail, and need not wait for the node's answer. The catalogue is
+    // fetched by the first subscriber that needs it after a topology change
+    // or a new connection, in one request that the others wait for. False
+    // when it could not be had (the node's answer then decides).
+    bool Catalogued(const wchar_t *url);
+    // Under m_lock: the catalogue is out of date.
+    void ForgetCatalogue();
     // Whether the node is connected, waiting for one being connected to (a
     // node being started) unless it is another machine's and no answer is
     // needed (forAnswer).
@@ -255,6 +263,10 @@ private:
     // one does not wait for the node's answer. Forgotten when the topology
     // changes or the link breaks.
     HashSet64 m_knownUrls;
+    enum class CatalogueState { Stale, Fetching, Current, Refused };
+    CatalogueState m_catalogueState = CatalogueState::Stale;
+    unsigned m_catalogueEpoch = 0;     // moved on by each ForgetCatalogue
+    std::vector<uint64_t> m_catalogue; // sorted wire::CatalogueHash values
     struct DataFields {
         uint32_t flags;
         CadroValue value;

@@ -131,6 +131,19 @@ bool NodeSession::Handle(wire::Kind kind, wire::In &in)
             List(request, url);
         break;
     }
+    case wire::Kind::Catalogue: {
+        uint32_t request = in.U32();
+        if (!in.Ok())
+            break;
+        std::vector<uint64_t> hashes;
+        m_engine.Catalogue(hashes);
+        Reply([&](wire::Out &out) {
+            out.U32(request);
+            out.U32(static_cast<uint32_t>(hashes.size()));
+            out.Raw(hashes.data(), hashes.size() * sizeof(uint64_t));
+        });
+        break;
+    }
     case wire::Kind::Execute: {
         uint32_t request = in.U32();
         std::wstring command = in.Text();

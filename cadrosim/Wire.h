@@ -5,8 +5,10 @@
 // truncated or garbled frame is refused, never read past.
 #include "CadroNetwork.h"
 
+#include <algorithm>
 #include <cstdint>
 #include <cstring>
+#include <cwctype>
 #include <string>
 #include <string_view>
 
@@ -20,6 +22,7 @@ enum class Kind : uint8_t {
     List,          // request, url
     Execute,       // request, command
     Load,          // request, description
+    Catalogue,     // request: CatalogueHash of every member this node serves
     // Node → library.
     Reply = 64, // request, then what the request asked for
     Data,       // flags, value, error flag, time low, time high, then ids to the end
@@ -65,6 +68,24 @@ inline uint64_t UrlHash(std::wstring_view url, uint64_t h = 1469598103934665603u
     return h;
 }
 
+// A member URL's hash for the node's catalogue: as UrlHash, with the
+// machine's name (which URLs may spell in any case) in lower case. The node
+// hashes each member's plain spelling ("\\machine\process\object.part", and "."
+// for its own host); a URL that spells it otherwise is not found there
+// and is looked up by the node.
+inline uint64_t CatalogueHash(std::wstring_view url)
+{
+    if (url.size() < 2 || url[0] != L'\\' || url[1] != L'\\')
+        return UrlHash(url);
+    size_t machineEnd = std::min(url.find(L'\\', 2), url.size());
+    uint64_t h = UrlHash(url.substr(0, 2));
+    for (size_t i = 2; i < machineEnd; ++i) {
+        h ^= static_cast<uint16_t>(towlower(url[i]));
+        h *= 1099511628211ull;
+    }
+    return UrlHash(url.substr(machineEnd), h);
+}
+
 // The URL of a member listed under url: its part (the name up to the first
 // "-") after the member separator; "(implicit)" is named by url itself.
 inline std::wstring MemberUrl(const std::wstring &url, const std::wstring &name)
@@ -91,6 +112,7 @@ public:
     void U8(uint8_t v) { Raw(&v, 1); }
     void U16(uint16_t v) { Raw(&v, 2); }
     void U32(uint32_t v) { Raw(&v, 4); }
+    void U64(uint64_t v) { Raw(&v, 8); }
     void F64(double v) { Raw(&v, 8); }
     void Text(std::wstring_view text);
     void Value(const CadroValue &value);
@@ -158,6 +180,7 @@ public:
     uint8_t U8() { return Get<uint8_t>(); }
     uint16_t U16() { return Get<uint16_t>(); }
     uint32_t U32() { return Get<uint32_t>(); }
+    uint64_t U64() { return Get<uint64_t>(); }
     double F64() { return Get<double>(); }
     std::wstring Text();
     // A text value gets a new text object, which the caller clears.

@@ -7,6 +7,7 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cstring>
 #include <vector>
 
@@ -171,4 +172,49 @@ TEST(Wire, AListingNamesTheMembersItsUrlsReach)
         EXPECT_TRUE(e.named) << e.name;
         EXPECT_TRUE(network.FindMember(wire::MemberUrl(objectUrl, e.name))) << e.name;
     }
+}
+
+TEST(Wire, TheCatalogueNamesWhatPlainSpellingsReachAndNothingElse)
+{
+    Network network(L"HOST");
+    for (const wchar_t *name : {L"HOST", L"Other"}) {
+        auto machine = std::make_unique<Machine>();
+        machine->name = name;
+        machine->processes.push_back(std::make_unique<Process>());
+        machine->processes.back()->name = L"p";
+        network.Machines().push_back(std::move(machine));
+    }
+    auto add = [&](const std::wstring &objectUrl, const std::wstring &name) {
+        auto member = std::make_shared<Member>();
+        member->name = name;
+        member->idPart = name == L"(implicit)" ? L"" : name.substr(0, name.find(L'-'));
+        std::wstring error;
+        ASSERT_TRUE(network.AddMember(objectUrl, member, error)) << error;
+    };
+    for (const wchar_t *name : {L"num", L"(implicit)", L"dash-With a description"})
+        add(L"\\\\.\\p\\o", name);
+    add(L"\\\\.\\p\\o\\sub", L"x");
+    add(L"\\\\.\\p\\'a.b'", L"y"); // only a quoted spelling reaches it
+    add(L"\\\\Other\\p\\o", L"num");
+    network.Machines().back()->node = L"127.0.0.1:1"; // another node's machine
+
+    std::vector<uint64_t> catalogue;
+    network.Catalogue(catalogue);
+    auto listed = [&](const wchar_t *url) {
+        return std::binary_search(catalogue.begin(), catalogue.end(), wire::CatalogueHash(url));
+    };
+    // What the library takes for granted: a hit names a member.
+    for (const wchar_t *url : {L"\\\\.\\p\\o.num", L"\\\\host\\p\\o.num", L"\\\\HoSt\\p\\o", L"\\\\HOST\\p\\o.dash",
+                               L"\\\\.\\p\\o\\sub.x"}) {
+        EXPECT_TRUE(listed(url)) << url;
+        EXPECT_TRUE(network.FindMember(url)) << url;
+    }
+    // Spellings the network does not take, or takes only quoted, and the
+    // other node's machine: left to that node's answer.
+    for (const wchar_t *url : {L"\\\\.\\P\\o.num", L"\\\\.\\p\\o.Num", L"\\\\.\\p\\o.dash-With a description",
+                               L"\\\\.\\p\\a.b.y", L"\\\\.\\p\\o.", L"\\\\Other\\p\\o.num", L"\\\\.\\p\\o\\sub"})
+        EXPECT_FALSE(listed(url)) << url;
+    // Four members, each under the host's name and under ".", once.
+    EXPECT_EQ(catalogue.size(), 8u);
+    EXPECT_TRUE(std::is_sorted(catalogue.begin(), catalogue.end()));
 }

@@ -1,23 +1,42 @@
 // node_client: another process on the network node, as a server's libraries
 // are. It subscribes to one member and prints what arrives ("status N",
-// "value V") for a number of seconds, or until a given value arrives.
+// "value V age A", A the milliseconds since the value's time stamp) for a
+// number of seconds, or until a given value arrives.
+//
+// With --many it subscribes to members m0 to m<count - 1> of one object,
+// one after another as a server's AddItems does, and prints how many
+// subscriptions were made and how many had their first value in time:
+// "subscribed N failed F", then "first values K".
 #include "CadroSim.h"
 #include "Unknown.h"
 
+#include <atomic>
 #include <cmath>
 #include <cstdio>
 #include <cstdlib>
 #include <cwchar>
+#include <memory>
+#include <string>
+#include <vector>
 
 namespace {
+// Milliseconds from a value's time stamp to now.
+long long AgeMs(uint32_t low, uint32_t high)
+{
+    FILETIME now;
+    GetSystemTimeAsFileTime(&now);
+    auto ticks = [](uint32_t l, uint32_t h) { return (static_cast<long long>(h) << 32) | l; };
+    return (ticks(now.dwLowDateTime, now.dwHighDateTime) - ticks(low, high)) / 10000;
+}
+
 class Printer : public CSimUnknown<ICadroRealTimeReceiver> {
 public:
     Printer(double last, HANDLE done) : m_last(last), m_done(done) {}
-    HRESULT STDMETHODCALLTYPE OnData(void *, uint32_t flags, const CadroValue *value, int32_t, uint32_t,
-                                     uint32_t) override
+    HRESULT STDMETHODCALLTYPE OnData(void *, uint32_t flags, const CadroValue *value, int32_t, uint32_t low,
+                                     uint32_t high) override
     {
         if ((flags & kCadroHasValue) && value->type == kCadroNumber) {
-            printf("value %.17g\n", value->number);
+            printf("value %.17g age %lld\n", value->number, AgeMs(low, high));
             if (value->number == m_last)
                 SetEvent(m_done);
         }
@@ -36,12 +55,68 @@ private:
     double m_last;
     HANDLE m_done;
 };
+
+// Counts the subscriptions (their cookies are their indexes) that have had
+// a value; done when all have.
+class FirstValues : public CSimUnknown<ICadroRealTimeReceiver> {
+public:
+    FirstValues(size_t count, HANDLE done) : m_seen(count), m_done(done) {}
+    HRESULT STDMETHODCALLTYPE OnData(void *cookie, uint32_t flags, const CadroValue *, int32_t, uint32_t,
+                                     uint32_t) override
+    {
+        size_t i = reinterpret_cast<size_t>(cookie);
+        if ((flags & kCadroHasValue) && i < m_seen.size() && !m_seen[i].exchange(true) && ++m_count == m_seen.size())
+            SetEvent(m_done);
+        return S_OK;
+    }
+    HRESULT STDMETHODCALLTYPE OnAttributes(void *, const CadroAttributes *) override { return S_OK; }
+    HRESULT STDMETHODCALLTYPE StatusChange(void *, uint32_t, uint32_t, uint32_t) override { return S_OK; }
+    size_t Count() const { return m_count.load(); }
+
+private:
+    std::vector<std::atomic<bool>> m_seen;
+    std::atomic<size_t> m_count{0};
+    HANDLE m_done;
+};
+
+int SubscribeMany(const std::wstring &object, size_t count, DWORD seconds)
+{
+    HANDLE done = CreateEventW(nullptr, TRUE, FALSE, nullptr);
+    auto *receiver = new FirstValues(count, done);
+    CadroRealTime *realTime = nullptr;
+    if (!CadroSim_NewRealTime(receiver, &realTime)) {
+        receiver->Release();
+        return 1;
+    }
+    SubscribeOptions options = {13, 7, 0, 0, 0};
+    std::vector<CadroDataItem *> items(count, nullptr);
+    size_t failed = 0;
+    for (size_t i = 0; i < count; ++i) {
+        std::wstring url = object + L".m" + std::to_wstring(i);
+        if (FAILED(realTime->Subscribe(url.c_str(), reinterpret_cast<void *>(i), &options, &items[i])))
+            ++failed;
+    }
+    printf("subscribed %lu failed %lu\n", static_cast<unsigned long>(count), static_cast<unsigned long>(failed));
+    fflush(stdout);
+    WaitForSingleObject(done, seconds * 1000);
+    printf("first values %lu\n", static_cast<unsigned long>(receiver->Count()));
+    for (CadroDataItem *item : items)
+        if (item)
+            item->Release();
+    realTime->Release();
+    receiver->Release();
+    CloseHandle(done);
+    return failed ? 1 : 0;
+}
 } // namespace
 
 int wmain(int argc, wchar_t **argv)
 {
+    if (argc == 5 && wcscmp(argv[1], L"--many") == 0)
+        return SubscribeMany(argv[2], wcstoul(argv[3], nullptr, 10), wcstoul(argv[4], nullptr, 10));
     if (argc != 3 && argc != 4) {
-        fwprintf(stderr, L"usage: node_client <member url> <seconds> [<last value>]\n");
+        fwprintf(stderr, L"usage: node_client <member url> <seconds> [<last value>]\n"
+                         L"       node_client --many <object url> <count> <seconds>\n");
         return 2;
     }
     HANDLE done = CreateEventW(nullptr, TRUE, FALSE, nullptr);

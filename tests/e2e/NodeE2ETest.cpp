@@ -411,3 +411,57 @@ TEST(NodeE2E, ItemsOfOneUrlInOneServerShareOneSubscriptionOnTheNode)
     first.Stop();
     EXPECT_TRUE(WaitForNoServerProcess(20000));
 }
+
+TEST(NodeE2E, MembersNothingListedAreSubscribedAtOnceAndUnknownOnesStillFail)
+{
+    // Ten thousand members that no listing named: the library subscribes to
+    // them one after another, as AddItems does, and each gets its value.
+    std::string text = "machine $HOST\nprocess bulk\nobject o\n";
+    for (int i = 0; i < 10000; ++i)
+        text += "member m" + std::to_string(i) + " value=" + std::to_string(i) + "\n";
+    TestNetwork network(L"bulk_network.txt", text);
+    ASSERT_TRUE(network.Ok());
+    ASSERT_EQ(network.Load(), 0);
+    std::string out;
+    RunAndCapture(L"\"" + BinPath(L"node_client.exe") + L"\" --many \\\\.\\bulk\\o 10000 120", out, 180000);
+    EXPECT_TRUE(Has(out, "subscribed 10000 failed 0")) << out;
+    EXPECT_TRUE(Has(out, "first values 10000")) << out;
+
+    // What the node does not have is refused at once, as before, however
+    // close its name is to members it has: a process's name is exact.
+    for (const wchar_t *url : {L"\\\\.\\bulk\\o.m10000", L"\\\\.\\BULK\\o.m1", L"\\\\.\\bulk\\o.m1.x"}) {
+        RunAndCapture(L"\"" + BinPath(L"node_client.exe") + L"\" " + url + L" 0", out, 60000);
+        EXPECT_TRUE(Has(out, "subscribed 0x80070490")) << out;
+    }
+    // The machine's name in any case, or "." for this machine: the member.
+    wchar_t host[MAX_COMPUTERNAME_LENGTH + 1];
+    DWORD size = MAX_COMPUTERNAME_LENGTH + 1;
+    ASSERT_TRUE(GetComputerNameW(host, &size));
+    std::wstring lower(host), upper(host);
+    for (size_t i = 0; i < lower.size(); ++i) {
+        lower[i] = towlower(lower[i]);
+        upper[i] = towupper(upper[i]);
+    }
+    for (const std::wstring &machine : {std::wstring(L"."), lower, upper}) {
+        RunAndCapture(L"\"" + BinPath(L"node_client.exe") + L"\" \\\\" + machine + L"\\bulk\\o.m7 20 7", out, 60000);
+        EXPECT_TRUE(Has(out, "subscribed 0x00000000")) << out;
+        EXPECT_TRUE(Has(out, "value 7 ")) << out;
+    }
+}
+
+TEST(NodeE2E, AComputedMemberSubscribedAgainAfterTenIdleSecondsIsCurrent)
+{
+    const std::wstring sine = L"\\\\.\\proc1\\Waveform.sine";
+    std::string out;
+    RunAndCapture(L"\"" + BinPath(L"node_client.exe") + L"\" " + sine + L" 2", out, 60000);
+    ASSERT_TRUE(Has(out, "value ")) << out;
+    Sleep(10500); // nobody subscribes: the node computes nothing for it
+    RunAndCapture(L"\"" + BinPath(L"node_client.exe") + L"\" " + sine + L" 1", out, 60000);
+    // The first value was computed when it was subscribed again: its time
+    // stamp is that of then, not of ten seconds before.
+    size_t at = out.find("value ");
+    ASSERT_NE(at, std::string::npos) << out;
+    size_t age = out.find(" age ", at);
+    ASSERT_NE(age, std::string::npos) << out;
+    EXPECT_LT(atoll(out.c_str() + age + 5), 5000) << out;
+}
