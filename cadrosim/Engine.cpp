@@ -280,7 +280,7 @@ std::shared_ptr<Member> Engine::FindMember(const std::wstring &url, Machine **ma
 }
 
 HRESULT Engine::Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeReceiver *receiver, CadroDataItem **out,
-                          bool hereOnly)
+                          bool hereOnly, BatchReceiver *batch)
 {
     if (!out || !receiver || !url)
         return E_POINTER;
@@ -299,6 +299,7 @@ HRESULT Engine::Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeReceiv
     auto *sub = new (std::nothrow) Subscription(member, receiver, cookie);
     if (!sub)
         return E_OUTOFMEMORY;
+    sub->batch = batch;
     Shard &shard = *member->shard;
     {
         std::lock_guard<SlimMutex> l(shard.lock);

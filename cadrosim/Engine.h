@@ -26,6 +26,27 @@ const std::wstring &LocalHostName();
 // A text file in UTF-8; false when it cannot be read.
 bool ReadTextFile(const std::wstring &path, std::wstring &text);
 
+// One value of a tick for one subscription, as OnData takes it.
+struct DataEntry {
+    void *cookie;
+    const CadroValue *value;
+    int32_t error;
+    uint32_t low, high;
+};
+
+// A receiver inside this library that takes a tick's values in one call
+// (a node's session): it then holds its locks once for the batch rather
+// than once for each value. Its subscriptions' other callbacks still come
+// through ICadroRealTimeReceiver. Every entry has the flags value, quality
+// and time.
+class BatchReceiver {
+public:
+    virtual void OnDataBatch(const DataEntry *entries, size_t count) = 0;
+
+protected:
+    ~BatchReceiver() = default;
+};
+
 // One subscription; it is the CadroDataItem the subscriber holds.
 struct Subscription : CSimUnknown<CadroDataItem> {
     Subscription(std::shared_ptr<Member> member, ICadroRealTimeReceiver *receiver, void *cookie);
@@ -44,6 +65,7 @@ struct Subscription : CSimUnknown<CadroDataItem> {
     uint32_t slot = 0;   // its place in the member's subscriptions
     std::shared_ptr<Member> member;
     ICadroRealTimeReceiver *receiver;
+    BatchReceiver *batch = nullptr; // the receiver's, when it takes batches
     void *cookie;
 };
 
@@ -101,8 +123,15 @@ private:
         double elapsedMs;
         FILETIME time;
     };
-    void Tick(std::unique_lock<SlimMutex> &l, const std::shared_ptr<Member> &member, Clock::time_point at,
-              const Moment &moment);
+    // The members due at the moment, up to a limit: their values computed
+    // under the lock, then delivered together without it.
+    void TickDue(std::unique_lock<SlimMutex> &l, const Moment &moment, unsigned generation);
+    // Under the lock: the member's next value and its place on the heap;
+    // its active subscriptions join the tick's targets.
+    void Tick(Due &&due, const Moment &moment);
+    // Without the lock: the tick's values to their receivers, a run of
+    // subscriptions of one batch receiver in one call.
+    void DeliverTick();
     void Dispatch(std::unique_lock<SlimMutex> &l, Event e);
     // Runs callbacks with the lock released (always inside a unit).
     template <class F> void Deliver(std::unique_lock<SlimMutex> &l, F callbacks);
@@ -118,7 +147,17 @@ private:
     std::deque<Event> m_events;
     std::priority_queue<Due, std::vector<Due>, std::greater<Due>> m_heap;
     std::vector<Subscription *> m_graveyard;
-    std::vector<Subscription *> m_targets; // of the tick under way
+    // Of the tick under way: the values computed (indexes into m_values)
+    // and who receives them; the shard's, kept between ticks.
+    struct Computed {
+        CadroValue value;
+        int32_t error;
+        uint32_t low, high;
+    };
+    std::vector<Due> m_due;
+    std::vector<Computed> m_values;
+    std::vector<std::pair<Subscription *, uint32_t>> m_targets;
+    std::vector<DataEntry> m_entries;
     // Units of work of the shard's thread begun and ended: a release from
     // another thread waits only for the unit in flight when it detached
     // (which may still read the subscription after a batch of callbacks),
@@ -144,8 +183,9 @@ public:
     // hereOnly: a machine that another node serves is unknown (a node
     // passes on only its libraries' requests, so that two nodes that name
     // each other cannot send one round for ever).
+    // batch: the receiver's batch interface, when it has one.
     HRESULT Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeReceiver *receiver, CadroDataItem **out,
-                      bool hereOnly = false);
+                      bool hereOnly = false, BatchReceiver *batch = nullptr);
     void Unsubscribe(Subscription *sub);
     HRESULT Write(Subscription *sub, const CadroValue *value);
     HRESULT Read(Subscription *sub, uint32_t *flags, CadroValue *value, int32_t *errorFlag, FILETIME *time);

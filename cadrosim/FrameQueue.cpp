@@ -30,14 +30,19 @@ bool FrameQueue::PushId(wire::Kind kind, std::string_view fields, uint32_t id)
     std::lock_guard<SlimMutex> l(m_lock);
     if (!m_channel)
         return false;
-    if (m_out.ExtendLast(kind, fields, id))
-        return Queued(false);
     bool wake = m_out.Empty();
+    Add(kind, fields, id);
+    return Queued(wake);
+}
+
+void FrameQueue::Add(wire::Kind kind, std::string_view fields, uint32_t id)
+{
+    if (m_out.ExtendLast(kind, fields, id))
+        return;
     m_out.Begin(kind);
     m_out.Raw(fields.data(), fields.size());
     m_out.U32(id);
     m_out.End();
-    return Queued(wake);
 }
 
 void FrameQueue::Detach()

@@ -45,6 +45,17 @@ public:
     // them: added to the last frame queued when that has the same fields (a
     // value delivered to many subscriptions travels once).
     bool PushId(wire::Kind kind, std::string_view fields, uint32_t id);
+    // PushId for many under one hold of the lock: fill(push) calls
+    // push(kind, fields, id) for each.
+    template <class Fill> bool PushIds(Fill fill)
+    {
+        std::lock_guard<SlimMutex> l(m_lock);
+        if (!m_channel)
+            return false;
+        bool wake = m_out.Empty();
+        fill([this](wire::Kind kind, std::string_view fields, uint32_t id) { Add(kind, fields, id); });
+        return Queued(wake && !m_out.Empty());
+    }
     // Writes what is queued from this thread, unless a write is under way
     // (which then takes it along).
     void Flush();
@@ -55,6 +66,8 @@ private:
     // Under the lock, after a frame was added: wakes the writer, or closes a
     // pipe whose reader has fallen too far behind.
     bool Queued(bool wake);
+    // Under the lock: PushId's frame or id.
+    void Add(wire::Kind kind, std::string_view fields, uint32_t id);
     void WriteLoop();
     // Under l: writes batches until the queue is empty; m_writing is ours.
     void Drain(std::unique_lock<SlimMutex> &l);

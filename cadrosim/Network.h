@@ -32,23 +32,26 @@ struct Source {
 struct Machine;
 
 struct Member {
-    std::wstring name;   // as browsed, e.g. "cosine-Cosine wave"
-    std::wstring idPart; // as in URLs, e.g. "cosine"; empty for "(implicit)"
-    uint32_t type = kCadroNumber;
-    uint32_t access = 3; // bit 0 readable, bit 1 writable
-    Source source;
-
+    // What a tick reads and writes comes first, in the member's first two
+    // cache lines (a node ticks ten thousand members at 10 ms, each a cache
+    // miss); the names, which only lookups and listings read, last.
     // Guarded by the member's shard.
-    Machine *machine = nullptr;
-    Shard *shard = nullptr;
-    SimValue value;
     bool hasValue = false;
     bool good = true;
-    FILETIME time = {};
     bool stalled = false;
     bool removed = false;
     bool scheduled = false;
+    uint32_t type = kCadroNumber;
     SubscriberList subscriptions; // active ones
+    Machine *machine = nullptr;
+    FILETIME time = {};
+    SimValue value;
+    Source source;
+    Shard *shard = nullptr;
+
+    uint32_t access = 3; // bit 0 readable, bit 1 writable
+    std::wstring name;   // as browsed, e.g. "cosine-Cosine wave"
+    std::wstring idPart; // as in URLs, e.g. "cosine"; empty for "(implicit)"
 };
 
 // Objects and members are listed in the order they were added and found

@@ -204,7 +204,7 @@ void NodeSession::Subscribe(wire::In &in)
     if (fresh) {
         // Outside the lock: the engine may answer at once, from this thread.
         CadroDataItem *item = nullptr;
-        hr = m_engine.Subscribe(url.c_str(), CookieOf(fresh), this, &item, m_fromNode);
+        hr = m_engine.Subscribe(url.c_str(), CookieOf(fresh), this, &item, m_fromNode, this);
         std::unique_lock<SlimMutex> l(m_feedsLock);
         Feed *feed = FeedOf(fresh);
         if (feed && SUCCEEDED(hr)) {
@@ -426,6 +426,35 @@ HRESULT STDMETHODCALLTYPE NodeSession::OnData(void *cookie, uint32_t flags, cons
         m_queue.PushId(wire::Kind::FeedData, fields, feed->id);
     });
     return S_OK;
+}
+
+void NodeSession::OnDataBatch(const DataEntry *entries, size_t count)
+{
+    constexpr uint32_t kFlags = kCadroHasValue | kCadroHasQuality | kCadroHasTime;
+    std::lock_guard<SlimMutex> l(m_feedsLock);
+    // The feeds are scattered in memory: each is asked for a few entries
+    // ahead, its place in the table a few before that.
+    constexpr size_t kAhead = 4;
+    auto slotOf = [&](size_t i) { return (IdOf(entries[i].cookie) & wire::kFeedSlotMask) - 1; };
+    m_queue.PushIds([&](auto push) {
+        for (size_t i = 0; i < count; ++i) {
+            if (i + 2 * kAhead < count && slotOf(i + 2 * kAhead) < m_feeds.size())
+                __builtin_prefetch(&m_feeds[slotOf(i + 2 * kAhead)]);
+            if (i + kAhead < count && slotOf(i + kAhead) < m_feeds.size()) {
+                const char *feed = reinterpret_cast<const char *>(m_feeds[slotOf(i + kAhead)].get());
+                __builtin_prefetch(feed);
+                __builtin_prefetch(feed + 64);
+            }
+            const DataEntry &e = entries[i];
+            Feed *feed = FeedOf(IdOf(e.cookie));
+            if (!feed)
+                continue;
+            WithFields(kFlags, *e.value, e.error, e.low, e.high, [&](std::string_view fields) {
+                feed->data.Assign(fields);
+                push(wire::Kind::FeedData, fields, feed->id);
+            });
+        }
+    });
 }
 
 HRESULT STDMETHODCALLTYPE NodeSession::OnAttributes(void *cookie, const CadroAttributes *attributes)

@@ -19,7 +19,7 @@
 
 namespace cadrosim {
 
-class NodeSession : public CSimUnknown<ICadroRealTimeReceiver> {
+class NodeSession : public CSimUnknown<ICadroRealTimeReceiver>, public BatchReceiver {
 public:
     // Starts serving a connected library, or the node of another machine
     // (fromNode: it is served only the machines this node serves itself);
@@ -40,6 +40,9 @@ public:
                                      uint32_t timeLow, uint32_t timeHigh) override;
     HRESULT STDMETHODCALLTYPE OnAttributes(void *cookie, const CadroAttributes *attributes) override;
     HRESULT STDMETHODCALLTYPE StatusChange(void *cookie, uint32_t status, uint32_t, uint32_t) override;
+    // A tick's values: the table held alone for the batch (no feed lock
+    // for each), and the queue's lock once.
+    void OnDataBatch(const DataEntry *entries, size_t count) override;
 
 private:
     NodeSession(Engine &engine, std::shared_ptr<Channel> channel, bool fromNode, HANDLE ended);
@@ -59,7 +62,9 @@ private:
         std::string m_long;
     };
     struct Feed {
-        uint32_t id = 0;   // with its slot's generation: the engine's cookie
+        // What a value reads and writes first, in the feed's first lines.
+        uint32_t id = 0; // with its slot's generation: the engine's cookie
+        LastData data;
         uint64_t hash = 0; // of the URL
         std::wstring url;
         CadroDataItem *item = nullptr;
@@ -69,7 +74,6 @@ private:
         bool hasAttributes = false;
         bool dead = false; // its member has gone: a newcomer makes a new feed
         CadroAttributes attributes = {};
-        LastData data;
         SlimMutex lock; // its values, under the table's shared lock
     };
     struct Membership {

@@ -179,14 +179,8 @@ void Shard::Run(unsigned generation)
         if (!m_heap.empty() && m_heap.top().at <= moment.now + kTickSlack) {
             moment.elapsedMs = m_engine.ElapsedMs(moment.now);
             GetSystemTimeAsFileTime(&moment.time);
-            for (int n = 0; n < kMostTicksInARow && !m_heap.empty() && m_heap.top().at <= moment.now + kTickSlack &&
-                            m_events.empty() && m_generation == generation;
-                 ++n) {
-                Due due = m_heap.top();
-                m_heap.pop();
-                Unit([&] { Tick(l, due.member, due.at, moment); });
-                Sweep(l);
-            }
+            Unit([&] { TickDue(l, moment, generation); });
+            Sweep(l);
             continue;
         }
         if (m_busy) {
@@ -208,41 +202,95 @@ void Shard::Run(unsigned generation)
     }
 }
 
-void Shard::Tick(std::unique_lock<SlimMutex> &l, const std::shared_ptr<Member> &member, Clock::time_point at,
-                 const Moment &moment)
+void Shard::TickDue(std::unique_lock<SlimMutex> &l, const Moment &moment, unsigned generation)
 {
-    Member &m = *member;
+    m_due.clear();
+    m_values.clear();
+    m_targets.clear();
+    for (int n = 0; n < kMostTicksInARow && !m_heap.empty() && m_heap.top().at <= moment.now + kTickSlack &&
+                    m_events.empty() && m_generation == generation;
+         ++n) {
+        // Moved off the heap rather than copied: the comparison reads only
+        // the time, and a copy would count the member up and down again.
+        m_due.push_back(std::move(const_cast<Due &>(m_heap.top())));
+        m_heap.pop();
+    }
+    // Each member and its first subscription are elsewhere in memory, and
+    // a tick is mostly the wait for them: they are asked for a few members
+    // ahead, the member before its subscription.
+    constexpr size_t kAhead = 8;
+    for (size_t i = 0; i < m_due.size(); ++i) {
+        if (i + kAhead < m_due.size()) {
+            const char *member = reinterpret_cast<const char *>(m_due[i + kAhead].member.get());
+            __builtin_prefetch(member);
+            __builtin_prefetch(member + 64);
+        }
+        if (i + kAhead / 2 < m_due.size()) {
+            SubscriberList &subs = m_due[i + kAhead / 2].member->subscriptions;
+            if (!subs.empty())
+                __builtin_prefetch(subs[0]);
+        }
+        Tick(std::move(m_due[i]), moment);
+    }
+    if (!m_targets.empty())
+        Deliver(l, [&] { DeliverTick(); });
+    for (Computed &c : m_values)
+        ClearCadroValue(c.value);
+}
+
+void Shard::Tick(Due &&due, const Moment &moment)
+{
+    Member &m = *due.member;
     if (m.removed || m.subscriptions.empty()) {
         m.scheduled = false;
         return;
     }
-    auto next = at + std::chrono::milliseconds(m.source.period);
-    m_heap.push({next < moment.now ? moment.now + std::chrono::milliseconds(m.source.period) : next, member});
+    auto next = due.at + std::chrono::milliseconds(m.source.period);
+    m_heap.push(
+        {next < moment.now ? moment.now + std::chrono::milliseconds(m.source.period) : next, std::move(due.member)});
     if (m.stalled || !m.machine->connected)
         return;
     m.value = NextValue(m, moment.elapsedMs, m_engine.Random());
     m.hasValue = true;
     m.time = moment.time;
 
-    CadroValue value = {};
-    ToCadroValue(m.value, value);
-    // The list is the shard's, kept between ticks: an allocation per tick
-    // costs more than the tick when the shards meet in the process's heap.
-    std::vector<Subscription *> &targets = m_targets;
-    targets.clear();
+    auto index = static_cast<uint32_t>(m_values.size());
+    Computed c = {};
+    ToCadroValue(m.value, c.value);
+    c.error = m.good ? 0 : 1;
+    Split(m.time, c.low, c.high);
+    m_values.push_back(c);
     for (Subscription *sub : m.subscriptions)
         if (sub->active)
-            targets.push_back(sub);
-    int32_t error = m.good ? 0 : 1;
-    uint32_t low, high;
-    Split(m.time, low, high);
-    Deliver(l, [&] {
-        for (Subscription *sub : targets)
-            if (!sub->dead)
-                sub->receiver->OnData(sub->cookie, kCadroHasValue | kCadroHasQuality | kCadroHasTime, &value, error,
-                                      low, high);
-    });
-    ClearCadroValue(value);
+            m_targets.push_back({sub, index});
+}
+
+void Shard::DeliverTick()
+{
+    constexpr uint32_t kFlags = kCadroHasValue | kCadroHasQuality | kCadroHasTime;
+    BatchReceiver *batch = nullptr;
+    auto flush = [&] {
+        if (!m_entries.empty())
+            batch->OnDataBatch(m_entries.data(), m_entries.size());
+        m_entries.clear();
+    };
+    for (auto [sub, index] : m_targets) {
+        // Released by a callback of this batch, or by another thread that
+        // now waits for the batch to end.
+        if (sub->dead)
+            continue;
+        const Computed &c = m_values[index];
+        if (!sub->batch) {
+            sub->receiver->OnData(sub->cookie, kFlags, &c.value, c.error, c.low, c.high);
+            continue;
+        }
+        if (sub->batch != batch) {
+            flush();
+            batch = sub->batch;
+        }
+        m_entries.push_back({sub->cookie, &c.value, c.error, c.low, c.high});
+    }
+    flush();
 }
 
 void Shard::Dispatch(std::unique_lock<SlimMutex> &l, Event e)

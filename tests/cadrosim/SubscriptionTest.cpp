@@ -205,6 +205,38 @@ TEST_F(SimTest, ReleaseEndsCallbacksBeforeItReturns)
     recorder.onData = nullptr;
 }
 
+TEST_F(SimTest, ASubscriptionReleasedInAnotherOnesCallbackHearsNothingMoreOfTheSameTick)
+{
+    // Two subscriptions of one member get each tick's value in one batch;
+    // the first to hear it releases the other, which must not be called
+    // for that tick (or any later one), whichever of them comes first.
+    for (int round = 0; round < 10; ++round) {
+        CadroDataItem *a = Subscribe(L"\\\\.\\p\\o.fast");
+        void *aCookie = LastCookie();
+        CadroDataItem *b = Subscribe(L"\\\\.\\p\\o.fast");
+        void *bCookie = LastCookie();
+        ASSERT_TRUE(
+            recorder.WaitFor([&](auto &all) { return DataCount(all, aCookie) >= 2 && DataCount(all, bCookie) >= 2; }));
+        items.erase(std::remove(items.begin(), items.end(), b), items.end());
+        std::atomic<CadroDataItem *> pending{b};
+        std::atomic<size_t> heardBefore{SIZE_MAX};
+        recorder.onData = [&](void *cookie) {
+            CadroDataItem *victim = cookie == aCookie ? pending.exchange(nullptr) : nullptr;
+            if (!victim)
+                return;
+            size_t before = recorder.Count(bCookie, Delivery::Data);
+            victim->Release();
+            heardBefore = before;
+        };
+        ASSERT_TRUE(recorder.WaitFor([&](auto &) { return heardBefore.load() != SIZE_MAX; }));
+        size_t seen = DataCount(recorder.Snapshot(), aCookie);
+        ASSERT_TRUE(recorder.WaitFor([&](auto &all) { return DataCount(all, aCookie) >= seen + 2; }));
+        EXPECT_EQ(recorder.Count(bCookie, Delivery::Data), heardBefore.load()) << "round " << round;
+        recorder.onData = nullptr;
+        Drop(a);
+    }
+}
+
 TEST_F(SimTest, AReleaseThatWaitsForACallbackOwnsItsSubscriptionUntilItReturns)
 {
     // One subscription's callback holds the shard while a second one of the
