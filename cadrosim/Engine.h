@@ -129,6 +129,11 @@ private:
     // Under the lock: the member's next value and its place on the heap;
     // its active subscriptions join the tick's targets.
     void Tick(Due &&due, const Moment &moment);
+    // The first slot of a period after a time. Periods count from the
+    // engine's start, so that members of one period tick together: one wake
+    // of the shard and one batch for all of them every period, rather than
+    // one for each, microseconds apart.
+    Clock::time_point NextSlot(Clock::time_point after, unsigned period) const;
     // Without the lock: the tick's values to their receivers, a run of
     // subscriptions of one batch receiver in one call.
     void DeliverTick();
@@ -214,6 +219,7 @@ public:
 
     double ElapsedMs() const { return ElapsedMs(std::chrono::steady_clock::now()); }
     double ElapsedMs(std::chrono::steady_clock::time_point now) const;
+    std::chrono::steady_clock::time_point Epoch() const { return m_epoch; }
     unsigned NextShard() { return m_nextShard++ % m_shards.size(); }
     std::mt19937 &Random() { return m_random; }
 

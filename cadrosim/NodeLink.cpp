@@ -24,6 +24,16 @@ constexpr DWORD kReconnectPauseMs = 500;
 constexpr DWORD kRestartMs = 2000;
 constexpr DWORD kTcpConnectMs = 3000;
 constexpr size_t kMostKnownUrls = 4u << 20;
+// A batch of values reaches thousands of feeds and subscriptions scattered
+// in memory, each a cache miss: they are asked for this many entries ahead.
+constexpr size_t kPrefetchAhead = 4;
+
+// The first two cache lines of an object (nothing is read past them).
+inline void PrefetchObject(const void *p)
+{
+    __builtin_prefetch(p);
+    __builtin_prefetch(static_cast<const char *>(p) + 64);
+}
 constexpr uint32_t kFeedBit = 1u << 31; // on a batch entry's index: a feed's
 
 std::wstring NodeProgramPath()
@@ -593,6 +603,17 @@ void NodeLink::TakeData(wire::In &in, bool feeds)
     }
 }
 
+void NodeLink::PrefetchFeed(size_t i) const
+{
+    // The feed's place in the table a few entries before the feed itself.
+    auto slotOf = [&](size_t at) { return (m_batchIds[at].first & wire::kFeedSlotMask) - 1; };
+    if (i + kPrefetchAhead < m_batchIds.size() && (m_batchIds[i + kPrefetchAhead].second & kFeedBit) &&
+        slotOf(i + kPrefetchAhead) < m_feeds.size())
+        __builtin_prefetch(&m_feeds[slotOf(i + kPrefetchAhead)]);
+    if (i < m_batchIds.size() && (m_batchIds[i].second & kFeedBit) && slotOf(i) < m_feeds.size())
+        PrefetchObject(m_feeds[slotOf(i)]);
+}
+
 void NodeLink::DeliverData()
 {
     if (m_batchFields.empty())
@@ -600,7 +621,9 @@ void NodeLink::DeliverData()
     {
         std::lock_guard<SlimMutex> l(m_lock);
         m_delivering = true;
-        for (auto [id, tagged] : m_batchIds) {
+        for (size_t i = 0; i < m_batchIds.size(); ++i) {
+            PrefetchFeed(i + kPrefetchAhead);
+            auto [id, tagged] = m_batchIds[i];
             uint32_t index = tagged & ~kFeedBit;
             const DataFields &f = m_batchFields[index];
             if (tagged & kFeedBit) {
@@ -618,7 +641,10 @@ void NodeLink::DeliverData()
     // No pins: a subscription let go during the batch is deleted after it
     // (Forget), and the one being called is published first, so that its
     // holder either is seen here or sees the call and waits for it.
-    for (auto [sub, index] : m_batchSubs) {
+    for (size_t i = 0; i < m_batchSubs.size(); ++i) {
+        if (i + kPrefetchAhead < m_batchSubs.size())
+            PrefetchObject(m_batchSubs[i + kPrefetchAhead].first);
+        auto [sub, index] = m_batchSubs[i];
         m_callingSub.store(sub);
         if (!sub->IsForgotten()) {
             const DataFields &f = m_batchFields[index];

@@ -182,6 +182,9 @@ private:
     // batch, then the receivers are called without it.
     void TakeData(wire::In &in, bool feeds);
     void DeliverData();
+    // Asks for the feed of the batch's entry i, and for the place in the
+    // table of one further on.
+    void PrefetchFeed(size_t i) const;
     // The link's thread publishes the subscription it calls now (null when
     // none) and wakes holders waiting for a call to end.
     void WakeWaiters(RemoteSubscription *calling);

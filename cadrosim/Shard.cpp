@@ -84,8 +84,7 @@ void Shard::Schedule(const std::shared_ptr<Member> &member)
         m.value = NextValue(m, m_engine.ElapsedMs(now), m_engine.Random());
         GetSystemTimeAsFileTime(&m.time);
     }
-    auto first = m.hasValue ? std::chrono::milliseconds(m.source.period) : std::chrono::milliseconds(0);
-    m_heap.push({now + first, member});
+    m_heap.push({m.hasValue ? NextSlot(now, m.source.period) : now, member});
     m_wake.notify_one();
 }
 
@@ -245,9 +244,8 @@ void Shard::Tick(Due &&due, const Moment &moment)
         m.scheduled = false;
         return;
     }
-    auto next = due.at + std::chrono::milliseconds(m.source.period);
-    m_heap.push(
-        {next < moment.now ? moment.now + std::chrono::milliseconds(m.source.period) : next, std::move(due.member)});
+    // A shard that fell behind skips the slots it missed.
+    m_heap.push({NextSlot(std::max(due.at, moment.now), m.source.period), std::move(due.member)});
     if (m.stalled || !m.machine->connected)
         return;
     m.value = NextValue(m, moment.elapsedMs, m_engine.Random());
@@ -263,6 +261,12 @@ void Shard::Tick(Due &&due, const Moment &moment)
     for (Subscription *sub : m.subscriptions)
         if (sub->active)
             m_targets.push_back({sub, index});
+}
+
+Shard::Clock::time_point Shard::NextSlot(Clock::time_point after, unsigned period) const
+{
+    const std::chrono::milliseconds slot(period);
+    return m_engine.Epoch() + ((after - m_engine.Epoch()) / slot + 1) * slot;
 }
 
 void Shard::DeliverTick()
