@@ -15,6 +15,7 @@
 #include <queue>
 #include <random>
 #include <thread>
+#include <unordered_map>
 #include <vector>
 
 namespace cadrosim {
@@ -106,9 +107,20 @@ public:
 
 private:
     using Clock = std::chrono::steady_clock;
+    // The members of one period, ticked together at its slots (see
+    // NextSlot): a tick walks one array of members rather than popping each
+    // off a heap.
+    struct Cadence {
+        unsigned period = 0;
+        Clock::time_point next; // its next slot, while on the heap
+        size_t cursor = 0;      // members of the slot under way already ticked
+        bool onHeap = false;
+        std::vector<std::shared_ptr<Member>> members; // each knows its place
+    };
+    // A cadence's next slot.
     struct Due {
         Clock::time_point at;
-        std::shared_ptr<Member> member;
+        uint32_t cadence;
         bool operator>(const Due &o) const { return at > o.at; }
     };
 
@@ -126,9 +138,19 @@ private:
     // The members due at the moment, up to a limit: their values computed
     // under the lock, then delivered together without it.
     void TickDue(std::unique_lock<SlimMutex> &l, const Moment &moment, unsigned generation);
-    // Under the lock: the member's next value and its place on the heap;
-    // its active subscriptions join the tick's targets.
-    void Tick(Due &&due, const Moment &moment);
+    // Ticks the cadence's members from its cursor, at most budget of them;
+    // false when the slot is not done yet.
+    bool TickCadence(uint32_t index, const Moment &moment, int &budget);
+    // Under the lock: the member's next value; its active subscriptions
+    // join the tick's targets. False when it is to leave its cadence (no
+    // subscriber, or removed from the network).
+    bool Tick(Member &m, const Moment &moment);
+    // A member enters its period's cadence (which goes on the heap if it
+    // was off), or leaves it.
+    void Join(std::shared_ptr<Member> member, Clock::time_point now);
+    void Leave(Cadence &cadence, size_t place);
+    // Whether anything is to be ticked at the moment.
+    bool HasDue(const Moment &moment) const;
     // The first slot of a period after a time. Periods count from the
     // engine's start, so that members of one period tick together: one wake
     // of the shard and one batch for all of them every period, rather than
@@ -150,7 +172,12 @@ private:
     SlimCondition m_wake;
     SlimCondition m_unitDone;
     std::deque<Event> m_events;
+    std::vector<Cadence> m_cadences;
+    std::unordered_map<unsigned, uint32_t> m_cadenceOf; // by period
     std::priority_queue<Due, std::vector<Due>, std::greater<Due>> m_heap;
+    // Members without a value yet: ticked at once, then in their cadence.
+    std::vector<std::shared_ptr<Member>> m_firsts;
+    std::vector<std::shared_ptr<Member>> m_ticking; // the firsts being ticked
     std::vector<Subscription *> m_graveyard;
     // Of the tick under way: the values computed (indexes into m_values)
     // and who receives them; the shard's, kept between ticks.
@@ -159,7 +186,6 @@ private:
         int32_t error;
         uint32_t low, high;
     };
-    std::vector<Due> m_due;
     std::vector<Computed> m_values;
     std::vector<std::pair<Subscription *, uint32_t>> m_targets;
     std::vector<DataEntry> m_entries;

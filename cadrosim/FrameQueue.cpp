@@ -37,12 +37,8 @@ bool FrameQueue::PushId(wire::Kind kind, std::string_view fields, uint32_t id)
 
 void FrameQueue::Add(wire::Kind kind, std::string_view fields, uint32_t id)
 {
-    if (m_out.ExtendLast(kind, fields, id))
-        return;
-    m_out.Begin(kind);
-    m_out.Raw(fields.data(), fields.size());
-    m_out.U32(id);
-    m_out.End();
+    if (!m_out.ExtendLast(kind, fields, id))
+        m_out.Frame(kind, fields, id);
 }
 
 void FrameQueue::Detach()

@@ -42,6 +42,7 @@ struct Member {
     bool removed = false;
     bool scheduled = false;
     uint32_t type = kCadroNumber;
+    uint32_t cadenceSlot = 0;     // its place in its shard's cadence, while scheduled
     SubscriberList subscriptions; // active ones
     Machine *machine = nullptr;
     FILETIME time = {};

@@ -84,8 +84,44 @@ void Shard::Schedule(const std::shared_ptr<Member> &member)
         m.value = NextValue(m, m_engine.ElapsedMs(now), m_engine.Random());
         GetSystemTimeAsFileTime(&m.time);
     }
-    m_heap.push({m.hasValue ? NextSlot(now, m.source.period) : now, member});
+    if (m.hasValue)
+        Join(member, now);
+    else
+        m_firsts.push_back(member);
     m_wake.notify_one();
+}
+
+void Shard::Join(std::shared_ptr<Member> member, Clock::time_point now)
+{
+    const unsigned period = member->source.period;
+    auto found = m_cadenceOf.find(period);
+    uint32_t index;
+    if (found != m_cadenceOf.end()) {
+        index = found->second;
+    } else {
+        index = static_cast<uint32_t>(m_cadences.size());
+        m_cadences.emplace_back();
+        m_cadences.back().period = period;
+        m_cadenceOf.emplace(period, index);
+    }
+    Cadence &cadence = m_cadences[index];
+    member->cadenceSlot = static_cast<uint32_t>(cadence.members.size());
+    cadence.members.push_back(std::move(member));
+    if (!cadence.onHeap) {
+        cadence.onHeap = true;
+        cadence.next = NextSlot(now, period);
+        m_heap.push({cadence.next, index});
+    }
+}
+
+void Shard::Leave(Cadence &cadence, size_t place)
+{
+    cadence.members[place]->scheduled = false;
+    if (place + 1 != cadence.members.size()) {
+        cadence.members[place] = std::move(cadence.members.back());
+        cadence.members[place]->cadenceSlot = static_cast<uint32_t>(place);
+    }
+    cadence.members.pop_back();
 }
 
 Shard::Disposal Shard::Release(Subscription *sub, std::unique_lock<SlimMutex> &l)
@@ -175,7 +211,7 @@ void Shard::Run(unsigned generation)
         // otherwise wake the thread for each tick, microseconds apart.
         Moment moment;
         moment.now = Clock::now();
-        if (!m_heap.empty() && m_heap.top().at <= moment.now + kTickSlack) {
+        if (HasDue(moment)) {
             moment.elapsedMs = m_engine.ElapsedMs(moment.now);
             GetSystemTimeAsFileTime(&moment.time);
             Unit([&] { TickDue(l, moment, generation); });
@@ -201,35 +237,39 @@ void Shard::Run(unsigned generation)
     }
 }
 
+bool Shard::HasDue(const Moment &moment) const
+{
+    return !m_firsts.empty() || (!m_heap.empty() && m_heap.top().at <= moment.now + kTickSlack);
+}
+
 void Shard::TickDue(std::unique_lock<SlimMutex> &l, const Moment &moment, unsigned generation)
 {
-    m_due.clear();
     m_values.clear();
     m_targets.clear();
-    for (int n = 0; n < kMostTicksInARow && !m_heap.empty() && m_heap.top().at <= moment.now + kTickSlack &&
-                    m_events.empty() && m_generation == generation;
-         ++n) {
-        // Moved off the heap rather than copied: the comparison reads only
-        // the time, and a copy would count the member up and down again.
-        m_due.push_back(std::move(const_cast<Due &>(m_heap.top())));
-        m_heap.pop();
+    // First values at once; their next ones come with their cadence.
+    m_ticking.swap(m_firsts);
+    for (std::shared_ptr<Member> &member : m_ticking) {
+        if (Tick(*member, moment))
+            Join(std::move(member), moment.now);
+        else
+            member->scheduled = false;
     }
-    // Each member and its first subscription are elsewhere in memory, and
-    // a tick is mostly the wait for them: they are asked for a few members
-    // ahead, the member before its subscription.
-    constexpr size_t kAhead = 8;
-    for (size_t i = 0; i < m_due.size(); ++i) {
-        if (i + kAhead < m_due.size()) {
-            const char *member = reinterpret_cast<const char *>(m_due[i + kAhead].member.get());
-            __builtin_prefetch(member);
-            __builtin_prefetch(member + 64);
+    m_ticking.clear();
+    int budget = kMostTicksInARow;
+    while (budget > 0 && !m_heap.empty() && m_heap.top().at <= moment.now + kTickSlack && m_events.empty() &&
+           m_generation == generation) {
+        Due due = m_heap.top();
+        if (!TickCadence(due.cadence, moment, budget))
+            break; // the rest of the slot after the events, if any
+        m_heap.pop();
+        Cadence &cadence = m_cadences[due.cadence];
+        cadence.cursor = 0;
+        cadence.onHeap = !cadence.members.empty();
+        if (cadence.onHeap) {
+            // A shard that fell behind skips the slots it missed.
+            cadence.next = NextSlot(std::max(due.at, moment.now), cadence.period);
+            m_heap.push({cadence.next, due.cadence});
         }
-        if (i + kAhead / 2 < m_due.size()) {
-            SubscriberList &subs = m_due[i + kAhead / 2].member->subscriptions;
-            if (!subs.empty())
-                __builtin_prefetch(subs[0]);
-        }
-        Tick(std::move(m_due[i]), moment);
     }
     if (!m_targets.empty())
         Deliver(l, [&] { DeliverTick(); });
@@ -237,17 +277,43 @@ void Shard::TickDue(std::unique_lock<SlimMutex> &l, const Moment &moment, unsign
         ClearCadroValue(c.value);
 }
 
-void Shard::Tick(Due &&due, const Moment &moment)
+bool Shard::TickCadence(uint32_t index, const Moment &moment, int &budget)
 {
-    Member &m = *due.member;
-    if (m.removed || m.subscriptions.empty()) {
-        m.scheduled = false;
-        return;
+    Cadence &cadence = m_cadences[index];
+    auto &members = cadence.members;
+    // Each member and its first subscription are elsewhere in memory, and
+    // a tick is mostly the wait for them: they are asked for a few members
+    // ahead, the member before its subscription.
+    constexpr size_t kAhead = 8;
+    size_t i = cadence.cursor;
+    while (i < members.size() && budget > 0) {
+        if (i + kAhead < members.size()) {
+            const char *member = reinterpret_cast<const char *>(members[i + kAhead].get());
+            __builtin_prefetch(member);
+            __builtin_prefetch(member + 64);
+        }
+        if (i + kAhead / 2 < members.size()) {
+            SubscriberList &subs = members[i + kAhead / 2]->subscriptions;
+            if (!subs.empty())
+                __builtin_prefetch(subs[0]);
+        }
+        if (!Tick(*members[i], moment)) {
+            Leave(cadence, i); // the last member takes its place, still to tick
+            continue;
+        }
+        ++i;
+        --budget;
     }
-    // A shard that fell behind skips the slots it missed.
-    m_heap.push({NextSlot(std::max(due.at, moment.now), m.source.period), std::move(due.member)});
+    cadence.cursor = i;
+    return i >= members.size();
+}
+
+bool Shard::Tick(Member &m, const Moment &moment)
+{
+    if (m.removed || m.subscriptions.empty())
+        return false;
     if (m.stalled || !m.machine->connected)
-        return;
+        return true;
     m.value = NextValue(m, moment.elapsedMs, m_engine.Random());
     m.hasValue = true;
     m.time = moment.time;
@@ -261,6 +327,7 @@ void Shard::Tick(Due &&due, const Moment &moment)
     for (Subscription *sub : m.subscriptions)
         if (sub->active)
             m_targets.push_back({sub, index});
+    return true;
 }
 
 Shard::Clock::time_point Shard::NextSlot(Clock::time_point after, unsigned period) const

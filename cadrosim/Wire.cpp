@@ -25,12 +25,36 @@ bool Out::ExtendLast(Kind kind, std::string_view fields, uint32_t id)
     // The fields describe their own length (a value says its type), so a
     // frame whose first bytes equal them has exactly these fields.
     if (m_frameStart == SIZE_MAX || m_bytes.size() < m_frameStart + 5 + fields.size() ||
-        static_cast<uint8_t>(m_bytes[m_frameStart + 4]) != static_cast<uint8_t>(kind) ||
-        m_bytes.compare(m_frameStart + 5, fields.size(), fields) != 0)
+        static_cast<uint8_t>(m_bytes[m_frameStart + 4]) != static_cast<uint8_t>(kind))
+        return false;
+    // Values of different members mostly differ in their last bytes (the
+    // number and the time): those first, without a call.
+    const char *last = m_bytes.data() + m_frameStart + 5;
+    if (fields.size() >= 8) {
+        uint64_t a, b;
+        memcpy(&a, last + fields.size() - 8, 8);
+        memcpy(&b, fields.data() + fields.size() - 8, 8);
+        if (a != b)
+            return false;
+    }
+    if (memcmp(last, fields.data(), fields.size()) != 0)
         return false;
     U32(id);
     End();
     return true;
+}
+
+void Out::Frame(Kind kind, std::string_view fields, uint32_t id)
+{
+    const size_t at = m_bytes.size();
+    const auto length = static_cast<uint32_t>(1 + fields.size() + 4);
+    m_bytes.resize(at + 4 + length);
+    char *p = m_bytes.data() + at;
+    memcpy(p, &length, 4);
+    p[4] = static_cast<char>(kind);
+    memcpy(p + 5, fields.data(), fields.size());
+    memcpy(p + 5 + fields.size(), &id, 4);
+    m_frameStart = at;
 }
 
 void Out::Clear()

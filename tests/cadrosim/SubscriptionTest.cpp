@@ -398,3 +398,41 @@ TEST_F(SimTest, AComputedMemberNobodyHeardGivesANewSubscriberACurrentValue)
     EXPECT_EQ(kept.number, 9);
     EXPECT_LT(CompareFileTime(&kept.time, &published), 0) << "a published value keeps its time stamp";
 }
+
+TEST_F(SimTest, MembersOfOnePeriodTickOnWhileOthersOfItLeaveAndReturn)
+{
+    // Members of one period tick together from one array: those that lose
+    // their last subscriber leave it (the last takes the place of each), and
+    // neither the ones that stay nor the ones that come back may be lost.
+    const int count = 40;
+    std::vector<CadroDataItem *> subs;
+    std::vector<void *> cookies;
+    for (int i = 0; i < count; ++i) {
+        std::wstring name = L"m" + std::to_wstring(i);
+        ASSERT_EQ(Command(L"add-member \\\\.\\p\\cadence " + name + L" type=number access=r source=counter period=10"),
+                  L"ok\n");
+        subs.push_back(Subscribe(L"\\\\.\\p\\cadence." + name));
+        ASSERT_TRUE(subs.back());
+        cookies.push_back(LastCookie());
+    }
+    auto eachHas = [&](int from, int step, auto atLeast) {
+        return recorder.WaitFor([&](auto &all) {
+            for (int i = from; i < count; i += step)
+                if (DataCount(all, cookies[i]) < atLeast(i))
+                    return false;
+            return true;
+        });
+    };
+    ASSERT_TRUE(eachHas(0, 1, [](int) { return size_t{3}; }));
+    for (int i = 0; i < count; i += 2)
+        Drop(subs[i]);
+    std::vector<size_t> before(count);
+    for (int i = 1; i < count; i += 2)
+        before[i] = recorder.Count(cookies[i], Delivery::Data);
+    EXPECT_TRUE(eachHas(1, 2, [&](int i) { return before[i] + 3; })) << "the members that stayed tick on";
+    for (int i = 0; i < count; i += 2) {
+        ASSERT_TRUE(Subscribe(L"\\\\.\\p\\cadence.m" + std::to_wstring(i)));
+        cookies[i] = LastCookie();
+    }
+    EXPECT_TRUE(eachHas(0, 2, [](int) { return size_t{3}; })) << "the members that came back tick again";
+}
