@@ -1,6 +1,7 @@
 #include "NodeLink.h"
 
 #include "PipeChannel.h"
+#include "Prefetch.h"
 #include "SimValue.h"
 #include "SocketChannel.h"
 
@@ -24,16 +25,6 @@ constexpr DWORD kReconnectPauseMs = 500;
 constexpr DWORD kRestartMs = 2000;
 constexpr DWORD kTcpConnectMs = 3000;
 constexpr size_t kMostKnownUrls = 4u << 20;
-// A batch of values reaches thousands of feeds and subscriptions scattered
-// in memory, each a cache miss: they are asked for this many entries ahead.
-constexpr size_t kPrefetchAhead = 4;
-
-// The first two cache lines of an object (nothing is read past them).
-inline void PrefetchObject(const void *p)
-{
-    __builtin_prefetch(p);
-    __builtin_prefetch(static_cast<const char *>(p) + 64);
-}
 constexpr uint32_t kFeedBit = 1u << 31; // on a batch entry's index: a feed's
 
 std::wstring NodeProgramPath()

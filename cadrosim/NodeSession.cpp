@@ -1,5 +1,6 @@
 #include "NodeSession.h"
 
+#include "Prefetch.h"
 #include "SimValue.h"
 
 #include <cstring>
@@ -432,19 +433,14 @@ void NodeSession::OnDataBatch(const DataEntry *entries, size_t count)
 {
     constexpr uint32_t kFlags = kCadroHasValue | kCadroHasQuality | kCadroHasTime;
     std::lock_guard<SlimMutex> l(m_feedsLock);
-    // The feeds are scattered in memory: each is asked for a few entries
-    // ahead, its place in the table a few before that.
-    constexpr size_t kAhead = 4;
+    // A feed's place in the table is asked for before the feed.
     auto slotOf = [&](size_t i) { return (IdOf(entries[i].cookie) & wire::kFeedSlotMask) - 1; };
     m_queue.PushIds([&](auto push) {
         for (size_t i = 0; i < count; ++i) {
-            if (i + 2 * kAhead < count && slotOf(i + 2 * kAhead) < m_feeds.size())
-                __builtin_prefetch(&m_feeds[slotOf(i + 2 * kAhead)]);
-            if (i + kAhead < count && slotOf(i + kAhead) < m_feeds.size()) {
-                const char *feed = reinterpret_cast<const char *>(m_feeds[slotOf(i + kAhead)].get());
-                __builtin_prefetch(feed);
-                __builtin_prefetch(feed + 64);
-            }
+            if (i + 2 * kPrefetchAhead < count && slotOf(i + 2 * kPrefetchAhead) < m_feeds.size())
+                __builtin_prefetch(&m_feeds[slotOf(i + 2 * kPrefetchAhead)]);
+            if (i + kPrefetchAhead < count && slotOf(i + kPrefetchAhead) < m_feeds.size())
+                PrefetchObject(m_feeds[slotOf(i + kPrefetchAhead)].get());
             const DataEntry &e = entries[i];
             Feed *feed = FeedOf(IdOf(e.cookie));
             if (!feed)

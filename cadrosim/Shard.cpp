@@ -1,5 +1,6 @@
 #include "Engine.h"
 
+#include "Prefetch.h"
 #include "Source.h"
 
 #include <algorithm>
@@ -281,19 +282,13 @@ bool Shard::TickCadence(uint32_t index, const Moment &moment, int &budget)
 {
     Cadence &cadence = m_cadences[index];
     auto &members = cadence.members;
-    // Each member and its first subscription are elsewhere in memory, and
-    // a tick is mostly the wait for them: they are asked for a few members
-    // ahead, the member before its subscription.
-    constexpr size_t kAhead = 8;
+    // The member is asked for before its first subscription.
     size_t i = cadence.cursor;
     while (i < members.size() && budget > 0) {
-        if (i + kAhead < members.size()) {
-            const char *member = reinterpret_cast<const char *>(members[i + kAhead].get());
-            __builtin_prefetch(member);
-            __builtin_prefetch(member + 64);
-        }
-        if (i + kAhead / 2 < members.size()) {
-            SubscriberList &subs = members[i + kAhead / 2]->subscriptions;
+        if (i + 2 * kPrefetchAhead < members.size())
+            PrefetchObject(members[i + 2 * kPrefetchAhead].get());
+        if (i + kPrefetchAhead < members.size()) {
+            SubscriberList &subs = members[i + kPrefetchAhead]->subscriptions;
             if (!subs.empty())
                 __builtin_prefetch(subs[0]);
         }
