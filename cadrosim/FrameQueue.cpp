@@ -115,7 +115,18 @@ void FrameQueue::WriteLoop()
         }
         m_writing = true;
         Drain(l);
+        if (m_drained && m_out.Empty() && !m_stopping) {
+            l.unlock();
+            m_drained();
+            l.lock();
+        }
     }
+}
+
+size_t FrameQueue::Backlog()
+{
+    std::lock_guard<SlimMutex> l(m_lock);
+    return m_out.Size();
 }
 
 } // namespace cadrosim

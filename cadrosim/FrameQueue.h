@@ -7,6 +7,7 @@
 #include "SlimSync.h"
 #include "Wire.h"
 
+#include <functional>
 #include <memory>
 #include <mutex>
 #include <thread>
@@ -61,6 +62,11 @@ public:
     void Flush();
     // Closes the pipe once everything queued has been written.
     void CloseWhenWritten();
+    // Bytes queued and not yet being written.
+    size_t Backlog();
+    // Called by the writing thread, without the lock, whenever it has
+    // written everything queued (set before Attach).
+    void SetDrainedHandler(std::function<void()> handler) { m_drained = std::move(handler); }
 
 private:
     // Under the lock, after a frame was added: wakes the writer, or closes a
@@ -78,6 +84,7 @@ private:
     SlimCondition m_idle;
     wire::Out m_out;
     std::string m_batch; // being written
+    std::function<void()> m_drained;
     std::shared_ptr<Channel> m_channel;
     bool m_writing = false;
     bool m_stopping = false;

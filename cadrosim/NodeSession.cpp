@@ -15,6 +15,12 @@ namespace {
 // dropped rather than the node's memory filled (it reconnects and
 // subscribes again when it recovers).
 constexpr size_t kLargestBacklog = 256u << 20;
+// A library whose queue holds more than this is behind (it reads slower than
+// values come, or not at all): each feed's newest value then waits in the
+// feed, and goes out once the queue has been written. The library misses
+// values the network no longer has, never the newest, and a library that
+// stopped reading costs the node this much, not a queue that grows.
+constexpr size_t kBehindBacklog = 4u << 20;
 const wchar_t kNoCommands[] = L"the node takes commands from its own machine only";
 
 uint32_t IdOf(void *cookie)
@@ -55,6 +61,7 @@ NodeSession::NodeSession(Engine &engine, std::shared_ptr<Channel> channel, bool 
     : m_engine(engine), m_channel(std::move(channel)), m_fromNode(fromNode), m_endedEvent(ended),
       m_queue(kLargestBacklog)
 {
+    m_queue.SetDrainedHandler([this] { SendHeld(); });
     m_queue.Attach(m_channel);
     m_reader = std::thread([this] { ReadLoop(); });
 }
@@ -433,24 +440,64 @@ void NodeSession::OnDataBatch(const DataEntry *entries, size_t count)
 {
     constexpr uint32_t kFlags = kCadroHasValue | kCadroHasQuality | kCadroHasTime;
     std::lock_guard<SlimMutex> l(m_feedsLock);
+    const bool behind = m_queue.Backlog() > kBehindBacklog;
     // A feed's place in the table is asked for before the feed.
     auto slotOf = [&](size_t i) { return (IdOf(entries[i].cookie) & wire::kFeedSlotMask) - 1; };
-    m_queue.PushIds([&](auto push) {
+    auto each = [&](auto take) {
         for (size_t i = 0; i < count; ++i) {
             if (i + 2 * kPrefetchAhead < count && slotOf(i + 2 * kPrefetchAhead) < m_feeds.size())
                 __builtin_prefetch(&m_feeds[slotOf(i + 2 * kPrefetchAhead)]);
             if (i + kPrefetchAhead < count && slotOf(i + kPrefetchAhead) < m_feeds.size())
                 PrefetchObject(m_feeds[slotOf(i + kPrefetchAhead)].get());
             const DataEntry &e = entries[i];
-            Feed *feed = FeedOf(IdOf(e.cookie));
-            if (!feed)
-                continue;
-            WithFields(kFlags, *e.value, e.error, e.low, e.high, [&](std::string_view fields) {
-                feed->data.Assign(fields);
-                push(wire::Kind::FeedData, fields, feed->id);
-            });
+            if (Feed *feed = FeedOf(IdOf(e.cookie)))
+                WithFields(kFlags, *e.value, e.error, e.low, e.high, [&](std::string_view fields) {
+                    feed->data.Assign(fields);
+                    take(*feed, fields);
+                });
         }
+    };
+    if (behind) {
+        each([&](Feed &feed, std::string_view) { Hold(feed); });
+        return;
+    }
+    m_queue.PushIds([&](auto push) {
+        PushHeld(push);
+        each([&](Feed &feed, std::string_view fields) { push(wire::Kind::FeedData, fields, feed.id); });
     });
+}
+
+void NodeSession::Hold(Feed &feed)
+{
+    if (feed.held)
+        return;
+    feed.held = true;
+    m_held.push_back(feed.id);
+    m_holding = true;
+}
+
+template <class Push> void NodeSession::PushHeld(Push &push)
+{
+    if (m_held.empty())
+        return;
+    for (uint32_t id : m_held) {
+        Feed *feed = FeedOf(id); // gone meanwhile: nothing to send
+        if (feed && feed->held && !feed->data.Empty())
+            push(wire::Kind::FeedData, feed->data.View(), feed->id);
+        if (feed)
+            feed->held = false;
+    }
+    m_held.clear();
+    m_holding = false;
+}
+
+void NodeSession::SendHeld()
+{
+    if (!m_holding.load())
+        return;
+    std::lock_guard<SlimMutex> l(m_feedsLock);
+    if (m_queue.Backlog() <= kBehindBacklog)
+        m_queue.PushIds([&](auto push) { PushHeld(push); });
 }
 
 HRESULT STDMETHODCALLTYPE NodeSession::OnAttributes(void *cookie, const CadroAttributes *attributes)

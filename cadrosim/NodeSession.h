@@ -35,6 +35,9 @@ public:
     void Join();
     // Tells the library that the topology changed.
     void TopologyChanged();
+    // Bytes waiting for the library to read them (not counting a write
+    // under way).
+    size_t QueuedBytes() { return m_queue.Backlog(); }
 
     HRESULT STDMETHODCALLTYPE OnData(void *cookie, uint32_t flags, const CadroValue *value, int32_t errorFlag,
                                      uint32_t timeLow, uint32_t timeHigh) override;
@@ -73,6 +76,7 @@ private:
         uint8_t statusCount = 0;
         bool hasAttributes = false;
         bool dead = false; // its member has gone: a newcomer makes a new feed
+        bool held = false; // a value not sent yet: the library is behind
         CadroAttributes attributes = {};
         SlimMutex lock; // its values, under the table's shared lock
     };
@@ -97,6 +101,14 @@ private:
     CadroDataItem *Leave(uint32_t id);
     // Forgets the feed and its members (its engine subscription is gone).
     void DropFeed(Feed &feed);
+    // Under m_feedsLock held alone, while the library is behind: the feed's
+    // newest value waits in the feed instead of the queue.
+    void Hold(Feed &feed);
+    // Under m_feedsLock held alone and the queue's lock: the newest value
+    // of each feed held back (push is PushIds's).
+    template <class Push> void PushHeld(Push &push);
+    // The writer has caught up: the values held back go out.
+    void SendHeld();
     // A reply: written by the reading thread itself, at once.
     template <class Fill> void Reply(Fill fill);
     void ReleaseAll();
@@ -110,6 +122,8 @@ private:
     std::vector<std::unique_ptr<Feed>> m_feeds; // by slot
     std::vector<uint16_t> m_feedGenerations;
     std::vector<uint32_t> m_freeFeeds;
+    std::vector<uint32_t> m_held; // feeds with a value held back
+    std::atomic<bool> m_holding{false};
     // By the URL's hash; a URL whose hash another one has takes a feed
     // that is not found here (it is not shared).
     std::unordered_map<uint64_t, uint32_t> m_feedOfUrl;
