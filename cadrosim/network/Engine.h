@@ -2,6 +2,7 @@
 // The one simulation engine of a process: the network, its delivery threads,
 // the subscriptions and the control commands. Every library object of CDREALT
 // and CDBROW is backed by it.
+#include "Backend.h"
 #include "Network.h"
 #include "SlimSync.h"
 #include "Unknown.h"
@@ -202,27 +203,32 @@ private:
     std::thread m_thread;
 };
 
-class Engine {
+class Engine final : public Backend {
 public:
     static Engine &Instance();
 
     // Library objects (sessions) and subscriptions keep the threads and the
     // control channel running.
-    void AddUse();
-    void ReleaseUse();
+    void AddUse() override;
+    void ReleaseUse() override;
 
+    HRESULT Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeReceiver *receiver, CadroDataItem **out) override
+    {
+        return Subscribe(url, cookie, receiver, out, false, nullptr);
+    }
     // hereOnly: a machine that another node serves is unknown (a node
     // passes on only its libraries' requests, so that two nodes that name
     // each other cannot send one round for ever).
     // batch: the receiver's batch interface, when it has one.
     HRESULT Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeReceiver *receiver, CadroDataItem **out,
-                      bool hereOnly = false, BatchReceiver *batch = nullptr);
+                      bool hereOnly, BatchReceiver *batch);
     void Unsubscribe(Subscription *sub);
     HRESULT Write(Subscription *sub, const CadroValue *value);
     HRESULT Read(Subscription *sub, uint32_t *flags, CadroValue *value, int32_t *errorFlag, FILETIME *time);
     bool List(const std::wstring &url, std::vector<BrowseEntry> &out);
     // A browse session's listing: counted, for "status".
-    bool Browse(const std::wstring &url, std::vector<BrowseEntry> &out, bool hereOnly = false);
+    bool Browse(const std::wstring &url, std::vector<BrowseEntry> &out, bool hereOnly);
+    bool Browse(const std::wstring &url, std::vector<BrowseEntry> &out) override { return Browse(url, out, false); }
 
     // Whether a subscription to url will find its member: known here, or
     // confirmed by a listing of the node that serves its machine.
@@ -232,16 +238,16 @@ public:
     // Who ends the process when "shutdown" is asked (only a network node).
     void SetShutdownHandler(std::function<void()> handler);
 
-    void AddBrowserReceiver(ICadroBrowserReceiver *receiver);
-    void RemoveBrowserReceiver(ICadroBrowserReceiver *receiver);
+    void AddBrowserReceiver(ICadroBrowserReceiver *receiver) override;
+    void RemoveBrowserReceiver(ICadroBrowserReceiver *receiver) override;
     // Tells the browser receivers that the topology changed.
     void NotifyTopologyChanged();
 
     // Runs one control command; the answer's first line is "ok" or "error: ...".
-    std::wstring Execute(const std::wstring &command);
+    std::wstring Execute(const std::wstring &command) override;
     // Replaces the network with a description (subscriptions keep their old
     // members). False with a line-numbered error.
-    bool Load(const std::wstring &description, std::wstring &error);
+    bool Load(const std::wstring &description, std::wstring &error) override;
 
     double ElapsedMs() const { return ElapsedMs(std::chrono::steady_clock::now()); }
     double ElapsedMs(std::chrono::steady_clock::time_point now) const;

@@ -11,30 +11,15 @@
 namespace cadrosim {
 namespace {
 
-// Where this process's network is: its own engine (the network node itself,
-// and tests that want a network of their own), or the node that the
-// libraries reach over its pipe, which is what a server process uses.
+// Where this process's network is: its own engine, or the machine's node
+// (see Backend).
 std::atomic<bool> g_embedded{false};
 
-bool Embedded()
+Backend &TheNetwork()
 {
-    return g_embedded;
-}
-
-void AddUse()
-{
-    if (Embedded())
-        Engine::Instance().AddUse();
-    else
-        NodeLink::Instance().AddUse();
-}
-
-void ReleaseUse()
-{
-    if (Embedded())
-        Engine::Instance().ReleaseUse();
-    else
-        NodeLink::Instance().ReleaseUse();
+    if (g_embedded)
+        return Engine::Instance();
+    return NodeLink::Instance();
 }
 
 class CRealTime : public CSimUnknown<CadroRealTime> {
@@ -42,12 +27,12 @@ public:
     explicit CRealTime(ICadroRealTimeReceiver *receiver) : m_receiver(receiver)
     {
         m_receiver->AddRef();
-        AddUse();
+        TheNetwork().AddUse();
     }
     ~CRealTime() override
     {
         m_receiver->Release();
-        ReleaseUse();
+        TheNetwork().ReleaseUse();
     }
 
     HRESULT STDMETHODCALLTYPE Subscribe(const wchar_t *url, void *cookie, const SubscribeOptions *options,
@@ -55,9 +40,7 @@ public:
     {
         if (!options)
             return E_POINTER;
-        if (Embedded())
-            return Engine::Instance().Subscribe(url, cookie, m_receiver, out);
-        return NodeLink::Instance().Subscribe(url, cookie, m_receiver, out);
+        return TheNetwork().Subscribe(url, cookie, m_receiver, out);
     }
 
 private:
@@ -68,19 +51,13 @@ class CBrowser : public CSimUnknown<CadroBrowser> {
 public:
     explicit CBrowser(ICadroBrowserReceiver *receiver) : m_receiver(receiver)
     {
-        AddUse();
-        if (Embedded())
-            Engine::Instance().AddBrowserReceiver(m_receiver);
-        else
-            NodeLink::Instance().AddBrowserReceiver(m_receiver);
+        TheNetwork().AddUse();
+        TheNetwork().AddBrowserReceiver(m_receiver);
     }
     ~CBrowser() override
     {
-        if (Embedded())
-            Engine::Instance().RemoveBrowserReceiver(m_receiver);
-        else
-            NodeLink::Instance().RemoveBrowserReceiver(m_receiver);
-        ReleaseUse();
+        TheNetwork().RemoveBrowserReceiver(m_receiver);
+        TheNetwork().ReleaseUse();
     }
 
     HRESULT STDMETHODCALLTYPE Open(const wchar_t *url) override
@@ -89,8 +66,7 @@ public:
         m_next = 0;
         if (!url)
             return E_POINTER;
-        bool found =
-            Embedded() ? Engine::Instance().Browse(url, m_entries) : NodeLink::Instance().Browse(url, m_entries);
+        bool found = TheNetwork().Browse(url, m_entries);
         return found ? S_OK : HRESULT_FROM_WIN32(ERROR_NOT_FOUND);
     }
 
@@ -164,15 +140,7 @@ HRESULT CadroSim_Execute(const wchar_t *command, BSTR *answer)
 {
     if (!command || !answer)
         return E_POINTER;
-    std::wstring text;
-    if (Embedded()) {
-        text = Engine::Instance().Execute(command);
-    } else {
-        // A use of its own keeps the link up for the request.
-        AddUse();
-        text = NodeLink::Instance().Execute(command);
-        ReleaseUse();
-    }
+    std::wstring text = TheNetwork().Execute(command);
     *answer = SysAllocStringLen(text.data(), static_cast<UINT>(text.size()));
     return text.compare(0, 2, L"ok") == 0 ? S_OK : S_FALSE;
 }
@@ -182,14 +150,7 @@ HRESULT CadroSim_Load(const wchar_t *description, BSTR *error)
     if (!description)
         return E_POINTER;
     std::wstring why;
-    bool loaded;
-    if (Embedded()) {
-        loaded = Engine::Instance().Load(description, why);
-    } else {
-        AddUse();
-        loaded = NodeLink::Instance().Load(description, why);
-        ReleaseUse();
-    }
+    bool loaded = TheNetwork().Load(description, why);
     if (loaded)
         return S_OK;
     if (error)

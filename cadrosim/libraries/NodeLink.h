@@ -8,6 +8,7 @@
 //
 // A node reaches the machines that another machine's node serves the same
 // way, through a link to that node's TCP address (never started from here).
+#include "Backend.h"
 #include "FrameQueue.h"
 #include "HashSet64.h"
 #include "MemberMirror.h"
@@ -134,7 +135,7 @@ template <class F> void LinkFeed::ForEachMember(F f) const
             f(sub);
 }
 
-class NodeLink {
+class NodeLink final : public Backend {
 public:
     // The link to this machine's node.
     static NodeLink &Instance();
@@ -146,19 +147,20 @@ public:
     const std::wstring &Address() const { return m_address; }
 
     // Library objects and subscriptions keep the link (and its threads) up.
-    void AddUse();
-    void ReleaseUse();
+    void AddUse() override;
+    void ReleaseUse() override;
 
-    HRESULT Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeReceiver *receiver, CadroDataItem **out);
+    HRESULT Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeReceiver *receiver, CadroDataItem **out) override;
     void Unsubscribe(RemoteSubscription *sub);
     HRESULT Write(RemoteSubscription *sub, const CadroValue *value);
     HRESULT Read(RemoteSubscription *sub, uint32_t *flags, CadroValue *value, int32_t *errorFlag, FILETIME *time);
-    bool Browse(const std::wstring &url, std::vector<BrowseEntry> &out);
-    std::wstring Execute(const std::wstring &command);
-    bool Load(const std::wstring &description, std::wstring &error);
+    bool Browse(const std::wstring &url, std::vector<BrowseEntry> &out) override;
+    // A use of their own keeps the link up for the request.
+    std::wstring Execute(const std::wstring &command) override;
+    bool Load(const std::wstring &description, std::wstring &error) override;
 
-    void AddBrowserReceiver(ICadroBrowserReceiver *receiver);
-    void RemoveBrowserReceiver(ICadroBrowserReceiver *receiver);
+    void AddBrowserReceiver(ICadroBrowserReceiver *receiver) override;
+    void RemoveBrowserReceiver(ICadroBrowserReceiver *receiver) override;
     // Whether a listing through this link confirmed the member's URL.
     bool Knows(const std::wstring &url);
 

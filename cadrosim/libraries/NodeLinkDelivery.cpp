@@ -1,0 +1,202 @@
+// What the node sends: values in batches, statuses, attributes, joins and
+// changes of the network, delivered to the subscriptions.
+#include "NodeLinkParts.h"
+
+#include "Prefetch.h"
+#include "SimValue.h"
+
+namespace cadrosim {
+
+void NodeLink::TakeData(wire::In &in, bool feeds)
+{
+    DataFields f;
+    f.flags = in.U32();
+    in.Value(f.value);
+    f.error = static_cast<int32_t>(in.U32());
+    f.low = in.U32();
+    f.high = in.U32();
+    auto index = static_cast<uint32_t>(m_batchFields.size());
+    m_batchFields.push_back(f);
+    uint32_t tagged = index | (feeds ? kFeedBit : 0);
+    while (in.Ok() && !in.AtEnd()) {
+        uint32_t id = in.U32();
+        if (in.Ok())
+            m_batchIds.emplace_back(id, tagged);
+    }
+}
+
+void NodeLink::PrefetchFeed(size_t i) const
+{
+    // The feed's place in the table a few entries before the feed itself.
+    auto slotOf = [&](size_t at) { return (m_batchIds[at].first & wire::kFeedSlotMask) - 1; };
+    if (i + kPrefetchAhead < m_batchIds.size() && (m_batchIds[i + kPrefetchAhead].second & kFeedBit) &&
+        slotOf(i + kPrefetchAhead) < m_feeds.size())
+        __builtin_prefetch(&m_feeds[slotOf(i + kPrefetchAhead)]);
+    if (i < m_batchIds.size() && (m_batchIds[i].second & kFeedBit) && slotOf(i) < m_feeds.size())
+        PrefetchObject(m_feeds[slotOf(i)]);
+}
+
+void NodeLink::DeliverData()
+{
+    if (m_batchFields.empty())
+        return;
+    {
+        std::lock_guard<SlimMutex> l(m_lock);
+        m_delivering = true;
+        for (size_t i = 0; i < m_batchIds.size(); ++i) {
+            PrefetchFeed(i + kPrefetchAhead);
+            auto [id, tagged] = m_batchIds[i];
+            uint32_t index = tagged & ~kFeedBit;
+            const DataFields &f = m_batchFields[index];
+            if (tagged & kFeedBit) {
+                // A feed's value: remembered once, for all its members.
+                if (LinkFeed *feed = FeedOf(id)) {
+                    feed->mirror.Remember(f.flags, f.value, f.error, f.low, f.high);
+                    feed->ForEachMember([&](RemoteSubscription *sub) { m_batchSubs.emplace_back(sub, index); });
+                }
+            } else if (RemoteSubscription *sub = Lookup(id)) {
+                sub->feed->mirror.Remember(f.flags, f.value, f.error, f.low, f.high);
+                m_batchSubs.emplace_back(sub, index);
+            }
+        }
+    }
+    // No pins: a subscription let go during the batch is deleted after it
+    // (Forget), and the one being called is published first, so that its
+    // holder either is seen here or sees the call and waits for it.
+    for (size_t i = 0; i < m_batchSubs.size(); ++i) {
+        if (i + kPrefetchAhead < m_batchSubs.size())
+            PrefetchObject(m_batchSubs[i + kPrefetchAhead].first);
+        auto [sub, index] = m_batchSubs[i];
+        m_callingSub.store(sub);
+        if (!sub->IsForgotten()) {
+            const DataFields &f = m_batchFields[index];
+            sub->receiver->OnData(sub->cookie, f.flags, &f.value, f.error, f.low, f.high);
+        }
+        if (m_callWaiters.load() != 0)
+            WakeWaiters(nullptr);
+    }
+    WakeWaiters(nullptr);
+    std::vector<RemoteSubscription *> graveyard;
+    {
+        std::lock_guard<SlimMutex> l(m_lock);
+        m_delivering = false;
+        graveyard.swap(m_graveyard);
+    }
+    for (RemoteSubscription *sub : graveyard)
+        sub->Unpin();
+    for (DataFields &f : m_batchFields)
+        ClearCadroValue(f.value);
+    m_batchFields.clear();
+    m_batchIds.clear();
+    m_batchSubs.clear();
+}
+
+void NodeLink::WakeWaiters(RemoteSubscription *calling)
+{
+    m_callingSub.store(calling);
+    if (m_callWaiters.load() == 0)
+        return;
+    // Under the lock, so that a holder between its check and its sleep
+    // cannot miss the wake.
+    m_lock.lock();
+    m_lock.unlock();
+    m_callReturned.notify_all();
+}
+
+void NodeLink::Dispatch(wire::Kind kind, wire::In &in)
+{
+    if (kind == wire::Kind::Data || kind == wire::Kind::FeedData) {
+        TakeData(in, kind == wire::Kind::FeedData);
+        return;
+    }
+    DeliverData(); // what came before this frame, first
+    switch (kind) {
+    case wire::Kind::Attributes: {
+        uint32_t id = in.U32();
+        CadroAttributes a = in.Attributes();
+        if (in.Ok())
+            CallSubscription(id, [&](RemoteSubscription &sub) { sub.receiver->OnAttributes(sub.cookie, &a); });
+        return;
+    }
+    case wire::Kind::Status: {
+        uint32_t id = in.U32();
+        uint32_t status = in.U32();
+        if (in.Ok())
+            CallSubscription(
+                id, [&](RemoteSubscription &sub) { sub.receiver->StatusChange(sub.cookie, status, 0, 0); },
+                [&](RemoteSubscription &sub) { sub.feed->mirror.RememberStatus(status); });
+        return;
+    }
+    case wire::Kind::Joined: {
+        uint32_t id = in.U32();
+        uint32_t feedId = in.U32();
+        std::lock_guard<SlimMutex> l(m_lock);
+        if (in.Ok())
+            Join(id, feedId);
+        return;
+    }
+    case wire::Kind::FeedAttributes: {
+        uint32_t feedId = in.U32();
+        CadroAttributes a = in.Attributes();
+        if (in.Ok())
+            CallFeed(
+                feedId, [&](RemoteSubscription &sub) { sub.receiver->OnAttributes(sub.cookie, &a); },
+                [](LinkFeed &) {});
+        return;
+    }
+    case wire::Kind::FeedStatus: {
+        uint32_t feedId = in.U32();
+        uint32_t status = in.U32();
+        if (in.Ok())
+            CallFeed(
+                feedId, [&](RemoteSubscription &sub) { sub.receiver->StatusChange(sub.cookie, status, 0, 0); },
+                [&](LinkFeed &feed) { feed.mirror.RememberStatus(status); });
+        return;
+    }
+    case wire::Kind::Reply: {
+        uint32_t request = in.U32();
+        {
+            std::lock_guard<SlimMutex> l(m_lock);
+            auto it = m_pending.find(request);
+            if (it == m_pending.end())
+                return;
+            it->second->reply = in.Rest();
+            it->second->answered = true;
+            it->second->done = true;
+            m_pending.erase(it);
+        }
+        m_changed.notify_all();
+        return;
+    }
+    case wire::Kind::Topology:
+        TopologyChanged();
+        return;
+    case wire::Kind::Closing: {
+        std::lock_guard<SlimMutex> l(m_lock);
+        m_mayStartNode = false; // shut down on purpose: wait for a new one
+        return;
+    }
+    default:
+        return;
+    }
+}
+
+void NodeLink::TopologyChanged()
+{
+    std::vector<ICadroBrowserReceiver *> receivers;
+    {
+        std::lock_guard<SlimMutex> l(m_lock);
+        m_knownUrls.Clear();
+        ForgetCatalogue();
+        receivers = m_browserReceivers;
+        for (auto *r : receivers)
+            r->AddRef();
+    }
+    m_changed.notify_all(); // subscribers waiting for a catalogue now out of date
+    for (auto *r : receivers) {
+        r->BrowseItemChanged();
+        r->Release();
+    }
+}
+
+} // namespace cadrosim

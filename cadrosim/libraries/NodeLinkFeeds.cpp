@@ -1,0 +1,168 @@
+// The link's tables: its subscriptions by id, and the feeds of the node
+// they share.
+#include "NodeLinkParts.h"
+
+#include <new>
+
+namespace cadrosim {
+
+uint32_t NodeLink::Register(RemoteSubscription *sub)
+{
+    uint32_t slot;
+    if (!m_freeSlots.empty()) {
+        slot = m_freeSlots.back();
+        m_freeSlots.pop_back();
+    } else {
+        if (m_slots.size() >= kSlotMask)
+            return 0;
+        slot = static_cast<uint32_t>(m_slots.size());
+        m_slots.push_back(nullptr);
+        m_generations.push_back(0);
+    }
+    m_slots[slot] = sub;
+    // The generation tells a new subscription from an older one of the
+    // same slot whose values may still be on their way.
+    sub->id = (static_cast<uint32_t>(m_generations[slot] & 0x3ff) << kSlotBits) | (slot + 1);
+    return sub->id;
+}
+
+void NodeLink::Unregister(RemoteSubscription *sub)
+{
+    uint32_t slot = (sub->id & kSlotMask) - 1;
+    m_slots[slot] = nullptr;
+    ++m_generations[slot];
+    m_freeSlots.push_back(slot);
+}
+
+RemoteSubscription *NodeLink::Lookup(uint32_t id) const
+{
+    uint32_t slot = (id & kSlotMask) - 1;
+    if (slot >= m_slots.size() || !m_slots[slot] || m_slots[slot]->id != id)
+        return nullptr;
+    return m_slots[slot];
+}
+
+LinkFeed *NodeLink::FeedOf(uint32_t feedId) const
+{
+    uint32_t slot = (feedId & wire::kFeedSlotMask) - 1;
+    if (slot >= m_feeds.size() || !m_feeds[slot] || m_feeds[slot]->id != feedId)
+        return nullptr;
+    return m_feeds[slot];
+}
+
+void NodeLink::Join(uint32_t id, uint32_t feedId)
+{
+    RemoteSubscription *sub = Lookup(id);
+    uint32_t slot = (feedId & wire::kFeedSlotMask) - 1;
+    if (!sub || slot == UINT32_MAX || slot >= wire::kFeedSlotMask || sub->feed->id == feedId)
+        return;
+    if (slot >= m_feeds.size())
+        m_feeds.resize(slot + 1, nullptr);
+    LinkFeed *&feed = m_feeds[slot];
+    if (feed && feed->id != feedId) {
+        // An earlier feed of the slot that the node has dropped.
+        Unshare(*feed);
+        feed = nullptr;
+    }
+    LinkFeed *current = sub->feed;
+    if (!feed && current->id == 0 && current->first == sub && current->Alone()) {
+        // Its own feed becomes the node's: what the node told the newcomer
+        // is the feed's state now. (Nearly every URL goes this way.)
+        current->id = feedId;
+        feed = current;
+        return;
+    }
+    if (!feed) {
+        feed = new (std::nothrow) LinkFeed();
+        if (!feed)
+            return; // the subscription goes on in the feed it has
+        feed->id = feedId;
+        feed->mirror.CopyFrom(current->mirror);
+    }
+    LinkFeed &joined = *feed;
+    // Room first: short of memory, the subscription stays where it is.
+    if (!MakeRoom(joined))
+        return;
+    RemoveMember(sub);
+    AddMember(joined, sub);
+}
+
+bool NodeLink::MakeRoom(LinkFeed &feed)
+{
+    if (!feed.first)
+        return true;
+    try {
+        if (!feed.others)
+            feed.others = std::make_unique<std::vector<RemoteSubscription *>>();
+        // Doubled when full: room for just one more each time would copy the
+        // whole array at every join, and thousands of items may follow one
+        // member.
+        std::vector<RemoteSubscription *> &others = *feed.others;
+        if (others.size() == others.capacity())
+            others.reserve(std::max<size_t>(4, others.capacity() * 2));
+    } catch (const std::bad_alloc &) {
+        return false;
+    }
+    return true;
+}
+
+void NodeLink::AddMember(LinkFeed &feed, RemoteSubscription *sub)
+{
+    if (feed.first) {
+        feed.others->push_back(sub);
+        sub->place = static_cast<uint32_t>(feed.others->size());
+    } else {
+        feed.first = sub;
+        sub->place = 0;
+    }
+    sub->feed = &feed;
+}
+
+void NodeLink::RemoveMember(RemoteSubscription *sub)
+{
+    LinkFeed *feed = sub->feed;
+    if (!feed)
+        return;
+    sub->feed = nullptr;
+    // The last of the others takes the place that comes free.
+    RemoteSubscription *last = feed->Alone() ? nullptr : feed->others->back();
+    if (last)
+        feed->others->pop_back();
+    if (sub->place == 0)
+        feed->first = last;
+    else if (last != sub)
+        (*feed->others)[sub->place - 1] = last;
+    if (last && last != sub)
+        last->place = sub->place;
+    if (feed->first)
+        return;
+    if (feed->id != 0)
+        m_feeds[(feed->id & wire::kFeedSlotMask) - 1] = nullptr;
+    delete feed;
+}
+
+void NodeLink::Unshare(LinkFeed &feed)
+{
+    // The first member keeps the feed, the others take copies (they share
+    // it still when memory is short).
+    feed.id = 0;
+    while (!feed.Alone()) {
+        auto *own = new (std::nothrow) LinkFeed();
+        if (!own)
+            return;
+        RemoteSubscription *sub = feed.others->back();
+        own->mirror.CopyFrom(feed.mirror);
+        RemoveMember(sub);
+        AddMember(*own, sub);
+    }
+}
+
+void NodeLink::DropFeeds()
+{
+    for (LinkFeed *feed : m_feeds)
+        if (feed)
+            Unshare(*feed);
+    m_feeds.clear();
+}
+
+} // namespace cadrosim
