@@ -1,6 +1,7 @@
 #include "LocalServerRun.h"
 
 #include "CallWatcher.h"
+#include "ClassObjectRegistration.h"
 #include "ComModule.h"
 #include "CommandLine.h"
 #include "ExitWatchdog.h"
@@ -12,30 +13,6 @@ namespace {
 // Once the process has decided to exit, the rest of its exit (COM's
 // uninitialisation included) may take this long before the process is ended.
 constexpr DWORD kExitBoundMs = 5000;
-
-class CClassObjectRegistration : public CClassRegistration {
-public:
-    CClassObjectRegistration(REFCLSID clsid, IClassFactory &factory) : m_clsid(clsid), m_factory(factory) {}
-
-    HRESULT Register() override
-    {
-        if (m_cookie != 0)
-            return S_OK;
-        return CoRegisterClassObject(m_clsid, &m_factory, CLSCTX_LOCAL_SERVER | CLSCTX_REMOTE_SERVER,
-                                     REGCLS_MULTIPLEUSE, &m_cookie);
-    }
-    void Revoke() override
-    {
-        if (m_cookie != 0)
-            CoRevokeClassObject(m_cookie);
-        m_cookie = 0;
-    }
-
-private:
-    CLSID m_clsid;
-    IClassFactory &m_factory;
-    DWORD m_cookie = 0;
-};
 
 void WaitForStep(HANDLE wake, DWORD waitMs)
 {
@@ -54,10 +31,11 @@ int RunLocalServer(REFCLSID clsid, IClassFactory &factory, bool startedByCom)
     // it is, and its count must go to the lifetime.
     static CClassObjectRegistration registration(clsid, factory);
     static CServerLifetime lifetime(registration, CServerLifetime::Timing(), startedByCom);
+    registration.Attach(lifetime);
     ComModule::SetLifetime(&lifetime);
-    static CCallWatcher watcher(lifetime);
+    static CCallWatcher watcher;
     watcher.Install();
-    HRESULT hr = registration.Register();
+    HRESULT hr = registration.Register(CClassRegistration::Use::Shared);
     if (FAILED(hr))
         return static_cast<int>(hr);
     DWORD waitMs = INFINITE;

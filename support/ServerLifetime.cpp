@@ -2,8 +2,6 @@
 
 #include "Trace.h"
 
-#include <algorithm>
-
 CServerLifetime::CServerLifetime(CClassRegistration &registration, const Timing &timing, bool idleFromStart)
     : m_registration(registration), m_timing(timing), m_wake(CreateEventW(nullptr, FALSE, FALSE, nullptr)),
       m_exitWhenIdle(idleFromStart), m_since(timing.now())
@@ -23,7 +21,7 @@ void CServerLifetime::Lock()
     CSingleLock lock(&m_lock);
     ++m_count;
     if (m_phase == Phase::Draining)
-        Wake(); // the main thread restores the registration
+        Wake(); // the main thread switches back
 }
 
 bool CServerLifetime::TryLock()
@@ -33,7 +31,7 @@ bool CServerLifetime::TryLock()
         return false;
     ++m_count;
     if (m_phase == Phase::Draining)
-        Restore(); // at once: the same client may ask the registry next
+        Restore(); // at once: the same client's next activation asks the registry
     return true;
 }
 
@@ -57,35 +55,106 @@ LONG CServerLifetime::Count()
     return m_count;
 }
 
-void CServerLifetime::IncomingCall()
+bool CServerLifetime::ClassObjectQueried(bool byProbe)
 {
-    // Every call of every client passes here: a time is stored and a word
-    // read, nothing more, unless the class object has just been revoked.
-    // The call may be the platform's own request for the class object, on
-    // its way to a lookup that a revocation now would make fail: the stored
-    // time keeps the revocation away (Advance reads it after it says it is
-    // draining, this reads the phase after storing the time; with both in
-    // sequential order one of the two sees the other).
-    m_lastCall.store(m_timing.now());
-    if (m_phase.load() != Phase::Draining)
-        return;
     CSingleLock lock(&m_lock);
+    if (m_switching)
+        return !byProbe; // the platform's own look at the object while it registers it
+    ULONGLONG now = m_timing.now();
+    if (byProbe) {
+        // Only a probe that asked the registry after the drain period began
+        // can have taken the answer given out once; one that got the shared
+        // registration before the switch took nothing.
+        if (m_phase == Phase::Draining && now - m_since >= m_timing.drainMs && !m_taken) {
+            m_taken = true;
+            Trace("lifetime %lu at %llu: a probe took the last registration\n", GetCurrentProcessId(), now);
+            Wake();
+        }
+        return false;
+    }
+    // A client is here: it will create an object, and the grace period
+    // starts over whatever it does.
     if (m_phase == Phase::Draining)
         Restore();
+    else if (m_phase == Phase::Serving)
+        m_since = now;
+    return true;
+}
+
+void CServerLifetime::ProbeFinished()
+{
+    CSingleLock lock(&m_lock);
+    m_probing = false;
+    m_nextProbe = m_timing.now() + m_timing.probeRetryMs;
+    Wake();
 }
 
 void CServerLifetime::Restore()
 {
-    // A client is on its way: it finds the class object again before its
-    // call is served, and the grace period starts over.
-    HRESULT hr = m_registration.Register();
-    Trace("lifetime %lu at %llu: class object registered again (0x%08lX)\n", GetCurrentProcessId(), m_timing.now(),
+    m_switching = true;
+    HRESULT hr = m_registration.Switch(CClassRegistration::Use::Shared);
+    m_switching = false;
+    Trace("lifetime %lu at %llu: serving again (0x%08lX)\n", GetCurrentProcessId(), m_timing.now(),
           static_cast<unsigned long>(hr));
     if (FAILED(hr))
-        INTERNAL_ASSERT_FAILED("registering the class object again");
+        INTERNAL_ASSERT_FAILED("registering the class object for every client again");
     m_phase = Phase::Serving;
     m_since = m_timing.now();
     Wake();
+}
+
+void CServerLifetime::Drain(ULONGLONG now)
+{
+    m_switching = true;
+    HRESULT hr = m_registration.Switch(CClassRegistration::Use::Once);
+    m_switching = false;
+    Trace("lifetime %lu at %llu: draining (0x%08lX)\n", GetCurrentProcessId(), now, static_cast<unsigned long>(hr));
+    if (FAILED(hr))
+        INTERNAL_ASSERT_FAILED("registering the class object for one client");
+    m_phase = Phase::Draining;
+    m_since = now;
+    m_probes = 0;
+    m_taken = false;
+    m_probing = false; // one of an earlier drain that never returned counts no more
+    m_nextProbe = now + m_timing.drainMs;
+}
+
+void CServerLifetime::Stop(ULONGLONG now, const char *why)
+{
+    m_phase = Phase::Stopped;
+    m_registration.Revoke();
+    Trace("lifetime %lu at %llu: stopped (%s)\n", GetCurrentProcessId(), now, why);
+}
+
+DWORD CServerLifetime::StepDraining(ULONGLONG now)
+{
+    if (m_count > 0) {
+        Restore();
+        return INFINITE;
+    }
+    if (m_taken) {
+        Stop(now, "a probe took the last registration");
+        return INFINITE;
+    }
+    if (m_probing) {
+        if (now - m_probeStart < m_timing.probeLimitMs)
+            return static_cast<DWORD>(m_timing.probeLimitMs - (now - m_probeStart));
+        // The registry had nothing and the probe waits for a server it had
+        // started: a client took the last registration and has not come.
+        Stop(now, "the probe did not return");
+        return INFINITE;
+    }
+    if (now < m_nextProbe)
+        return static_cast<DWORD>(m_nextProbe - now);
+    if (m_probes >= m_timing.probes) {
+        Stop(now, "every probe found another server first");
+        return INFINITE;
+    }
+    ++m_probes;
+    m_probing = true;
+    m_probeStart = now;
+    m_registration.Probe();
+    return m_timing.probeLimitMs;
 }
 
 CServerLifetime::Phase CServerLifetime::Advance(DWORD &waitMs)
@@ -97,34 +166,15 @@ CServerLifetime::Phase CServerLifetime::Advance(DWORD &waitMs)
     case Phase::Serving:
         if (m_count > 0 || !m_exitWhenIdle)
             break;
-        // Draining before the grace period is even looked at: the platform
-        // forgets the class object here before it stops handing it out, and
-        // a call that comes in meanwhile must either be seen here (its time)
-        // or see the draining phase and wait for this lock to restore it.
-        // Idle counts from the last release or the last call, whichever
-        // came later.
-        m_phase = Phase::Draining;
-        if (ULONGLONG idleSince = std::max(m_since, m_lastCall.load()); idleSince + m_timing.graceMs > now) {
-            m_phase = Phase::Serving;
-            waitMs = static_cast<DWORD>(idleSince + m_timing.graceMs - now);
+        if (m_since + m_timing.graceMs > now) {
+            waitMs = static_cast<DWORD>(m_since + m_timing.graceMs - now);
             break;
         }
-        m_registration.Revoke();
-        m_since = m_timing.now();
-        Trace("lifetime %lu at %llu: class object revoked\n", GetCurrentProcessId(), m_since);
+        Drain(now);
         waitMs = m_timing.drainMs;
         break;
     case Phase::Draining:
-        if (m_count > 0) {
-            Restore();
-            break;
-        }
-        if (now - m_since < m_timing.drainMs) {
-            waitMs = static_cast<DWORD>(m_timing.drainMs - (now - m_since));
-            break;
-        }
-        m_phase = Phase::Stopped;
-        Trace("lifetime %lu at %llu: stopped\n", GetCurrentProcessId(), now);
+        waitMs = StepDraining(now);
         break;
     case Phase::Stopped:
         break;

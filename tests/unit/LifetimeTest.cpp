@@ -25,21 +25,25 @@ ULONGLONG TestClock()
 
 struct FakeRegistration : CClassRegistration {
     bool registered = true;
-    int registrations = 0, revocations = 0;
-    std::function<void()> whileRevoking;
-    HRESULT Register() override
+    Use use = Use::Shared;
+    int switches = 0, probes = 0;
+    std::function<void()> whileSwitching;
+    HRESULT Register(Use to) override
     {
         registered = true;
-        ++registrations;
+        use = to;
         return S_OK;
     }
-    void Revoke() override
+    HRESULT Switch(Use to) override
     {
-        registered = false;
-        ++revocations;
-        if (auto once = std::exchange(whileRevoking, nullptr))
+        ++switches;
+        use = to;
+        if (auto once = std::exchange(whileSwitching, nullptr))
             once();
+        return S_OK;
     }
+    void Revoke() override { registered = false; }
+    void Probe() override { ++probes; }
 };
 
 CServerLifetime::Timing TestTiming()
@@ -47,14 +51,18 @@ CServerLifetime::Timing TestTiming()
     CServerLifetime::Timing t;
     t.graceMs = 5000;
     t.drainMs = 1500;
+    t.probeRetryMs = 300;
+    t.probeLimitMs = 5000;
+    t.probes = 4;
     t.now = &TestClock;
     return t;
 }
 
 using Phase = CServerLifetime::Phase;
+using Use = CClassRegistration::Use;
 } // namespace
 
-TEST(Lifetime, TheLastReleaseLeadsThroughGraceAndDrainToTheExit)
+TEST(Lifetime, TheLastReleaseLeadsThroughGraceDrainAndAProbeToTheExit)
 {
     g_now = 1000;
     FakeRegistration reg;
@@ -68,22 +76,30 @@ TEST(Lifetime, TheLastReleaseLeadsThroughGraceAndDrainToTheExit)
     g_now = 5999;
     EXPECT_EQ(life.Advance(wait), Phase::Serving);
     EXPECT_EQ(wait, 1u) << "the rest of the grace period";
-    EXPECT_TRUE(reg.registered);
+    EXPECT_EQ(reg.use, Use::Shared);
 
     g_now = 6000;
     EXPECT_EQ(life.Advance(wait), Phase::Draining);
-    EXPECT_FALSE(reg.registered) << "revoked before the decision";
+    EXPECT_EQ(reg.use, Use::Once) << "given out to one more client only";
+    EXPECT_TRUE(reg.registered);
     EXPECT_EQ(wait, 1500u);
     g_now = 7499;
     EXPECT_EQ(life.Advance(wait), Phase::Draining);
+    EXPECT_EQ(reg.probes, 0) << "clients on their way come first";
     g_now = 7500;
+    EXPECT_EQ(life.Advance(wait), Phase::Draining);
+    EXPECT_EQ(reg.probes, 1);
+
+    // The probe takes the registry's last answer: nobody else can hold one.
+    EXPECT_FALSE(life.ClassObjectQueried(true)) << "a probe never gets the class object";
+    life.ProbeFinished();
     EXPECT_EQ(life.Advance(wait), Phase::Stopped);
+    EXPECT_FALSE(reg.registered);
     EXPECT_FALSE(life.TryLock()) << "a creation after the decision gets CO_E_SERVER_STOPPING";
     EXPECT_EQ(life.Count(), 0);
-    EXPECT_EQ(reg.registrations, 0);
 }
 
-TEST(Lifetime, AnythingThatArrivesBeforeTheDecisionKeepsTheServer)
+TEST(Lifetime, AnyClientThatArrivesBeforeTheDecisionKeepsTheServer)
 {
     g_now = 0;
     FakeRegistration reg;
@@ -96,13 +112,11 @@ TEST(Lifetime, AnythingThatArrivesBeforeTheDecisionKeepsTheServer)
     EXPECT_EQ(wait, INFINITE) << "an object lives: no exit planned";
     life.Unlock();
 
-    // Draining: a client that fetched the class object just before the
-    // revocation calls in; the registration is back before its call is served.
+    // Draining: a client that got the registry's answer looks the class up.
     g_now = 14000;
     EXPECT_EQ(life.Advance(wait), Phase::Draining);
-    life.IncomingCall();
-    EXPECT_TRUE(reg.registered);
-    EXPECT_EQ(reg.registrations, 1);
+    EXPECT_TRUE(life.ClassObjectQueried(false));
+    EXPECT_EQ(reg.use, Use::Shared) << "every client may have it again";
     EXPECT_EQ(life.Advance(wait), Phase::Serving);
     EXPECT_EQ(wait, 5000u) << "the grace period starts over";
 
@@ -110,66 +124,103 @@ TEST(Lifetime, AnythingThatArrivesBeforeTheDecisionKeepsTheServer)
     g_now = 19000;
     EXPECT_EQ(life.Advance(wait), Phase::Draining);
     ASSERT_TRUE(life.TryLock());
-    EXPECT_TRUE(reg.registered);
+    EXPECT_EQ(reg.use, Use::Shared);
     g_now = 30000;
     EXPECT_EQ(life.Advance(wait), Phase::Serving);
     life.Unlock();
 
-    // A call in a serving process changes nothing.
-    life.IncomingCall();
-    EXPECT_EQ(reg.registrations, 2);
+    // A client's lookup while serving puts the switch off.
+    g_now = 34000;
+    EXPECT_TRUE(life.ClassObjectQueried(false));
     g_now = 35000;
+    EXPECT_EQ(life.Advance(wait), Phase::Serving);
+    EXPECT_EQ(wait, 4000u);
+
+    // A client arrives while the probe is out: the probe, coming back to a
+    // serving process, takes nothing.
+    g_now = 39000;
     EXPECT_EQ(life.Advance(wait), Phase::Draining);
-    g_now = 36500;
-    EXPECT_EQ(life.Advance(wait), Phase::Stopped);
-    life.IncomingCall();
-    EXPECT_FALSE(reg.registered) << "nothing comes back after the decision";
+    g_now = 40500;
+    EXPECT_EQ(life.Advance(wait), Phase::Draining);
+    EXPECT_EQ(reg.probes, 1);
+    EXPECT_TRUE(life.ClassObjectQueried(false));
+    EXPECT_FALSE(life.ClassObjectQueried(true));
+    life.ProbeFinished();
+    EXPECT_EQ(life.Advance(wait), Phase::Serving);
+    EXPECT_EQ(wait, 5000u);
+    EXPECT_TRUE(reg.registered);
 }
 
-TEST(Lifetime, CallsDuringTheGracePeriodPutTheRevocationOff)
+TEST(Lifetime, ProbesThatFindAnotherServerEndTheDrainAfterTheirNumber)
 {
-    // The platform's own request for the class object is such a call: the
-    // class object must not go between its arrival and its lookup.
     g_now = 0;
     FakeRegistration reg;
     CServerLifetime life(reg, TestTiming(), true);
-    g_now = 4000;
-    life.IncomingCall();
     DWORD wait = 0;
     g_now = 5000;
-    EXPECT_EQ(life.Advance(wait), Phase::Serving);
-    EXPECT_EQ(wait, 4000u) << "idle from the last call";
-    EXPECT_TRUE(reg.registered);
-    g_now = 9000;
     EXPECT_EQ(life.Advance(wait), Phase::Draining);
-    EXPECT_EQ(reg.revocations, 1);
+    // Another copy's probe that got the shared registration before the
+    // switch reaches the class object after it: it took nothing.
+    g_now = 5100;
+    EXPECT_FALSE(life.ClassObjectQueried(true));
+    g_now = 6500;
+    for (int probe = 1; probe <= 4; ++probe) {
+        EXPECT_EQ(life.Advance(wait), Phase::Draining) << "probe " << probe;
+        EXPECT_EQ(reg.probes, probe);
+        g_now += 10;
+        life.ProbeFinished(); // it found another server first
+        EXPECT_EQ(life.Advance(wait), Phase::Draining);
+        EXPECT_EQ(wait, 300u);
+        g_now += 300;
+    }
+    EXPECT_EQ(life.Advance(wait), Phase::Stopped) << "behind a registration that clients reach first";
+    EXPECT_FALSE(reg.registered);
+
+    // A probe that never comes back ends the drain at its limit.
+    g_now = 0;
+    FakeRegistration stuckReg;
+    CServerLifetime stuck(stuckReg, TestTiming(), true);
+    g_now = 5000;
+    EXPECT_EQ(stuck.Advance(wait), Phase::Draining);
+    g_now = 6500;
+    EXPECT_EQ(stuck.Advance(wait), Phase::Draining);
+    EXPECT_EQ(wait, 5000u);
+    g_now = 11499;
+    EXPECT_EQ(stuck.Advance(wait), Phase::Draining);
+    g_now = 11500;
+    EXPECT_EQ(stuck.Advance(wait), Phase::Stopped);
+    stuck.ProbeFinished(); // late
+    EXPECT_EQ(stuck.Advance(wait), Phase::Stopped);
+    EXPECT_EQ(stuckReg.probes, 1);
 }
 
-TEST(Lifetime, ACallArrivingDuringTheRevocationRestoresTheClassObject)
+TEST(Lifetime, ALookupDuringTheSwitchFindsTheServerServingAgain)
 {
-    // The platform forgets the class object before it stops handing it out:
-    // a client's call can reach the process while the revocation is still
-    // under way, and must find the class object again.
+    // The platform may look the class object up on the switching thread
+    // while it registers it; a client's lookup on another thread waits for
+    // the switch and switches back.
     g_now = 0;
     FakeRegistration reg;
     CServerLifetime life(reg, TestTiming(), true);
-    std::thread caller;
+    std::thread client;
     std::atomic<bool> returned{false};
-    reg.whileRevoking = [&] {
-        caller = std::thread([&] {
-            life.IncomingCall();
+    bool platformLookup = false;
+    reg.whileSwitching = [&] {
+        platformLookup = life.ClassObjectQueried(false);
+        client = std::thread([&] {
+            EXPECT_TRUE(life.ClassObjectQueried(false));
             returned = true;
         });
-        // A call that took no notice ends at once; one that waits for the
-        // revocation to finish is still waiting.
         for (int i = 0; i < 20 && !returned; ++i)
             Sleep(10);
     };
     g_now = 5000;
     DWORD wait = 0;
     EXPECT_EQ(life.Advance(wait), Phase::Draining);
-    caller.join();
-    EXPECT_TRUE(reg.registered) << "the call found no class object";
+    client.join();
+    EXPECT_TRUE(platformLookup);
+    EXPECT_EQ(reg.switches, 2) << "the platform's own lookup switched nothing";
+    EXPECT_EQ(reg.use, Use::Shared);
     EXPECT_EQ(life.Advance(wait), Phase::Serving);
 }
 
