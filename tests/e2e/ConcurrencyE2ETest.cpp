@@ -77,9 +77,9 @@ TEST_F(ConcurrencyE2E, ClientsRacingForAStartingServerEachGetIt)
 
 TEST_F(ConcurrencyE2E, ClientsRacingForAStoppingServerEachGetIt)
 {
-    // A server whose last client has gone waits, revokes its class object,
-    // drains and leaves; clients arriving at any of those moments get a
-    // server, this one or a new one.
+    // A server whose last client has gone waits, registers its class object
+    // for one more client, probes the registry and leaves; clients arriving
+    // at any of those moments get a server, this one or a new one.
     for (int pass = 0; pass < 2; ++pass) {
         ExpectAllOk(RunClients({0}), "the first client");
         DWORD before = kServerTiming.graceMs - 700 + static_cast<DWORD>(pass) * 400;
