@@ -8,6 +8,7 @@
 #include <utility>
 
 namespace cadrosim {
+using namespace link; // the link's own limits and waits
 
 namespace {
 std::wstring NodeProgramPath()

@@ -6,6 +6,7 @@
 #include "SimValue.h"
 
 namespace cadrosim {
+using namespace link; // the link's own limits and waits
 
 void NodeLink::TakeData(wire::In &in, bool feeds)
 {
@@ -28,7 +29,7 @@ void NodeLink::TakeData(wire::In &in, bool feeds)
 void NodeLink::PrefetchFeed(size_t i) const
 {
     // The feed's place in the table a few entries before the feed itself.
-    auto slotOf = [&](size_t at) { return (m_batchIds[at].first & wire::kFeedSlotMask) - 1; };
+    auto slotOf = [&](size_t at) { return wire::FeedSlot(m_batchIds[at].first); };
     if (i + kPrefetchAhead < m_batchIds.size() && (m_batchIds[i + kPrefetchAhead].second & kFeedBit) &&
         slotOf(i + kPrefetchAhead) < m_feeds.size())
         __builtin_prefetch(&m_feeds[slotOf(i + kPrefetchAhead)]);

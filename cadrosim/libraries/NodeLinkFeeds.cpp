@@ -5,6 +5,7 @@
 #include <new>
 
 namespace cadrosim {
+using namespace link; // the link's own limits and waits
 
 uint32_t NodeLink::Register(RemoteSubscription *sub)
 {
@@ -44,7 +45,7 @@ RemoteSubscription *NodeLink::Lookup(uint32_t id) const
 
 LinkFeed *NodeLink::FeedOf(uint32_t feedId) const
 {
-    uint32_t slot = (feedId & wire::kFeedSlotMask) - 1;
+    uint32_t slot = wire::FeedSlot(feedId);
     if (slot >= m_feeds.size() || !m_feeds[slot] || m_feeds[slot]->id != feedId)
         return nullptr;
     return m_feeds[slot];
@@ -53,7 +54,7 @@ LinkFeed *NodeLink::FeedOf(uint32_t feedId) const
 void NodeLink::Join(uint32_t id, uint32_t feedId)
 {
     RemoteSubscription *sub = Lookup(id);
-    uint32_t slot = (feedId & wire::kFeedSlotMask) - 1;
+    uint32_t slot = wire::FeedSlot(feedId);
     if (!sub || slot == UINT32_MAX || slot >= wire::kFeedSlotMask || sub->feed->id == feedId)
         return;
     if (slot >= m_feeds.size())
@@ -137,7 +138,7 @@ void NodeLink::RemoveMember(RemoteSubscription *sub)
     if (feed->first)
         return;
     if (feed->id != 0)
-        m_feeds[(feed->id & wire::kFeedSlotMask) - 1] = nullptr;
+        m_feeds[wire::FeedSlot(feed->id)] = nullptr;
     delete feed;
 }
 

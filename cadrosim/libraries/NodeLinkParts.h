@@ -20,7 +20,6 @@ inline constexpr DWORD kTcpConnectMs = 3000;
 inline constexpr size_t kMostKnownUrls = 4u << 20;
 inline constexpr uint32_t kFeedBit = 1u << 31; // on a batch entry's index: a feed's
 } // namespace link
-using namespace link;
 
 template <class Fill> bool NodeLink::Send(wire::Kind kind, Fill fill)
 {
@@ -45,7 +44,7 @@ template <class Fill> bool NodeLink::Ask(wire::Kind kind, Fill fill, std::string
     l.unlock();
     m_queue.Flush();
     l.lock();
-    auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(kReplyWaitMs);
+    auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(link::kReplyWaitMs);
     while (!pending.done && std::chrono::steady_clock::now() < deadline)
         m_changed.wait_until(l, deadline);
     m_pending.erase(request);

@@ -8,6 +8,7 @@
 #include <new>
 
 namespace cadrosim {
+using namespace link; // the link's own limits and waits
 
 void NodeLink::ForgetCatalogue()
 {

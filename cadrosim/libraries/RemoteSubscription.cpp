@@ -5,6 +5,7 @@
 #include <new>
 
 namespace cadrosim {
+using namespace link; // the link's own limits and waits
 
 // ---- RemoteSubscription ------------------------------------------------------
 

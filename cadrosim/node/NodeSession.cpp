@@ -234,7 +234,7 @@ void NodeSession::Subscribe(wire::In &in)
 
 NodeSession::Feed *NodeSession::FeedOf(uint32_t feedId)
 {
-    uint32_t slot = (feedId & wire::kFeedSlotMask) - 1;
+    uint32_t slot = wire::FeedSlot(feedId);
     if (slot >= m_feeds.size() || !m_feeds[slot] || m_feeds[slot]->id != feedId)
         return nullptr;
     return m_feeds[slot].get();
@@ -349,7 +349,7 @@ void NodeSession::DropFeed(Feed &feed)
     for (uint32_t member : feed.members)
         m_memberships.erase(member);
     Unshare(feed);
-    uint32_t slot = (feed.id & wire::kFeedSlotMask) - 1;
+    uint32_t slot = wire::FeedSlot(feed.id);
     m_feeds[slot].reset();
     m_freeFeeds.push_back(slot);
 }
@@ -442,7 +442,7 @@ void NodeSession::OnDataBatch(const DataEntry *entries, size_t count)
     std::lock_guard<SlimMutex> l(m_feedsLock);
     const bool behind = m_queue.Backlog() > kBehindBacklog;
     // A feed's place in the table is asked for before the feed.
-    auto slotOf = [&](size_t i) { return (IdOf(entries[i].cookie) & wire::kFeedSlotMask) - 1; };
+    auto slotOf = [&](size_t i) { return wire::FeedSlot(IdOf(entries[i].cookie)); };
     auto each = [&](auto take) {
         for (size_t i = 0; i < count; ++i) {
             if (i + 2 * kPrefetchAhead < count && slotOf(i + 2 * kPrefetchAhead) < m_feeds.size())

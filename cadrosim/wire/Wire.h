@@ -44,6 +44,12 @@ enum class Kind : uint8_t {
 // generation that tells it from an earlier feed of the slot.
 constexpr uint32_t kFeedSlotBits = 20;
 constexpr uint32_t kFeedSlotMask = (1u << kFeedSlotBits) - 1;
+// The slot of a feed's id: UINT32_MAX for an id without one, which no table
+// reaches.
+constexpr uint32_t FeedSlot(uint32_t feedId)
+{
+    return (feedId & kFeedSlotMask) - 1;
+}
 
 // The machine's node: its pipe, which every server's libraries reach.
 constexpr const wchar_t *kNodeName = L"CadroNode";
