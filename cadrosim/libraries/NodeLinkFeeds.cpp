@@ -14,7 +14,8 @@ uint32_t NodeLink::Register(RemoteSubscription *sub)
         slot = m_freeSlots.back();
         m_freeSlots.pop_back();
     } else {
-        if (m_slots.size() >= kSlotMask)
+        // The last slot is left out: an id of all ones is none to the node.
+        if (m_slots.size() + 1 >= kSlotMask)
             return 0;
         slot = static_cast<uint32_t>(m_slots.size());
         m_slots.push_back(nullptr);

@@ -11,6 +11,13 @@
 namespace cadrosim {
 
 namespace {
+// The key of a URL's hash in the table of feeds (0 marks a free slot there;
+// the feed's second hash decides).
+uint64_t UrlKey(uint64_t hash)
+{
+    return hash ? hash : 1;
+}
+
 // A library that reads nothing for this long is hung: its connection is
 // dropped rather than the node's memory filled (it reconnects and
 // subscribes again when it recovers).
@@ -105,8 +112,8 @@ void NodeSession::ReleaseAll()
                 items.push_back(feed->item);
         m_feeds.clear();
         m_freeFeeds.clear();
-        m_feedOfUrl.clear();
-        m_memberships.clear();
+        m_feedOfUrl.Clear();
+        m_memberships.Clear();
     }
     for (CadroDataItem *item : items)
         item->Release();
@@ -198,16 +205,16 @@ void NodeSession::Subscribe(wire::In &in)
     uint32_t fresh = 0; // a new feed, to subscribe on the engine
     {
         std::lock_guard<SlimMutex> l(m_feedsLock);
-        uint64_t hash = wire::UrlHash(url);
-        Feed *feed = SharedFeed(url, hash);
-        if (!feed) {
-            feed = NewFeed(url, hash);
+        uint64_t hash = wire::UrlHash(url), check = wire::UrlCheck(url);
+        Feed *feed = id == kNoMember ? nullptr : SharedFeed(hash, check);
+        if (!feed && id != kNoMember) {
+            feed = NewFeed(hash, check);
             fresh = feed ? feed->id : 0;
         }
         if (feed)
             Join(*feed, id);
         else
-            hr = E_OUTOFMEMORY;
+            hr = id == kNoMember ? E_INVALIDARG : E_OUTOFMEMORY;
     }
     if (fresh) {
         // Outside the lock: the engine may answer at once, from this thread.
@@ -240,18 +247,18 @@ NodeSession::Feed *NodeSession::FeedOf(uint32_t feedId)
     return m_feeds[slot].get();
 }
 
-NodeSession::Feed *NodeSession::SharedFeed(const std::wstring &url, uint64_t hash)
+NodeSession::Feed *NodeSession::SharedFeed(uint64_t hash, uint64_t check)
 {
-    auto it = m_feedOfUrl.find(hash);
-    Feed *feed = it == m_feedOfUrl.end() ? nullptr : FeedOf(it->second);
-    return feed && feed->url == url ? feed : nullptr;
+    uint32_t *indexed = m_feedOfUrl.Find(UrlKey(hash));
+    Feed *feed = indexed ? FeedOf(*indexed) : nullptr;
+    return feed && feed->check == check ? feed : nullptr;
 }
 
 void NodeSession::Unshare(Feed &feed)
 {
-    auto it = m_feedOfUrl.find(feed.hash);
-    if (it != m_feedOfUrl.end() && it->second == feed.id)
-        m_feedOfUrl.erase(it);
+    uint32_t *indexed = m_feedOfUrl.Find(UrlKey(feed.hash));
+    if (indexed && *indexed == feed.id)
+        m_feedOfUrl.Erase(UrlKey(feed.hash));
 }
 
 void NodeSession::LastData::Assign(std::string_view fields)
@@ -259,14 +266,39 @@ void NodeSession::LastData::Assign(std::string_view fields)
     if (fields.size() <= sizeof m_short) {
         memcpy(m_short, fields.data(), fields.size());
         m_size = static_cast<uint8_t>(fields.size());
-        m_long.clear();
+        m_long.reset();
     } else {
         m_size = 0;
-        m_long.assign(fields);
+        if (m_long)
+            m_long->assign(fields);
+        else
+            m_long = std::make_unique<std::string>(fields);
     }
 }
 
-NodeSession::Feed *NodeSession::NewFeed(const std::wstring &url, uint64_t hash)
+void NodeSession::FeedMembers::Add(uint32_t id)
+{
+    if (m_count++ == 0) {
+        m_first = id;
+        return;
+    }
+    if (!m_more)
+        m_more = std::make_unique<std::vector<uint32_t>>();
+    m_more->push_back(id);
+}
+
+void NodeSession::FeedMembers::RemoveLast()
+{
+    if (m_count == 0)
+        return;
+    if (--m_count == 0)
+        return;
+    m_more->pop_back();
+    if (m_more->empty())
+        m_more.reset();
+}
+
+NodeSession::Feed *NodeSession::NewFeed(uint64_t hash, uint64_t check)
 {
     uint32_t slot;
     if (!m_freeFeeds.empty()) {
@@ -283,11 +315,11 @@ NodeSession::Feed *NodeSession::NewFeed(const std::wstring &url, uint64_t hash)
     // The generation tells the feed from an earlier one of the slot whose
     // engine subscription may still be calling.
     feed->id = (static_cast<uint32_t>(++m_feedGenerations[slot] & 0x7ff) << wire::kFeedSlotBits) | (slot + 1);
-    feed->url = url;
     feed->hash = hash;
+    feed->check = check;
     // A stale entry (its feed gone) is replaced; a live one of another URL
     // with the same hash is kept.
-    uint32_t &indexed = m_feedOfUrl[hash];
+    uint32_t &indexed = m_feedOfUrl[UrlKey(hash)];
     if (!FeedOf(indexed))
         indexed = feed->id;
     m_feeds[slot] = std::move(feed);
@@ -316,27 +348,27 @@ void NodeSession::Join(Feed &feed, uint32_t id)
         out.U32(id);
         out.U32(feed.id);
     });
-    m_memberships[id] = {feed.id, static_cast<uint32_t>(feed.members.size())};
-    feed.members.push_back(id);
+    m_memberships[id] = {feed.id, feed.members.Size()};
+    feed.members.Add(id);
 }
 
 CadroDataItem *NodeSession::Leave(uint32_t id)
 {
-    auto it = m_memberships.find(id);
-    if (it == m_memberships.end())
+    Membership *found = m_memberships.Find(id);
+    if (!found)
         return nullptr;
-    Membership membership = it->second;
-    m_memberships.erase(it);
+    Membership membership = *found;
+    m_memberships.Erase(id);
     Feed *feed = FeedOf(membership.feed);
     if (!feed)
         return nullptr;
-    std::vector<uint32_t> &members = feed->members;
-    if (membership.index + 1 < members.size()) {
-        members[membership.index] = members.back();
+    FeedMembers &members = feed->members;
+    if (membership.index + 1 < members.Size()) {
+        members[membership.index] = members[members.Size() - 1];
         m_memberships[members[membership.index]].index = membership.index;
     }
-    members.pop_back();
-    if (!members.empty())
+    members.RemoveLast();
+    if (members.Size() > 0)
         return nullptr;
     CadroDataItem *item = feed->item;
     feed->item = nullptr;
@@ -346,8 +378,7 @@ CadroDataItem *NodeSession::Leave(uint32_t id)
 
 void NodeSession::DropFeed(Feed &feed)
 {
-    for (uint32_t member : feed.members)
-        m_memberships.erase(member);
+    feed.members.ForEach([&](uint32_t member) { m_memberships.Erase(member); });
     Unshare(feed);
     uint32_t slot = wire::FeedSlot(feed.id);
     m_feeds[slot].reset();
@@ -368,8 +399,8 @@ void NodeSession::Unsubscribe(uint32_t id)
 CadroDataItem *NodeSession::Find(uint32_t id)
 {
     std::lock_guard<SlimMutex> l(m_feedsLock);
-    auto it = m_memberships.find(id);
-    Feed *feed = it == m_memberships.end() ? nullptr : FeedOf(it->second.feed);
+    Membership *membership = m_memberships.Find(id);
+    Feed *feed = membership ? FeedOf(membership->feed) : nullptr;
     if (!feed || !feed->item)
         return nullptr;
     feed->item->AddRef();
@@ -412,7 +443,7 @@ void NodeSession::TopologyChanged()
         // was loaded since may have a new one under its URL): a newcomer
         // subscribes anew, as a subscription of its own would.
         std::lock_guard<SlimMutex> l(m_feedsLock);
-        m_feedOfUrl.clear();
+        m_feedOfUrl.Clear();
     }
     m_queue.Push(wire::Kind::Topology, [](wire::Out &) {});
 }

@@ -10,11 +10,11 @@
 // told what a new subscription would be (statuses since "connecting", the
 // attributes, the value), in order with the feed's own frames.
 #include "Engine.h"
+#include "FlatMap.h"
 #include "FrameQueue.h"
 
 #include <memory>
 #include <thread>
-#include <unordered_map>
 #include <vector>
 
 namespace cadrosim {
@@ -55,24 +55,49 @@ private:
     class LastData {
     public:
         void Assign(std::string_view fields);
-        void Clear() { m_size = 0, m_long.clear(); }
-        std::string_view View() const { return m_size ? std::string_view(m_short, m_size) : m_long; }
-        bool Empty() const { return m_size == 0 && m_long.empty(); }
+        void Clear() { m_size = 0, m_long.reset(); }
+        std::string_view View() const
+        {
+            return m_size ? std::string_view(m_short, m_size) : m_long ? std::string_view(*m_long) : std::string_view();
+        }
+        bool Empty() const { return m_size == 0 && !m_long; }
 
     private:
         char m_short[32];
         uint8_t m_size = 0;
-        std::string m_long;
+        std::unique_ptr<std::string> m_long;
+    };
+    // The library's ids that share a feed: nearly always one, kept in place.
+    class FeedMembers {
+    public:
+        uint32_t Size() const { return m_count; }
+        uint32_t &operator[](uint32_t i) { return i == 0 ? m_first : (*m_more)[i - 1]; }
+        void Add(uint32_t id);
+        void RemoveLast();
+        template <class Each> void ForEach(Each each) const
+        {
+            if (m_count)
+                each(m_first);
+            if (m_more)
+                for (uint32_t id : *m_more)
+                    each(id);
+        }
+
+    private:
+        uint32_t m_first = 0;
+        uint32_t m_count = 0;
+        std::unique_ptr<std::vector<uint32_t>> m_more;
     };
     struct Feed {
         // What a value reads and writes first, in the feed's first lines.
         uint32_t id = 0; // with its slot's generation: the engine's cookie
         LastData data;
-        uint64_t hash = 0; // of the URL
-        std::wstring url;
+        // The URL's two hashes: URLs that agree on both are taken as one
+        // (the URL itself is not kept: it would double the feed's size).
+        uint64_t hash = 0, check = 0;
         CadroDataItem *item = nullptr;
-        std::vector<uint32_t> members; // the library's ids
-        uint8_t statuses[6];           // since the last "connecting"
+        FeedMembers members;
+        uint8_t statuses[6]; // since the last "connecting"
         uint8_t statusCount = 0;
         bool hasAttributes = false;
         bool dead = false; // its member has gone: a newcomer makes a new feed
@@ -84,6 +109,7 @@ private:
         uint32_t feed;
         uint32_t index; // in the feed's members
     };
+    static constexpr uint32_t kNoMember = UINT32_MAX;
 
     void Subscribe(wire::In &in);
     void Unsubscribe(uint32_t id);
@@ -91,9 +117,9 @@ private:
     CadroDataItem *Find(uint32_t id);
     // Under m_feedsLock (held alone, or shared by values).
     Feed *FeedOf(uint32_t feedId);
-    Feed *NewFeed(const std::wstring &url, uint64_t hash);
-    // The running feed of url that a newcomer joins, if any.
-    Feed *SharedFeed(const std::wstring &url, uint64_t hash);
+    Feed *NewFeed(uint64_t hash, uint64_t check);
+    // The running feed of the URL that a newcomer joins, if any.
+    Feed *SharedFeed(uint64_t hash, uint64_t check);
     void Unshare(Feed &feed);
     void Join(Feed &feed, uint32_t id);
     // Takes id out of its feed; the feed's engine subscription, for the
@@ -126,8 +152,9 @@ private:
     std::atomic<bool> m_holding{false};
     // By the URL's hash; a URL whose hash another one has takes a feed
     // that is not found here (it is not shared).
-    std::unordered_map<uint64_t, uint32_t> m_feedOfUrl;
-    std::unordered_map<uint32_t, Membership> m_memberships; // by the library's id
+    FlatMap<uint64_t, uint32_t, 0> m_feedOfUrl;
+    // By the library's id (one id, kNoMember, cannot be subscribed).
+    FlatMap<uint32_t, Membership, kNoMember> m_memberships;
     FrameQueue m_queue;
     std::thread m_reader;
 };

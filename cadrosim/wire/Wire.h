@@ -74,6 +74,18 @@ inline uint64_t UrlHash(std::wstring_view url, uint64_t h = 1469598103934665603u
     return h;
 }
 
+// A second hash of a URL, independent of UrlHash: a table that keeps both
+// instead of the URL tells URLs apart but for one chance in 2^128.
+inline uint64_t UrlCheck(std::wstring_view url)
+{
+    uint64_t h = 0x2545f4914f6cdd1dull ^ url.size();
+    for (wchar_t c : url) {
+        h = (h ^ static_cast<uint16_t>(c)) * 0x9e3779b97f4a7c15ull;
+        h ^= h >> 29;
+    }
+    return h;
+}
+
 // A member URL's hash for the node's catalogue: as UrlHash, with the
 // machine's name (which URLs may spell in any case) in lower case. The node
 // hashes each member's plain spelling ("\\machine\process\object.part", and "."

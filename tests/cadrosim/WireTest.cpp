@@ -2,6 +2,7 @@
 // writes the other reads back, and a peer that sends garbage or half a frame
 // is never read past.
 #include "Wire.h"
+#include "FlatMap.h"
 #include "HashSet64.h"
 #include "Network.h"
 
@@ -9,6 +10,8 @@
 
 #include <algorithm>
 #include <cstring>
+#include <random>
+#include <unordered_map>
 #include <vector>
 
 using namespace cadrosim;
@@ -143,6 +146,55 @@ TEST(Wire, ConfirmedUrlSetKeepsWhatWentInThroughGrowth)
     set.Clear();
     EXPECT_EQ(set.Size(), 0u);
     EXPECT_FALSE(set.Contains(0x9E3779B97F4A7C15ull));
+}
+
+// The node's flat tables of feeds and memberships against a map that is
+// known to work: a long random run of insertions and erasures, with keys
+// that crowd a few homes (runs that wrap around the table's end, erasures in
+// their middle), agrees at every step; clearing forgets all.
+TEST(Wire, FlatMapAgreesWithAReferenceMapThroughGrowthAndErasure)
+{
+    FlatMap<uint32_t, uint32_t, UINT32_MAX> map;
+    std::unordered_map<uint32_t, uint32_t> reference;
+    std::mt19937 random(7);
+    for (int step = 0; step < 200000; ++step) {
+        // Few distinct keys at first (dense runs), more later (growth).
+        uint32_t key = random() % (step < 50000 ? 64u : 20000u);
+        switch (random() % 3) {
+        case 0:
+        case 1:
+            map[key] = static_cast<uint32_t>(step);
+            reference[key] = static_cast<uint32_t>(step);
+            break;
+        case 2:
+            ASSERT_EQ(map.Erase(key), reference.erase(key) == 1) << "step " << step;
+            break;
+        }
+        uint32_t probe = random() % 20000u;
+        uint32_t *found = map.Find(probe);
+        auto it = reference.find(probe);
+        ASSERT_EQ(found != nullptr, it != reference.end()) << "step " << step << ", key " << probe;
+        if (found) {
+            ASSERT_EQ(*found, it->second);
+        }
+        ASSERT_EQ(map.Size(), reference.size());
+    }
+    for (auto &[key, value] : reference)
+        ASSERT_TRUE(map.Find(key) && *map.Find(key) == value) << key;
+    map.Clear();
+    EXPECT_EQ(map.Size(), 0u);
+    EXPECT_EQ(map.Find(reference.begin()->first), nullptr);
+    EXPECT_FALSE(map.Erase(1));
+}
+
+// The node keeps two hashes of a URL instead of the URL: they differ in
+// what they take apart.
+TEST(Wire, TheUrlsSecondHashIsNotTheFirst)
+{
+    EXPECT_NE(wire::UrlCheck(L"\\\\.\\p\\o.a"), wire::UrlCheck(L"\\\\.\\p\\o.b"));
+    EXPECT_NE(wire::UrlCheck(L"ab"), wire::UrlCheck(L"ba"));
+    EXPECT_NE(wire::UrlCheck(L""), wire::UrlCheck(std::wstring(1, L'\0')));
+    EXPECT_NE(wire::UrlCheck(L"x"), wire::UrlHash(L"x"));
 }
 
 // A local object's listing says which members a library may subscribe to by
