@@ -109,14 +109,24 @@ long RunCadroctl(const std::wstring &arguments, std::string &output)
 
 bool EnsureNode(DWORD timeoutMs)
 {
-    if (NodeProcessId() == 0) {
-        // Started as the servers' libraries start it; a second one that
-        // loses the race for the pipe leaves by itself.
-        UniqueHandle node(StartProcess(L"\"" + BinPath(L"cadronode.exe") + L"\""));
-    }
-    for (DWORD waited = 0; waited < timeoutMs; waited += 100, Sleep(100))
+    // The node that the last test program stopped may still answer the first
+    // look and be gone the next moment: a node is started whenever none
+    // answers (again every few seconds), as the servers' libraries start it;
+    // one that loses the race for the pipe leaves by itself.
+    const DWORD start = GetTickCount();
+    DWORD lastStart = 0;
+    bool started = false;
+    do {
         if (NodeProcessId() != 0)
             return true;
+        DWORD now = GetTickCount();
+        if (!started || now - lastStart >= 3000) {
+            UniqueHandle node(StartProcess(L"\"" + BinPath(L"cadronode.exe") + L"\""));
+            started = true;
+            lastStart = now;
+        }
+        Sleep(100);
+    } while (GetTickCount() - start < timeoutMs);
     return false;
 }
 

@@ -22,12 +22,15 @@ long TestNetwork::Load()
 {
     // Each test program stops the node at its end: the next one may find
     // none until a server needs the network.
-    if (!EnsureNode(20000))
-        return -1;
     std::string output;
     long code = -1;
-    for (int i = 0; i < 100 && code != 0; ++i, Sleep(100))
+    for (int i = 0; i < 100 && code != 0; ++i, Sleep(100)) {
+        // Asked again at each try: the node found first may have been
+        // leaving.
+        if (!EnsureNode(20000))
+            return -1;
         code = RunCadroctl(L"load \"" + m_path + L"\"", output);
+    }
     m_loaded = true;
     return code;
 }
