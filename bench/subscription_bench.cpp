@@ -6,18 +6,31 @@
 // through COM in turns with a baseline server that only sends precomputed
 // calls (baseline_server.cpp).
 //
+// With --distinct it measures a plant's load instead: N items (10,000 by
+// default) on N distinct members that count every 10 ms in the network
+// node, in one active 10 ms group of the registered server, through COM:
+// items delivered per second, the server's and the node's processor time
+// per delivered item, and the latency from a value's time stamp (when the
+// node computed it) to its OnDataChange, median and 99th percentile, in
+// three windows and the best of them, beside the baseline server sending
+// callbacks of as many items.
+//
 // Usage: subscription_bench            everything
 //        subscription_bench -i         only the in-process figures
 //        subscription_bench N [N ...]  only the comparison through COM, for
 //                                      these item counts in turn
+//        subscription_bench --distinct [N]
 #include "BaselineProcess.h"
 #include "CadroSim.h"
 #include "ClassFactory.h"
 #include "ComPtr.h"
+#include "DistinctNetwork.h"
 #include "GroupState.h"
 #include "Handle.h"
 #include "OPCGroup.h"
 #include "ProcessTimes.h"
+#include "ServerProcesses.h"
+#include "SyncObject.h"
 #include "opcda.h"
 
 #include <algorithm>
@@ -38,11 +51,13 @@ class CountingSink : public CComObjectRoot, public IOPCDataCallback {
 public:
     DECLARE_COM_UNKNOWN()
     STDMETHODIMP OnDataChange(DWORD, OPCHANDLE, HRESULT, HRESULT, DWORD count, OPCHANDLE *, VARIANT *values, WORD *,
-                              FILETIME *, HRESULT *) override
+                              FILETIME *times, HRESULT *) override
     {
         items += count;
         if (count && V_VT(&values[0]) == VT_R8)
             last = V_R8(&values[0]);
+        if (sampleLatency && times)
+            SampleLatency(count, times);
         return S_OK;
     }
     STDMETHODIMP OnReadComplete(DWORD, OPCHANDLE, HRESULT, HRESULT, DWORD, OPCHANDLE *, VARIANT *, WORD *, FILETIME *,
@@ -61,8 +76,30 @@ public:
 
     std::atomic<unsigned long long> items{0};
     std::atomic<double> last{-1};
+    // While set, the age of some of each callback's values on arrival.
+    std::atomic<bool> sampleLatency{false};
+    std::vector<double> TakeLatencies()
+    {
+        CSingleLock lock(&m_latencyLock);
+        return std::move(m_latenciesMs);
+    }
 
 private:
+    void SampleLatency(DWORD count, const FILETIME *times)
+    {
+        FILETIME now;
+        GetSystemTimePreciseAsFileTime(&now);
+        auto ticks = [](const FILETIME &t) {
+            return (static_cast<ULONGLONG>(t.dwHighDateTime) << 32) | t.dwLowDateTime;
+        };
+        CSingleLock lock(&m_latencyLock);
+        for (DWORD i = 0; i < count; i += 500)
+            m_latenciesMs.push_back((static_cast<double>(ticks(now)) - static_cast<double>(ticks(times[i]))) / 1e4);
+    }
+
+    CCriticalSection m_latencyLock{LockOrder::Leaf};
+    std::vector<double> m_latenciesMs;
+
     void *FindInterface(REFIID riid) override
     {
         return IsEqualIID(riid, IID_IOPCDataCallback) ? static_cast<IOPCDataCallback *>(this) : nullptr;
@@ -100,6 +137,32 @@ Group MakeGroup(IOPCServer *server, DWORD rate, const wchar_t *id, DWORD count, 
         container->FindConnectionPoint(IID_IOPCDataCallback, g.point.Out());
         g.point->Advise(sink, &g.cookie);
     }
+    return g;
+}
+
+// An active group of one item for each id.
+Group MakeGroupOf(IOPCServer *server, DWORD rate, const std::vector<std::wstring> &ids, CountingSink *sink)
+{
+    Group g;
+    DWORD revised;
+    server->AddGroup(L"", TRUE, rate, 1, nullptr, nullptr, 0, &g.handle, &revised, IID_IOPCItemMgt,
+                     reinterpret_cast<IUnknown **>(g.items.Out()));
+    std::vector<OPCITEMDEF> defs(ids.size());
+    for (size_t i = 0; i < ids.size(); ++i) {
+        defs[i] = {};
+        defs[i].szItemID = const_cast<wchar_t *>(ids[i].c_str());
+        defs[i].bActive = TRUE;
+        defs[i].hClient = static_cast<OPCHANDLE>(i);
+    }
+    OPCITEMRESULT *results = nullptr;
+    HRESULT *errors = nullptr;
+    g.items->AddItems(static_cast<DWORD>(defs.size()), defs.data(), &results, &errors);
+    CoTaskMemFree(results);
+    CoTaskMemFree(errors);
+    ComPtr<IConnectionPointContainer> container;
+    g.items.As(container);
+    container->FindConnectionPoint(IID_IOPCDataCallback, g.point.Out());
+    g.point->Advise(sink, &g.cookie);
     return g;
 }
 
@@ -248,12 +311,114 @@ void CompareThroughCom(const std::vector<DWORD> &counts)
                    100 * our.ItemsPerSecond() / base.ItemsPerSecond());
     }
 }
+
+// One window of a plant's delivery: what came, what it cost the server and
+// the node, and how old the values were on arrival.
+struct PlantWindow {
+    double itemsPerSecond = 0, serverUs = 0, nodeUs = 0, medianMs = 0, p99Ms = 0;
+};
+
+PlantWindow MeasurePlantWindow(CountingSink *sink, HANDLE server, HANDLE node, DWORD windowMs)
+{
+    PlantWindow w;
+    sink->TakeLatencies();
+    sink->sampleLatency = true;
+    unsigned long long before = sink->items;
+    double serverBefore = ProcessCpuSeconds(server), nodeBefore = node ? ProcessCpuSeconds(node) : 0;
+    auto start = Clock::now();
+    Sleep(windowMs);
+    double seconds = std::chrono::duration<double>(Clock::now() - start).count();
+    unsigned long long items = sink->items - before;
+    sink->sampleLatency = false;
+    w.itemsPerSecond = items / seconds;
+    if (items) {
+        w.serverUs = (ProcessCpuSeconds(server) - serverBefore) * 1e6 / items;
+        w.nodeUs = node ? (ProcessCpuSeconds(node) - nodeBefore) * 1e6 / items : 0;
+    }
+    std::vector<double> ms = sink->TakeLatencies();
+    std::sort(ms.begin(), ms.end());
+    if (!ms.empty()) {
+        w.medianMs = ms[ms.size() / 2];
+        w.p99Ms = ms[ms.size() * 99 / 100];
+    }
+    return w;
+}
+
+void PrintPlantWindow(const char *what, const PlantWindow &w)
+{
+    printf("  %-20s %9.0f items/s  %6.3f us server CPU per item  %6.3f us node CPU per item  latency median %6.1f ms, "
+           "99th percentile %6.1f ms\n",
+           what, w.itemsPerSecond, w.serverUs, w.nodeUs, w.medianMs, w.p99Ms);
+}
+
+void Distinct(DWORD members)
+{
+    if (CountServerProcesses() != 0) {
+        printf("a server process is running already: it serves another network; stop it first\n");
+        return;
+    }
+    DistinctNetwork network(members);
+    if (!network.Error().empty()) {
+        printf("%ls\n", network.Error().c_str());
+        return;
+    }
+    ComPtr<IOPCServer> server;
+    if (FAILED(CoCreateInstance(kServer, nullptr, CLSCTX_LOCAL_SERVER, IID_IOPCServer,
+                                reinterpret_cast<void **>(server.Out())))) {
+        printf("the server is not registered: run ./test.sh or scripts/setup.sh first\n");
+        return;
+    }
+    UniqueHandle serverProcess = FindServerProcess();
+    UniqueHandle node(OpenProcessNamed(L"cadronode.exe"));
+    const DWORD kWindowMs = 2000;
+    printf("%lu items on distinct members counting every 10 ms, one active 10 ms group, through COM:\n",
+           static_cast<unsigned long>(members));
+    PlantWindow best;
+    best.serverUs = best.nodeUs = best.medianMs = best.p99Ms = 1e9;
+    {
+        ComPtr<CountingSink> sink = CountingSink::Create();
+        Group group = MakeGroupOf(server.Get(), 10, network.Changing(members), sink.Get());
+        Sleep(2000); // first values, and the scans settled
+        for (int window = 1; window <= 3; ++window) {
+            PlantWindow w = MeasurePlantWindow(sink.Get(), serverProcess.Get(), node.Get(), kWindowMs);
+            PrintPlantWindow(("window " + std::to_string(window)).c_str(), w);
+            best.itemsPerSecond = std::max(best.itemsPerSecond, w.itemsPerSecond);
+            best.serverUs = std::min(best.serverUs, w.serverUs);
+            best.nodeUs = std::min(best.nodeUs, w.nodeUs);
+            best.medianMs = std::min(best.medianMs, w.medianMs);
+            best.p99Ms = std::min(best.p99Ms, w.p99Ms);
+        }
+        group.point->Unadvise(group.cookie);
+        OPCHANDLE handle = group.handle;
+        group = Group();
+        server->RemoveGroup(handle, TRUE);
+    }
+    PrintPlantWindow("best of the three", best);
+    BaselineServer baseline(members);
+    if (!baseline.Ready()) {
+        printf("  the baseline server did not start\n");
+        return;
+    }
+    baseline.Start();
+    Sleep(500);
+    PlantWindow floor = MeasurePlantWindow(baseline.Sink(), baseline.Process(), nullptr, kWindowMs);
+    baseline.Stop();
+    printf("  %-20s %9.0f items/s  %6.3f us server CPU per item (precomputed callbacks of %lu items)\n",
+           "baseline COM server", floor.itemsPerSecond, floor.serverUs, static_cast<unsigned long>(members));
+}
 } // namespace
 
 // With item counts as arguments only the comparison through COM runs, for
 // those counts in turn (repeat a count to see how much it varies).
 int wmain(int argc, wchar_t **argv)
 {
+    if (argc > 1 && wcscmp(argv[1], L"--distinct") == 0) {
+        // The network node's, which the server reaches too.
+        CoInitializeEx(nullptr, COINIT_MULTITHREADED);
+        Distinct(argc > 2 ? wcstoul(argv[2], nullptr, 10) : 10000);
+        CoUninitialize();
+        return 0;
+    }
     CadroSim_UseEmbeddedNetwork(); // the network of the objects made in this process
     CoInitializeEx(nullptr, COINIT_MULTITHREADED);
     if (argc > 1 && wcscmp(argv[1], L"-i") == 0)
