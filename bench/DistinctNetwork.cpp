@@ -28,22 +28,6 @@ std::string Description(DWORD members)
     return text;
 }
 
-std::wstring BesideThisProgram(const wchar_t *file)
-{
-    wchar_t self[MAX_PATH];
-    GetModuleFileNameW(nullptr, self, MAX_PATH);
-    std::wstring path(self);
-    return path.substr(0, path.find_last_of(L'\\') + 1) + file;
-}
-
-bool WriteText(const std::wstring &path, const std::string &text)
-{
-    UniqueHandle file(CreateFileW(path.c_str(), GENERIC_WRITE, 0, nullptr, CREATE_ALWAYS, 0, nullptr));
-    DWORD written = 0;
-    return file && WriteFile(file.Get(), text.data(), static_cast<DWORD>(text.size()), &written, nullptr) &&
-           written == text.size();
-}
-
 HRESULT Execute(const std::wstring &command, std::wstring &answer)
 {
     BSTR text = nullptr;
@@ -57,7 +41,7 @@ HRESULT Execute(const std::wstring &command, std::wstring &answer)
 DistinctNetwork::DistinctNetwork(DWORD members) : m_members(members)
 {
     std::wstring path = BesideThisProgram(L"distinct_network.txt");
-    if (!WriteText(path, Description(members))) {
+    if (!WriteTextFile(path, Description(members))) {
         m_error = L"cannot write " + path;
         return;
     }
@@ -101,4 +85,20 @@ HANDLE OpenProcessNamed(const wchar_t *image)
         if (_wcsicmp(entry.szExeFile, image) == 0)
             return OpenProcess(PROCESS_QUERY_INFORMATION | PROCESS_VM_READ, FALSE, entry.th32ProcessID);
     return nullptr;
+}
+
+std::wstring BesideThisProgram(const wchar_t *file)
+{
+    wchar_t self[MAX_PATH];
+    GetModuleFileNameW(nullptr, self, MAX_PATH);
+    std::wstring path(self);
+    return path.substr(0, path.find_last_of(L'\\') + 1) + file;
+}
+
+bool WriteTextFile(const std::wstring &path, const std::string &text)
+{
+    UniqueHandle file(CreateFileW(path.c_str(), GENERIC_WRITE, 0, nullptr, CREATE_ALWAYS, 0, nullptr));
+    DWORD written = 0;
+    return file && WriteFile(file.Get(), text.data(), static_cast<DWORD>(text.size()), &written, nullptr) &&
+           written == text.size();
 }

@@ -30,3 +30,6 @@ private:
 
 // A process of the given image name, opened to read its times and memory.
 HANDLE OpenProcessNamed(const wchar_t *image);
+// A file in this program's folder, and writing one.
+std::wstring BesideThisProgram(const wchar_t *file);
+bool WriteTextFile(const std::wstring &path, const std::string &text);

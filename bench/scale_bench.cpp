@@ -17,9 +17,16 @@
 // answered by baseline_server, which looks nothing up and sends the least a
 // server must send; what is left above it is our server's and its network's.
 // No other server process may run meanwhile.
+//
+// With --distinct it measures a plant's items instead (DistinctNetwork.h):
+// memory per item (server and node) at 100,000 items in 10 groups over
+// 10,000 members that count every 10 ms, AddItems of 10,000 distinct such
+// items, and a cache Read of 1,000 of them while they change beside the same
+// Read of constant ones.
 #include "BaselineProcess.h"
 #include "CadroSim.h"
 #include "ComPtr.h"
+#include "DistinctNetwork.h"
 #include "Handle.h"
 #include "ItemDefinitions.h"
 #include "ServerProcesses.h"
@@ -31,6 +38,8 @@
 #include <algorithm>
 #include <chrono>
 #include <cstdio>
+#include <cstring>
+#include <memory>
 #include <string>
 #include <vector>
 
@@ -78,33 +87,6 @@ std::string Description()
                 text += "member m" + std::to_string(i) + " value=2\n";
         }
     return text;
-}
-
-std::wstring BesideThisProgram(const wchar_t *file)
-{
-    wchar_t self[MAX_PATH];
-    GetModuleFileNameW(nullptr, self, MAX_PATH);
-    std::wstring path(self);
-    return path.substr(0, path.find_last_of(L'\\') + 1) + file;
-}
-
-bool WriteFile(const std::wstring &path, const std::string &text)
-{
-    UniqueHandle file(CreateFileW(path.c_str(), GENERIC_WRITE, 0, nullptr, CREATE_ALWAYS, 0, nullptr));
-    DWORD written = 0;
-    return file && ::WriteFile(file.Get(), text.data(), static_cast<DWORD>(text.size()), &written, nullptr) &&
-           written == text.size();
-}
-
-UniqueHandle OpenProcessOf(const wchar_t *image)
-{
-    UniqueHandle snapshot(CreateToolhelp32Snapshot(TH32CS_SNAPPROCESS, 0));
-    PROCESSENTRY32W entry = {};
-    entry.dwSize = sizeof entry;
-    for (BOOL more = Process32FirstW(snapshot.Get(), &entry); more; more = Process32NextW(snapshot.Get(), &entry))
-        if (_wcsicmp(entry.szExeFile, image) == 0)
-            return UniqueHandle(OpenProcess(PROCESS_QUERY_INFORMATION | PROCESS_VM_READ, FALSE, entry.th32ProcessID));
-    return UniqueHandle();
 }
 
 double WorkingSetKB(HANDLE process)
@@ -296,8 +278,8 @@ void ReadFigures(IOPCServer *server, const Floor &floor)
 
 void MemoryFigures(IOPCServer *server)
 {
-    UniqueHandle process = OpenProcessOf(L"Local.exe");
-    UniqueHandle node = OpenProcessOf(L"cadronode.exe");
+    UniqueHandle process(OpenProcessNamed(L"Local.exe"));
+    UniqueHandle node(OpenProcessNamed(L"cadronode.exe"));
     if (WorkingSetKB(process.Get()) == 0) {
         printf("server memory: the server's working set cannot be read\n");
         return;
@@ -329,16 +311,109 @@ void MemoryFigures(IOPCServer *server)
     printf("network node memory per subscription: %.3f KB\n", (nodeAfter - nodeBefore) / n);
     printf("RemoveGroup of a group of 100,000 items: %.1f ms\n", second.Remove());
 }
+
+// Best and mean of a cache Read of the first n handles, 20 reads after one
+// that may wait for first values.
+void ReadFigure(const char *what, IOPCItemMgt *items, const std::vector<OPCHANDLE> &all, DWORD n, double &best)
+{
+    ComPtr<IOPCSyncIO> io;
+    items->QueryInterface(IID_IOPCSyncIO, reinterpret_cast<void **>(io.Out()));
+    std::vector<OPCHANDLE> handles(all.begin(), all.begin() + std::min<size_t>(n, all.size()));
+    double total = 0;
+    const int runs = 20;
+    HRESULT hr = S_OK;
+    best = 1e9;
+    for (int run = 0; run <= runs; ++run) {
+        double ms = ReadAll(io.Get(), handles, &hr);
+        if (run > 0) {
+            best = std::min(best, ms);
+            total += ms;
+        }
+    }
+    printf("  cache Read of %lu items %-28s best %.2f ms, mean %.2f ms (0x%08lX)\n", static_cast<unsigned long>(n),
+           what, best, total / runs, static_cast<unsigned long>(hr));
+}
+
+void DistinctFigures(IOPCServer *server, const DistinctNetwork &network, const Floor &floor)
+{
+    const DWORD members = 10000, groups = 10;
+    std::vector<std::wstring> changing = network.Changing(members), constant = network.Constant(members);
+    UniqueHandle process(OpenProcessNamed(L"Local.exe"));
+    UniqueHandle node(OpenProcessNamed(L"cadronode.exe"));
+    printf("%lu distinct members counting every 10 ms, through COM:\n", static_cast<unsigned long>(members));
+    {
+        // Memory first: the address space is still to be read.
+        Sleep(500);
+        double before = WorkingSetKB(process.Get()), nodeBefore = WorkingSetKB(node.Get());
+        std::vector<std::unique_ptr<Group>> all;
+        auto start = Clock::now();
+        for (DWORD g = 0; g < groups; ++g) {
+            all.push_back(std::make_unique<Group>(server, (L"plant" + std::to_wstring(g)).c_str()));
+            all.back()->Add(changing);
+        }
+        double addMs = Ms(start);
+        Sleep(1000);
+        double after = WorkingSetKB(process.Get()), nodeAfter = WorkingSetKB(node.Get());
+        const double items = static_cast<double>(members) * groups;
+        printf("  memory per item at %.0f items in %lu groups: %.3f KB in the server, %.3f KB in the node (added in "
+               "%.0f ms)\n",
+               items, static_cast<unsigned long>(groups), (after - before) / items, (nodeAfter - nodeBefore) / items,
+               addMs);
+        start = Clock::now();
+        all.clear();
+        printf("  RemoveGroup of the %lu groups while their items change: %.1f ms\n",
+               static_cast<unsigned long>(groups), Ms(start));
+    }
+    double first = 0, best = 1e12, floorBest = 1e12;
+    for (int run = 0; run < 3; ++run) {
+        Group group(server, L"add");
+        double ms = group.Add(changing);
+        first = run == 0 ? ms : first;
+        best = std::min(best, ms);
+        floorBest = std::min(floorBest, AddAll(floor.items.Get(), changing));
+    }
+    printf("  AddItems of %lu distinct items: first %.1f ms, best of 3 %.1f ms, floor %.1f ms\n",
+           static_cast<unsigned long>(members), first, best, floorBest);
+    Group moving(server, L"moving"), still(server, L"still");
+    moving.Add(changing);
+    still.Add(constant);
+    Sleep(1000);
+    double changingBest = 0, constantBest = 0;
+    ReadFigure("while they change:", moving.Items(), moving.Handles(), 1000, changingBest);
+    ReadFigure("of constant members:", still.Items(), still.Handles(), 1000, constantBest);
+    if (constantBest > 0)
+        printf("  changing / constant: %.2f\n", changingBest / constantBest);
+}
 } // namespace
 
-int main()
+int main(int argc, char **argv)
 {
     if (CountServerProcesses() != 0) {
         printf("a server process is running already: it serves another network; stop it first\n");
         return 1;
     }
+    if (argc > 1 && strcmp(argv[1], "--distinct") == 0) {
+        DistinctNetwork network(10000);
+        if (!network.Error().empty()) {
+            printf("%ls\n", network.Error().c_str());
+            return 1;
+        }
+        CoInitializeEx(nullptr, COINIT_MULTITHREADED);
+        {
+            ComPtr<IOPCServer> server;
+            Floor floor;
+            if (FAILED(CoCreateInstance(kServer, nullptr, CLSCTX_LOCAL_SERVER, IID_IOPCServer,
+                                        reinterpret_cast<void **>(server.Out()))) ||
+                !floor.Ready())
+                printf("the server is not registered or the baseline server did not start\n");
+            else
+                DistinctFigures(server.Get(), network, floor);
+        }
+        CoUninitialize();
+        return 0;
+    }
     std::wstring path = BesideThisProgram(L"scale_network.txt");
-    if (!WriteFile(path, Description())) {
+    if (!WriteTextFile(path, Description())) {
         printf("cannot write %ls\n", path.c_str());
         return 1;
     }
