@@ -39,8 +39,8 @@ void ControlPipe::Run()
     HANDLE event = CreateEventW(nullptr, TRUE, FALSE, nullptr);
     auto newInstance = [&name] {
         return CreateNamedPipeW(name.c_str(), PIPE_ACCESS_DUPLEX | FILE_FLAG_OVERLAPPED,
-                                PIPE_TYPE_MESSAGE | PIPE_READMODE_MESSAGE | PIPE_WAIT, 2, kBufferBytes, kBufferBytes, 0,
-                                nullptr);
+                                PIPE_TYPE_MESSAGE | PIPE_READMODE_MESSAGE | PIPE_WAIT, PIPE_UNLIMITED_INSTANCES,
+                                kBufferBytes, kBufferBytes, 0, nullptr);
     };
     HANDLE pipe = newInstance();
     while (pipe != INVALID_HANDLE_VALUE && WaitForSingleObject(m_stop, 0) == WAIT_TIMEOUT) {
@@ -69,6 +69,12 @@ void ControlPipe::Run()
             DisconnectNamedPipe(pipe);
         }
         CloseHandle(pipe);
+        // An instance that could not be made while this one was served (a
+        // served one that its caller still holds counts against the limit,
+        // a moment of shortage) is made now: without one, the process would
+        // look from then on as if it ran no network.
+        while (next == INVALID_HANDLE_VALUE && WaitForSingleObject(m_stop, 50) == WAIT_TIMEOUT)
+            next = newInstance();
         pipe = next;
     }
     if (pipe != INVALID_HANDLE_VALUE)
