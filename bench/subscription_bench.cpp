@@ -27,6 +27,7 @@
 #include "DistinctNetwork.h"
 #include "GroupState.h"
 #include "Handle.h"
+#include "ItemDefinitions.h"
 #include "OPCGroup.h"
 #include "ProcessTimes.h"
 #include "ServerProcesses.h"
@@ -39,7 +40,6 @@
 #include <cstdio>
 #include <ocidl.h>
 #include <string>
-#include <tlhelp32.h>
 #include <vector>
 
 namespace {
@@ -113,22 +113,17 @@ struct Group {
     DWORD cookie = 0;
 };
 
-Group MakeGroup(IOPCServer *server, DWORD rate, const wchar_t *id, DWORD count, CountingSink *sink)
+// An active group of one item for each id, advised to sink when there is one.
+Group MakeGroupOf(IOPCServer *server, DWORD rate, const std::vector<std::wstring> &ids, CountingSink *sink)
 {
     Group g;
     DWORD revised;
     server->AddGroup(L"", TRUE, rate, 1, nullptr, nullptr, 0, &g.handle, &revised, IID_IOPCItemMgt,
                      reinterpret_cast<IUnknown **>(g.items.Out()));
-    std::vector<OPCITEMDEF> defs(count);
-    for (DWORD i = 0; i < count; ++i) {
-        defs[i] = {};
-        defs[i].szItemID = const_cast<wchar_t *>(id);
-        defs[i].bActive = TRUE;
-        defs[i].hClient = i;
-    }
+    std::vector<OPCITEMDEF> defs = ActiveDefinitions(ids);
     OPCITEMRESULT *results = nullptr;
     HRESULT *errors = nullptr;
-    g.items->AddItems(count, defs.data(), &results, &errors);
+    g.items->AddItems(static_cast<DWORD>(defs.size()), defs.data(), &results, &errors);
     CoTaskMemFree(results);
     CoTaskMemFree(errors);
     if (sink) {
@@ -140,30 +135,20 @@ Group MakeGroup(IOPCServer *server, DWORD rate, const wchar_t *id, DWORD count, 
     return g;
 }
 
-// An active group of one item for each id.
-Group MakeGroupOf(IOPCServer *server, DWORD rate, const std::vector<std::wstring> &ids, CountingSink *sink)
+// count items that all follow one member.
+Group MakeGroup(IOPCServer *server, DWORD rate, const wchar_t *id, DWORD count, CountingSink *sink)
 {
-    Group g;
-    DWORD revised;
-    server->AddGroup(L"", TRUE, rate, 1, nullptr, nullptr, 0, &g.handle, &revised, IID_IOPCItemMgt,
-                     reinterpret_cast<IUnknown **>(g.items.Out()));
-    std::vector<OPCITEMDEF> defs(ids.size());
-    for (size_t i = 0; i < ids.size(); ++i) {
-        defs[i] = {};
-        defs[i].szItemID = const_cast<wchar_t *>(ids[i].c_str());
-        defs[i].bActive = TRUE;
-        defs[i].hClient = static_cast<OPCHANDLE>(i);
-    }
-    OPCITEMRESULT *results = nullptr;
-    HRESULT *errors = nullptr;
-    g.items->AddItems(static_cast<DWORD>(defs.size()), defs.data(), &results, &errors);
-    CoTaskMemFree(results);
-    CoTaskMemFree(errors);
-    ComPtr<IConnectionPointContainer> container;
-    g.items.As(container);
-    container->FindConnectionPoint(IID_IOPCDataCallback, g.point.Out());
-    g.point->Advise(sink, &g.cookie);
-    return g;
+    return MakeGroupOf(server, rate, std::vector<std::wstring>(count, id), sink);
+}
+
+// Unadvises and removes a group; the group's interfaces go first.
+void RemoveGroupOf(IOPCServer *server, Group &g)
+{
+    if (g.point)
+        g.point->Unadvise(g.cookie);
+    OPCHANDLE handle = g.handle;
+    g = Group();
+    server->RemoveGroup(handle, TRUE);
 }
 
 struct Delivery {
@@ -201,11 +186,8 @@ public:
     }
     ~OurGroup()
     {
-        m_group.point->Unadvise(m_group.cookie);
-        OPCHANDLE handle = m_group.handle;
         m_state.Reset();
-        m_group = Group();
-        m_server->RemoveGroup(handle, TRUE);
+        RemoveGroupOf(m_server, m_group);
     }
     OurGroup(const OurGroup &) = delete;
     OurGroup &operator=(const OurGroup &) = delete;
@@ -257,18 +239,6 @@ private:
     DWORD m_cookie = 0;
 };
 
-// The process of the local server this program is connected to.
-UniqueHandle FindServerProcess()
-{
-    UniqueHandle snapshot(CreateToolhelp32Snapshot(TH32CS_SNAPPROCESS, 0));
-    PROCESSENTRY32W entry = {};
-    entry.dwSize = sizeof(entry);
-    for (BOOL more = Process32FirstW(snapshot.Get(), &entry); more; more = Process32NextW(snapshot.Get(), &entry))
-        if (_wcsicmp(entry.szExeFile, L"Local.exe") == 0)
-            return UniqueHandle(OpenProcess(PROCESS_QUERY_LIMITED_INFORMATION, FALSE, entry.th32ProcessID));
-    return UniqueHandle();
-}
-
 void PrintDelivery(const char *what, DWORD n, const Delivery &d)
 {
     printf("  %-22s N=%-6lu %10.0f items/s  %7.3f us server CPU per item%s\n", what, static_cast<unsigned long>(n),
@@ -288,7 +258,7 @@ void CompareThroughCom(const std::vector<DWORD> &counts)
         printf("out of process: the server is not registered\n");
         return;
     }
-    UniqueHandle serverProcess = FindServerProcess();
+    UniqueHandle serverProcess(OpenProcessNamed(L"Local.exe"));
     for (DWORD items : counts) {
         BaselineServer baseline(items);
         if (!baseline.Ready()) {
@@ -368,7 +338,7 @@ void Distinct(DWORD members)
         printf("the server is not registered: run ./test.sh or scripts/setup.sh first\n");
         return;
     }
-    UniqueHandle serverProcess = FindServerProcess();
+    UniqueHandle serverProcess(OpenProcessNamed(L"Local.exe"));
     UniqueHandle node(OpenProcessNamed(L"cadronode.exe"));
     const DWORD kWindowMs = 2000;
     printf("%lu items on distinct members counting every 10 ms, one active 10 ms group, through COM:\n",
@@ -388,10 +358,7 @@ void Distinct(DWORD members)
             best.medianMs = std::min(best.medianMs, w.medianMs);
             best.p99Ms = std::min(best.p99Ms, w.p99Ms);
         }
-        group.point->Unadvise(group.cookie);
-        OPCHANDLE handle = group.handle;
-        group = Group();
-        server->RemoveGroup(handle, TRUE);
+        RemoveGroupOf(server.Get(), group);
     }
     PrintPlantWindow("best of the three", best);
     BaselineServer baseline(members);
@@ -454,9 +421,7 @@ int wmain(int argc, wchar_t **argv)
         printf("scan cost per unchanged active item: %.1f ns (%lu items, %d scans)\n", ns,
                static_cast<unsigned long>(n), scans);
         state.Reset();
-        OPCHANDLE quietHandle = quiet.handle;
-        quiet = Group();
-        server->RemoveGroup(quietHandle, TRUE);
+        RemoveGroupOf(server.Get(), quiet);
 
         // Scan cost per changed item, the work a scan adds to each delivery:
         // every item has changed since the last scan, and no sink is advised.
@@ -480,9 +445,7 @@ int wmain(int argc, wchar_t **argv)
         printf("scan cost per changed active item: %.1f ns (%lu items, 50 scans)\n", changedNs / (50.0 * n),
                static_cast<unsigned long>(n));
         state.Reset();
-        OPCHANDLE busyHandle = busy.handle;
-        busy = Group();
-        server->RemoveGroup(busyHandle, TRUE);
+        RemoveGroupOf(server.Get(), busy);
 
         // Latency from a publish to OnDataChange at a 10 ms rate.
         ComPtr<CountingSink> sink = CountingSink::Create();
@@ -504,10 +467,7 @@ int wmain(int argc, wchar_t **argv)
         std::sort(ms.begin(), ms.end());
         printf("publish to OnDataChange at 10 ms: median %.2f ms, 99th percentile %.2f ms\n", ms[ms.size() / 2],
                ms[ms.size() * 99 / 100]);
-        g.point->Unadvise(g.cookie);
-        OPCHANDLE handle = g.handle;
-        g = Group();
-        server->RemoveGroup(handle, TRUE);
+        RemoveGroupOf(server.Get(), g);
 
         printf("items delivered through OnDataChange, every item changing every 10 ms scan:\n");
         for (DWORD items : {100u, 1000u, 10000u})

@@ -200,21 +200,29 @@ void NodeSession::Subscribe(wire::In &in)
     std::wstring url = in.Text();
     if (!in.Ok())
         return;
+    if (id == kNoMember) {
+        if (request)
+            Reply([&](wire::Out &out) {
+                out.U32(request);
+                out.U32(static_cast<uint32_t>(E_INVALIDARG));
+            });
+        return;
+    }
     Unsubscribe(id); // an id used twice: the later subscription wins
     HRESULT hr = S_OK;
     uint32_t fresh = 0; // a new feed, to subscribe on the engine
     {
         std::lock_guard<SlimMutex> l(m_feedsLock);
         uint64_t hash = wire::UrlHash(url), check = wire::UrlCheck(url);
-        Feed *feed = id == kNoMember ? nullptr : SharedFeed(hash, check);
-        if (!feed && id != kNoMember) {
+        Feed *feed = SharedFeed(hash, check);
+        if (!feed) {
             feed = NewFeed(hash, check);
             fresh = feed ? feed->id : 0;
         }
         if (feed)
             Join(*feed, id);
         else
-            hr = id == kNoMember ? E_INVALIDARG : E_OUTOFMEMORY;
+            hr = E_OUTOFMEMORY;
     }
     if (fresh) {
         // Outside the lock: the engine may answer at once, from this thread.
