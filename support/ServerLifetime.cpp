@@ -181,9 +181,3 @@ CServerLifetime::Phase CServerLifetime::Advance(DWORD &waitMs)
     }
     return m_phase;
 }
-
-CServerLifetime::Phase CServerLifetime::CurrentPhase()
-{
-    CSingleLock lock(&m_lock);
-    return m_phase;
-}

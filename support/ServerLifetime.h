@@ -96,7 +96,6 @@ public:
     // how long to wait (ms, INFINITE) before the next step, or returns
     // Stopped once the class object is revoked and the process must leave.
     Phase Advance(DWORD &waitMs);
-    Phase CurrentPhase();
     // Signalled whenever the next step may come earlier than it said.
     HANDLE WakeEvent() const { return m_wake.Get(); }
 
