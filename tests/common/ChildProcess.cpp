@@ -16,8 +16,18 @@ long RunAndCapture(const std::wstring &commandLine, std::string &output, DWORD t
     si.hStdOutput = writeEnd;
     si.hStdError = writeEnd;
     PROCESS_INFORMATION pi = {};
-    std::wstring line = commandLine;
-    if (!CreateProcessW(nullptr, line.data(), nullptr, nullptr, TRUE, 0, nullptr, nullptr, &si, &pi))
+    // Under a heavily loaded Wine a process start can fail now and then:
+    // tried a few times, and a last failure says its code in the output.
+    bool started = false;
+    for (int attempt = 0; attempt < 3 && !started; ++attempt) {
+        std::wstring line = commandLine;
+        started = CreateProcessW(nullptr, line.data(), nullptr, nullptr, TRUE, 0, nullptr, nullptr, &si, &pi) != FALSE;
+        if (!started) {
+            output = "CreateProcess failed: error " + std::to_string(GetLastError());
+            Sleep(200);
+        }
+    }
+    if (!started)
         return -1;
     UniqueHandle process(pi.hProcess), thread(pi.hThread);
     writer.Reset();
