@@ -11,13 +11,6 @@
 namespace cadrosim {
 
 namespace {
-// The key of a URL's hash in the table of feeds (0 marks a free slot there;
-// the feed's second hash decides).
-uint64_t UrlKey(uint64_t hash)
-{
-    return hash ? hash : 1;
-}
-
 // A library that reads nothing for this long is hung: its connection is
 // dropped rather than the node's memory filled (it reconnects and
 // subscribes again when it recovers).
@@ -107,11 +100,13 @@ void NodeSession::ReleaseAll()
     std::vector<CadroDataItem *> items;
     {
         std::lock_guard<SlimMutex> l(m_feedsLock);
-        for (auto &feed : m_feeds)
-            if (feed && feed->item)
-                items.push_back(feed->item);
-        m_feeds.clear();
+        for (uint32_t slot = 0; slot < m_slots; ++slot)
+            if (CadroDataItem *item = FeedAt(slot).item)
+                items.push_back(item);
+        m_pages.clear();
+        m_slots = 0;
         m_freeFeeds.clear();
+        m_longData.clear();
         m_feedOfUrl.Clear();
         m_memberships.Clear();
     }
@@ -219,9 +214,13 @@ void NodeSession::Subscribe(wire::In &in)
             feed = NewFeed(hash, check);
             fresh = feed ? feed->id : 0;
         }
-        if (feed)
-            Join(*feed, id);
-        else
+        if (feed && !Join(*feed, id)) {
+            if (fresh)
+                DropFeed(*feed);
+            fresh = 0;
+            feed = nullptr;
+        }
+        if (!feed)
             hr = E_OUTOFMEMORY;
     }
     if (fresh) {
@@ -249,50 +248,72 @@ void NodeSession::Subscribe(wire::In &in)
 
 NodeSession::Feed *NodeSession::FeedOf(uint32_t feedId)
 {
-    uint32_t slot = wire::FeedSlot(feedId);
-    if (slot >= m_feeds.size() || !m_feeds[slot] || m_feeds[slot]->id != feedId)
+    uint32_t slot = wire::FeedSlot(feedId); // beyond every slot for id 0
+    if (slot >= m_slots)
         return nullptr;
-    return m_feeds[slot].get();
+    Feed &feed = FeedAt(slot);
+    return feed.id == feedId ? &feed : nullptr;
 }
 
 NodeSession::Feed *NodeSession::SharedFeed(uint64_t hash, uint64_t check)
 {
-    uint32_t *indexed = m_feedOfUrl.Find(UrlKey(hash));
-    Feed *feed = indexed ? FeedOf(*indexed) : nullptr;
-    return feed && feed->check == check ? feed : nullptr;
+    uint32_t handle = m_feedOfUrl.Find(hash);
+    Feed *feed = handle ? &FeedAt(handle - 1) : nullptr;
+    return feed && feed->id && feed->check == check ? feed : nullptr;
 }
 
 void NodeSession::Unshare(Feed &feed)
 {
-    uint32_t *indexed = m_feedOfUrl.Find(UrlKey(feed.hash));
-    if (indexed && *indexed == feed.id)
-        m_feedOfUrl.Erase(UrlKey(feed.hash));
+    m_feedOfUrl.Erase(wire::FeedSlot(feed.id) + 1, feed.hash);
 }
 
-void NodeSession::LastData::Assign(std::string_view fields)
+void NodeSession::StoreData(Feed &feed, std::string_view fields)
 {
-    if (fields.size() <= sizeof m_short) {
-        memcpy(m_short, fields.data(), fields.size());
-        m_size = static_cast<uint8_t>(fields.size());
-        m_long.reset();
-    } else {
-        m_size = 0;
-        if (m_long)
-            m_long->assign(fields);
-        else
-            m_long = std::make_unique<std::string>(fields);
+    if (fields.size() <= sizeof feed.data.bytes) {
+        memcpy(feed.data.bytes, fields.data(), fields.size());
+        feed.data.size = static_cast<uint8_t>(fields.size());
+        if (feed.data.isLong)
+            m_longData.erase(wire::FeedSlot(feed.id));
+        feed.data.isLong = false;
+        return;
     }
+    feed.data.size = 0;
+    try {
+        m_longData[wire::FeedSlot(feed.id)].assign(fields);
+        feed.data.isLong = true;
+    } catch (const std::bad_alloc &) {
+        // No memory for the text: a newcomer gets no value until the next.
+        ClearData(feed);
+    }
+}
+
+std::string_view NodeSession::DataOf(const Feed &feed) const
+{
+    if (!feed.data.isLong)
+        return {feed.data.bytes, feed.data.size};
+    auto found = m_longData.find(wire::FeedSlot(feed.id));
+    return found != m_longData.end() ? std::string_view(found->second) : std::string_view();
+}
+
+void NodeSession::ClearData(Feed &feed)
+{
+    if (feed.data.isLong)
+        m_longData.erase(wire::FeedSlot(feed.id));
+    feed.data.isLong = false;
+    feed.data.size = 0;
 }
 
 void NodeSession::FeedMembers::Add(uint32_t id)
 {
-    if (m_count++ == 0) {
+    if (m_count == 0) {
         m_first = id;
+        m_count = 1;
         return;
     }
     if (!m_more)
         m_more = std::make_unique<std::vector<uint32_t>>();
-    m_more->push_back(id);
+    m_more->push_back(id); // an empty array left behind by a failure is harmless
+    ++m_count;
 }
 
 void NodeSession::FeedMembers::RemoveLast()
@@ -309,33 +330,50 @@ void NodeSession::FeedMembers::RemoveLast()
 NodeSession::Feed *NodeSession::NewFeed(uint64_t hash, uint64_t check)
 {
     uint32_t slot;
-    if (!m_freeFeeds.empty()) {
-        slot = m_freeFeeds.back();
-        m_freeFeeds.pop_back();
-    } else {
-        if (m_feeds.size() >= wire::kFeedSlotMask)
-            return nullptr;
-        slot = static_cast<uint32_t>(m_feeds.size());
-        m_feeds.emplace_back();
-        m_feedGenerations.push_back(0);
+    try {
+        // Room first, so that nothing below can fail half-way.
+        m_feedOfUrl.Reserve(1);
+        if (!m_freeFeeds.empty()) {
+            slot = m_freeFeeds.back();
+            m_freeFeeds.pop_back();
+        } else {
+            if (m_slots >= wire::kFeedSlotMask)
+                return nullptr;
+            // The free list can then take every slot without growing.
+            if (m_freeFeeds.capacity() <= m_slots)
+                m_freeFeeds.reserve(2 * (m_slots + 1));
+            if (m_slots % kPageSize == 0) {
+                m_pages.reserve(m_pages.size() + 1);
+                m_pages.push_back(std::make_unique<Feed[]>(kPageSize));
+            }
+            slot = m_slots++;
+        }
+    } catch (const std::bad_alloc &) {
+        return nullptr;
     }
-    auto feed = std::make_unique<Feed>();
+    Feed &feed = FeedAt(slot);
     // The generation tells the feed from an earlier one of the slot whose
     // engine subscription may still be calling.
-    feed->id = (static_cast<uint32_t>(++m_feedGenerations[slot] & 0x7ff) << wire::kFeedSlotBits) | (slot + 1);
-    feed->hash = hash;
-    feed->check = check;
-    // A stale entry (its feed gone) is replaced; a live one of another URL
-    // with the same hash is kept.
-    uint32_t &indexed = m_feedOfUrl[UrlKey(hash)];
-    if (!FeedOf(indexed))
-        indexed = feed->id;
-    m_feeds[slot] = std::move(feed);
-    return m_feeds[slot].get();
+    feed.generation++;
+    feed.id = (static_cast<uint32_t>(feed.generation & 0x7ff) << wire::kFeedSlotBits) | (slot + 1);
+    feed.hash = hash;
+    feed.check = check;
+    // Another live feed of a URL with the same hash keeps its place (room
+    // was made above).
+    m_feedOfUrl.Insert(slot + 1, hash);
+    return &feed;
 }
 
-void NodeSession::Join(Feed &feed, uint32_t id)
+bool NodeSession::Join(Feed &feed, uint32_t id)
 {
+    // The membership first: it is what can fail for want of memory.
+    try {
+        m_memberships.Reserve(1);
+        feed.members.Add(id);
+    } catch (const std::bad_alloc &) {
+        return false;
+    }
+    m_memberships[id] = {feed.id, feed.members.Size() - 1};
     // A newcomer hears what a new subscription would: the statuses since
     // "connecting", and once subscribed, the attributes and the value.
     for (uint8_t i = 0; i < feed.statusCount; ++i)
@@ -350,14 +388,13 @@ void NodeSession::Join(Feed &feed, uint32_t id)
                 out.Attributes(feed.attributes);
             });
         if (!feed.data.Empty())
-            m_queue.PushId(wire::Kind::Data, feed.data.View(), id);
+            m_queue.PushId(wire::Kind::Data, DataOf(feed), id);
     }
     m_queue.Push(wire::Kind::Joined, [&](wire::Out &out) {
         out.U32(id);
         out.U32(feed.id);
     });
-    m_memberships[id] = {feed.id, feed.members.Size()};
-    feed.members.Add(id);
+    return true;
 }
 
 CadroDataItem *NodeSession::Leave(uint32_t id)
@@ -373,7 +410,8 @@ CadroDataItem *NodeSession::Leave(uint32_t id)
     FeedMembers &members = feed->members;
     if (membership.index + 1 < members.Size()) {
         members[membership.index] = members[members.Size() - 1];
-        m_memberships[members[membership.index]].index = membership.index;
+        if (Membership *moved = m_memberships.Find(members[membership.index]))
+            moved->index = membership.index;
     }
     members.RemoveLast();
     if (members.Size() > 0)
@@ -388,9 +426,12 @@ void NodeSession::DropFeed(Feed &feed)
 {
     feed.members.ForEach([&](uint32_t member) { m_memberships.Erase(member); });
     Unshare(feed);
+    ClearData(feed);
     uint32_t slot = wire::FeedSlot(feed.id);
-    m_feeds[slot].reset();
-    m_freeFeeds.push_back(slot);
+    uint16_t generation = feed.generation;
+    feed = Feed();
+    feed.generation = generation;
+    m_freeFeeds.push_back(slot); // within its capacity (NewFeed)
 }
 
 void NodeSession::Unsubscribe(uint32_t id)
@@ -459,19 +500,12 @@ void NodeSession::TopologyChanged()
 HRESULT STDMETHODCALLTYPE NodeSession::OnData(void *cookie, uint32_t flags, const CadroValue *value, int32_t errorFlag,
                                               uint32_t timeLow, uint32_t timeHigh)
 {
-    WithFields(flags, *value, errorFlag, timeLow, timeHigh, [&](std::string_view fields) {
-        // Values come from every shard at once: they share the table and
-        // take only their feed's own lock (a newcomer's replay holds the
-        // table alone).
-        std::shared_lock<SlimMutex> l(m_feedsLock);
-        Feed *feed = FeedOf(IdOf(cookie));
-        if (!feed)
-            return;
-        std::lock_guard<SlimMutex> fl(feed->lock);
-        feed->data.Assign(fields);
-        // Feeds that get one value one after the other share one frame.
-        m_queue.PushId(wire::Kind::FeedData, fields, feed->id);
-    });
+    // A single value (a write's, or a subscription's first): the same path
+    // as a tick's, the table held alone for it.
+    std::lock_guard<SlimMutex> l(m_feedsLock);
+    TakeData(
+        1, [&](size_t) { return IdOf(cookie); },
+        [&](size_t, auto use) { WithFields(flags, *value, errorFlag, timeLow, timeHigh, use); });
     return S_OK;
 }
 
@@ -479,29 +513,37 @@ void NodeSession::OnDataBatch(const DataEntry *entries, size_t count)
 {
     constexpr uint32_t kFlags = kCadroHasValue | kCadroHasQuality | kCadroHasTime;
     std::lock_guard<SlimMutex> l(m_feedsLock);
-    const bool behind = m_queue.Backlog() > kBehindBacklog;
-    // A feed's place in the table is asked for before the feed.
-    auto slotOf = [&](size_t i) { return wire::FeedSlot(IdOf(entries[i].cookie)); };
+    TakeData(
+        count, [&](size_t i) { return IdOf(entries[i].cookie); },
+        [&](size_t i, auto use) {
+            const DataEntry &e = entries[i];
+            WithFields(kFlags, *e.value, e.error, e.low, e.high, use);
+        });
+}
+
+template <class FeedIdOf, class FieldsOf> void NodeSession::TakeData(size_t count, FeedIdOf feedIdOf, FieldsOf fieldsOf)
+{
     auto each = [&](auto take) {
         for (size_t i = 0; i < count; ++i) {
-            if (i + 2 * kPrefetchAhead < count && slotOf(i + 2 * kPrefetchAhead) < m_feeds.size())
-                __builtin_prefetch(&m_feeds[slotOf(i + 2 * kPrefetchAhead)]);
-            if (i + kPrefetchAhead < count && slotOf(i + kPrefetchAhead) < m_feeds.size())
-                PrefetchObject(m_feeds[slotOf(i + kPrefetchAhead)].get());
-            const DataEntry &e = entries[i];
-            if (Feed *feed = FeedOf(IdOf(e.cookie)))
-                WithFields(kFlags, *e.value, e.error, e.low, e.high, [&](std::string_view fields) {
-                    feed->data.Assign(fields);
+            if (i + kPrefetchAhead < count) {
+                uint32_t slot = wire::FeedSlot(feedIdOf(i + kPrefetchAhead));
+                if (slot < m_slots)
+                    PrefetchObject(&FeedAt(slot));
+            }
+            if (Feed *feed = FeedOf(feedIdOf(i)))
+                fieldsOf(i, [&](std::string_view fields) {
+                    StoreData(*feed, fields);
                     take(*feed, fields);
                 });
         }
     };
-    if (behind) {
+    if (m_queue.Backlog() > kBehindBacklog) {
         each([&](Feed &feed, std::string_view) { Hold(feed); });
         return;
     }
     m_queue.PushIds([&](auto push) {
         PushHeld(push);
+        // Feeds that get one value one after the other share one frame.
         each([&](Feed &feed, std::string_view fields) { push(wire::Kind::FeedData, fields, feed.id); });
     });
 }
@@ -522,7 +564,7 @@ template <class Push> void NodeSession::PushHeld(Push &push)
     for (uint32_t id : m_held) {
         Feed *feed = FeedOf(id); // gone meanwhile: nothing to send
         if (feed && feed->held && !feed->data.Empty())
-            push(wire::Kind::FeedData, feed->data.View(), feed->id);
+            push(wire::Kind::FeedData, DataOf(*feed), feed->id);
         if (feed)
             feed->held = false;
     }
@@ -565,7 +607,7 @@ HRESULT STDMETHODCALLTYPE NodeSession::StatusChange(void *cookie, uint32_t statu
         // being connected to, and is given no value until it is back.
         feed->statuses[0] = kCadroStatusConnecting;
         feed->statusCount = 1;
-        feed->data.Clear();
+        ClearData(*feed);
     } else if (feed->statusCount < sizeof feed->statuses) {
         feed->statuses[feed->statusCount++] = static_cast<uint8_t>(status);
     }

@@ -14,7 +14,9 @@
 #include "FrameQueue.h"
 
 #include <memory>
+#include <string>
 #include <thread>
+#include <unordered_map>
 #include <vector>
 
 namespace cadrosim {
@@ -51,27 +53,23 @@ private:
     NodeSession(Engine &engine, std::shared_ptr<Channel> channel, bool fromNode, HANDLE ended);
     void ReadLoop();
     bool Handle(wire::Kind kind, wire::In &in);
-    // The last Data fields: inline unless a text makes them long.
-    class LastData {
-    public:
-        void Assign(std::string_view fields);
-        void Clear() { m_size = 0, m_long.reset(); }
-        std::string_view View() const
-        {
-            return m_size ? std::string_view(m_short, m_size) : m_long ? std::string_view(*m_long) : std::string_view();
-        }
-        bool Empty() const { return m_size == 0 && !m_long; }
-
-    private:
-        char m_short[32];
-        uint8_t m_size = 0;
-        std::unique_ptr<std::string> m_long;
+    // The last Data fields, in place: a number's or a boolean's fit (a
+    // text's are kept in the session's table of long ones, by the feed's
+    // slot: they are rare, and each feed would otherwise carry a pointer).
+    struct LastData {
+        char bytes[28];
+        uint8_t size = 0;
+        bool isLong = false;
+        bool Empty() const { return size == 0 && !isLong; }
     };
+    static_assert(sizeof(LastData::bytes) >= wire::PackedFields::kMostBytes, "a packed value fits in place");
     // The library's ids that share a feed: nearly always one, kept in place.
     class FeedMembers {
     public:
         uint32_t Size() const { return m_count; }
         uint32_t &operator[](uint32_t i) { return i == 0 ? m_first : (*m_more)[i - 1]; }
+        // Throws std::bad_alloc when a second member finds no memory, the
+        // members unchanged.
         void Add(uint32_t id);
         void RemoveLast();
         template <class Each> void ForEach(Each each) const
@@ -88,23 +86,27 @@ private:
         uint32_t m_count = 0;
         std::unique_ptr<std::vector<uint32_t>> m_more;
     };
+    // A feed lives in a page of the session's table, not in a heap block of
+    // its own (a block's header and the pointer to it cost a fifth of it).
+    // What a value reads and writes first, in the feed's first cache line.
     struct Feed {
-        // What a value reads and writes first, in the feed's first lines.
-        uint32_t id = 0; // with its slot's generation: the engine's cookie
+        uint32_t id = 0;         // with its slot's generation: the engine's cookie; 0 while free
+        uint16_t generation = 0; // of the slot: kept while it is free
+        uint8_t statusCount = 0; // statuses since the last "connecting"
+        bool hasAttributes = false;
+        bool dead = false; // its member has gone: a newcomer makes a new feed
+        bool held = false; // a value not sent yet: the library is behind
         LastData data;
+        uint8_t statuses[6];
+        CadroAttributes attributes = {};
         // The URL's two hashes: URLs that agree on both are taken as one
         // (the URL itself is not kept: it would double the feed's size).
         uint64_t hash = 0, check = 0;
         CadroDataItem *item = nullptr;
         FeedMembers members;
-        uint8_t statuses[6]; // since the last "connecting"
-        uint8_t statusCount = 0;
-        bool hasAttributes = false;
-        bool dead = false; // its member has gone: a newcomer makes a new feed
-        bool held = false; // a value not sent yet: the library is behind
-        CadroAttributes attributes = {};
-        SlimMutex lock; // its values, under the table's shared lock
     };
+    static constexpr uint32_t kPageBits = 10;
+    static constexpr uint32_t kPageSize = 1u << kPageBits;
     struct Membership {
         uint32_t feed;
         uint32_t index; // in the feed's members
@@ -115,13 +117,22 @@ private:
     void Unsubscribe(uint32_t id);
     void List(uint32_t request, const std::wstring &url);
     CadroDataItem *Find(uint32_t id);
-    // Under m_feedsLock (held alone, or shared by values).
+    // Under m_feedsLock.
     Feed *FeedOf(uint32_t feedId);
+    Feed &FeedAt(uint32_t slot) { return m_pages[slot >> kPageBits][slot & (kPageSize - 1)]; }
+    void StoreData(Feed &feed, std::string_view fields);
+    std::string_view DataOf(const Feed &feed) const;
+    void ClearData(Feed &feed);
+    // Under m_feedsLock: each value (fieldsOf(i, use) calls use(fields))
+    // stored in its feed and queued, or held in the feed while the library
+    // is behind. feedIdOf(i) names the feeds to ask for ahead.
+    template <class FeedIdOf, class FieldsOf> void TakeData(size_t count, FeedIdOf feedIdOf, FieldsOf fieldsOf);
     Feed *NewFeed(uint64_t hash, uint64_t check);
     // The running feed of the URL that a newcomer joins, if any.
     Feed *SharedFeed(uint64_t hash, uint64_t check);
     void Unshare(Feed &feed);
-    void Join(Feed &feed, uint32_t id);
+    // False, and nothing changed, when memory is short.
+    bool Join(Feed &feed, uint32_t id);
     // Takes id out of its feed; the feed's engine subscription, for the
     // caller to release without the lock, when it was the last member.
     CadroDataItem *Leave(uint32_t id);
@@ -145,14 +156,20 @@ private:
     HANDLE m_endedEvent;
     std::atomic<bool> m_ended{false};
     SlimMutex m_feedsLock;
-    std::vector<std::unique_ptr<Feed>> m_feeds; // by slot
-    std::vector<uint16_t> m_feedGenerations;
+    std::vector<std::unique_ptr<Feed[]>> m_pages; // the feeds, by slot
+    uint32_t m_slots = 0;                         // slots made so far
     std::vector<uint32_t> m_freeFeeds;
-    std::vector<uint32_t> m_held; // feeds with a value held back
+    std::unordered_map<uint32_t, std::string> m_longData; // by slot: LastData::isLong
+    std::vector<uint32_t> m_held;                         // feeds with a value held back
     std::atomic<bool> m_holding{false};
-    // By the URL's hash; a URL whose hash another one has takes a feed
-    // that is not found here (it is not shared).
-    FlatMap<uint64_t, uint32_t, 0> m_feedOfUrl;
+    // Shared feeds (slot + 1) by the URL's hash, which the index reads from
+    // the feed; a URL whose hash another one has takes a feed that is not
+    // found here (it is not shared).
+    struct UrlHashOf {
+        NodeSession *session;
+        uint64_t operator()(uint32_t handle) const { return session->FeedAt(handle - 1).hash; }
+    };
+    FlatIndex<UrlHashOf> m_feedOfUrl{UrlHashOf{this}};
     // By the library's id (one id, kNoMember, cannot be subscribed).
     FlatMap<uint32_t, Membership, kNoMember> m_memberships;
     FrameQueue m_queue;

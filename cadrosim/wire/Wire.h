@@ -167,6 +167,9 @@ private:
 // is not a text: the bytes Out writes, packed on the stack.
 class PackedFields {
 public:
+    // The most a value's packed fields take: flags, type, a number, the
+    // error flag and the time's two halves.
+    static constexpr size_t kMostBytes = 4 + 4 + sizeof(double) + 4 + 4 + 4;
     // False for a text value, which Out must write.
     bool Pack(uint32_t flags, const CadroValue &value, int32_t error, uint32_t low, uint32_t high)
     {
@@ -192,7 +195,7 @@ private:
         memcpy(m_bytes + m_size, &v, sizeof v);
         m_size += sizeof v;
     }
-    char m_bytes[32];
+    char m_bytes[kMostBytes];
     size_t m_size = 0;
 };
 

@@ -70,17 +70,18 @@ private:
     bool m_closed = false;
 };
 
-// The newest number each library id has been sent, directly or through
-// the feed it joined.
-std::map<uint32_t, double> NewestById(std::string bytes)
+// The newest value each library id has been sent, directly or through the
+// feeds it joined, as take(value) gives it.
+template <class Take> auto NewestById(std::string bytes, Take take)
 {
-    std::map<uint32_t, double> byId, byFeed;
-    std::map<uint32_t, uint32_t> feedOf;
+    using Taken = decltype(take(std::declval<const CadroValue &>()));
+    std::map<uint32_t, Taken> byId;
+    std::map<uint32_t, std::vector<uint32_t>> joined; // by feed
     size_t consumed = 0;
     wire::TakeFrames(bytes, consumed, [&](wire::Kind kind, wire::In in) {
         if (kind == wire::Kind::Joined) {
             uint32_t id = in.U32();
-            feedOf[in.U32()] = id;
+            joined[in.U32()].push_back(id);
             return;
         }
         if (kind != wire::Kind::Data && kind != wire::Kind::FeedData)
@@ -88,18 +89,47 @@ std::map<uint32_t, double> NewestById(std::string bytes)
         in.U32();
         CadroValue value;
         in.Value(value);
+        Taken taken = take(value);
+        ClearCadroValue(value);
         in.U32();
         in.U32();
         in.U32();
         while (in.Ok() && !in.AtEnd()) {
             uint32_t id = in.U32();
-            (kind == wire::Kind::Data ? byId : byFeed)[id] = value.number;
+            if (kind == wire::Kind::Data)
+                byId[id] = taken;
+            else
+                for (uint32_t member : joined[id])
+                    byId[member] = taken;
         }
     });
-    for (auto [feed, number] : byFeed)
-        if (feedOf.count(feed))
-            byId[feedOf[feed]] = number;
     return byId;
+}
+
+std::map<uint32_t, double> NewestById(std::string bytes)
+{
+    return NewestById(std::move(bytes), [](const CadroValue &value) { return value.number; });
+}
+
+std::map<uint32_t, std::wstring> NewestTextById(std::string bytes)
+{
+    return NewestById(std::move(bytes), [](const CadroValue &value) {
+        std::wstring text = L"(not a text)";
+        if (value.type & kCadroTextBit)
+            TextOf(value, text);
+        return text;
+    });
+}
+
+void SendSubscribe(HeldChannel &channel, uint32_t id, const std::wstring &url)
+{
+    wire::Out out;
+    out.Begin(wire::Kind::Subscribe);
+    out.U32(0);
+    out.U32(id);
+    out.Text(url);
+    out.End();
+    channel.Send(out.View());
 }
 
 double ShownValue(Engine &engine, const std::wstring &url)
@@ -129,15 +159,8 @@ TEST(SlowReader, ALibraryThatStopsReadingGetsEachMembersNewestValueAndCostsTheNo
     HANDLE ended = CreateEventW(nullptr, TRUE, FALSE, nullptr);
     NodeSession *session = NodeSession::Start(engine, channel, false, ended);
     ASSERT_TRUE(session);
-    wire::Out subscribe;
-    for (uint32_t i = 0; i < count; ++i) {
-        subscribe.Begin(wire::Kind::Subscribe);
-        subscribe.U32(0);
-        subscribe.U32(i + 1);
-        subscribe.Text(url(i));
-        subscribe.End();
-    }
-    channel->Send(subscribe.View());
+    for (uint32_t i = 0; i < count; ++i)
+        SendSubscribe(*channel, i + 1, url(i));
 
     // Some 16 MB of values a second: queued whole, they would pass the
     // limit within two seconds; held, the queue stays at it.
@@ -160,6 +183,71 @@ TEST(SlowReader, ALibraryThatStopsReadingGetsEachMembersNewestValueAndCostsTheNo
             behind += !newest.count(i + 1) || newest[i + 1] != atRelease[i];
     }
     EXPECT_EQ(behind, 0u) << "members whose value at the release never arrived";
+
+    channel->Close();
+    EXPECT_EQ(WaitForSingleObject(ended, 10000), WAIT_OBJECT_0);
+    session->Join();
+    session->Release();
+    CloseHandle(ended);
+    engine.ReleaseUse();
+}
+
+// A feed keeps a short value in place and a text that does not fit beside
+// the session's table: a newcomer to the feed is told whichever it holds
+// last, a text that became short again is never taken for the long one it
+// replaced, and a feed made again in a freed place starts with nothing of
+// the last one's.
+TEST(NodeSessionFeeds, ANewcomerIsToldTheFeedsLastValueWhateverItsLength)
+{
+    Engine &engine = Engine::Instance();
+    engine.AddUse();
+    std::wstring error;
+    ASSERT_TRUE(engine.Load(L"machine $HOST\nprocess p\nobject t\nmember words type=wtext access=rw value=\"first\"\n"
+                            L"member other type=number access=rw value=1\n",
+                            error))
+        << error;
+    const std::wstring url = L"\\\\.\\p\\t.words";
+    auto channel = std::make_shared<HeldChannel>();
+    HANDLE ended = CreateEventW(nullptr, TRUE, FALSE, nullptr);
+    NodeSession *session = NodeSession::Start(engine, channel, false, ended);
+    ASSERT_TRUE(session);
+    auto waitFor = [&](uint32_t id, const std::wstring &text) {
+        for (int waited = 0; waited < 200; ++waited, Sleep(25)) {
+            auto newest = NewestTextById(channel->Written());
+            if (newest.count(id) && newest[id] == text)
+                return true;
+        }
+        return false;
+    };
+    const std::wstring longText = L"a text far longer than what a feed keeps in place";
+    SendSubscribe(*channel, 1, url);
+    ASSERT_TRUE(waitFor(1, L"first"));
+    ASSERT_EQ(engine.Execute(L"publish " + url + L" \"" + longText + L"\""), L"ok\n");
+    ASSERT_TRUE(waitFor(1, longText));
+    SendSubscribe(*channel, 2, url);
+    EXPECT_TRUE(waitFor(2, longText)) << "the long text, from the session's table";
+    ASSERT_EQ(engine.Execute(L"publish " + url + L" ab"), L"ok\n");
+    ASSERT_TRUE(waitFor(1, L"ab"));
+    SendSubscribe(*channel, 3, url);
+    EXPECT_TRUE(waitFor(3, L"ab")) << "the short text, in place";
+
+    // Every member leaves: the feed's place is freed, and another URL's feed
+    // takes it.
+    wire::Out leave;
+    for (uint32_t id = 1; id <= 3; ++id) {
+        leave.Begin(wire::Kind::Unsubscribe);
+        leave.U32(id);
+        leave.End();
+    }
+    channel->Send(leave.View());
+    ASSERT_EQ(engine.Execute(L"publish " + url + L" \"" + longText + L"\""), L"ok\n");
+    SendSubscribe(*channel, 4, L"\\\\.\\p\\t.other");
+    SendSubscribe(*channel, 5, L"\\\\.\\p\\t.other");
+    Sleep(500);
+    auto numbers = NewestById(channel->Written());
+    EXPECT_EQ(numbers.count(4) ? numbers[4] : -1, 1.0);
+    EXPECT_EQ(numbers.count(5) ? numbers[5] : -1, 1.0);
+    EXPECT_EQ(NewestTextById(channel->Written())[5], L"(not a text)") << "from the feed that held the place before";
 
     channel->Close();
     EXPECT_EQ(WaitForSingleObject(ended, 10000), WAIT_OBJECT_0);

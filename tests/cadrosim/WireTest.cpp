@@ -187,6 +187,48 @@ TEST(Wire, FlatMapAgreesWithAReferenceMapThroughGrowthAndErasure)
     EXPECT_FALSE(map.Erase(1));
 }
 
+// The node's index of shared feeds, whose keys live in the feeds: against a
+// reference map through growth and erasures in the middle of runs, a key
+// that another handle has keeps the first one, and an erasure by a handle
+// that is not the indexed one changes nothing.
+TEST(Wire, FlatIndexFindsEachHandleByTheKeyItsObjectHolds)
+{
+    std::vector<uint64_t> keys(4001); // by handle; handle 0 is never used
+    FlatIndex index([&](uint32_t handle) { return keys.at(handle); });
+    std::unordered_map<uint64_t, uint32_t> reference;
+    std::mt19937 random(11);
+    for (int step = 0; step < 200000; ++step) {
+        uint32_t handle = 1 + random() % 4000u;
+        // Few distinct keys at first (crowded runs), more later (growth).
+        uint64_t key = (random() % (step < 50000 ? 48u : 6000u)) * 0x100000001ull;
+        auto indexed = reference.find(keys[handle]);
+        bool isIndexed = indexed != reference.end() && indexed->second == handle;
+        if (isIndexed) {
+            index.Erase(handle, keys[handle]);
+            reference.erase(indexed);
+        } else {
+            // A handle that is not indexed may change its key; one that is
+            // may not.
+            keys[handle] = key;
+            bool taken = reference.count(key) && reference[key] != handle;
+            ASSERT_EQ(index.Insert(handle, key), !taken) << "step " << step;
+            if (!taken)
+                reference[key] = handle;
+            // Erasing by a handle that is not the indexed one: nothing.
+            uint32_t other = handle % 4000u + 1;
+            if (reference[key] != other)
+                index.Erase(other, key);
+        }
+        uint64_t probe = (random() % 6000u) * 0x100000001ull;
+        auto it = reference.find(probe);
+        ASSERT_EQ(index.Find(probe), it == reference.end() ? 0u : it->second) << "step " << step;
+        ASSERT_EQ(index.Size(), reference.size());
+    }
+    index.Clear();
+    EXPECT_EQ(index.Size(), 0u);
+    EXPECT_EQ(index.Find(reference.begin()->first), 0u);
+}
+
 // The node keeps two hashes of a URL instead of the URL: they differ in
 // what they take apart.
 TEST(Wire, TheUrlsSecondHashIsNotTheFirst)
