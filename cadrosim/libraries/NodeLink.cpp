@@ -270,8 +270,7 @@ void NodeLink::Disconnected()
         m_queue.Detach();
         if (m_state == State::Connected)
             m_state = State::Down;
-        m_knownUrls.Clear();
-        ForgetCatalogue();
+        m_known.Forget();
         for (auto &entry : m_pending)
             entry.second->done = true; // unanswered
         m_pending.clear();

@@ -10,7 +10,7 @@
 // way, through a link to that node's TCP address (never started from here).
 #include "Backend.h"
 #include "FrameQueue.h"
-#include "HashSet64.h"
+#include "KnownMembers.h"
 #include "MemberMirror.h"
 #include "Network.h"
 #include "Unknown.h"
@@ -225,8 +225,6 @@ private:
     // or a new connection, in one request that the others wait for. False
     // when it could not be had (the node's answer then decides).
     bool Catalogued(const wchar_t *url);
-    // Under m_lock: the catalogue is out of date.
-    void ForgetCatalogue();
     // Whether the node is connected, waiting for one being connected to (a
     // node being started) unless it is another machine's and no answer is
     // needed (forAnswer).
@@ -264,26 +262,23 @@ private:
     std::vector<LinkFeed *> m_feeds; // by the node's slot of the feed
     uint32_t m_nextRequest = 0;
     std::unordered_map<uint32_t, Pending *> m_pending;
-    // Member URLs that the node's listings confirmed, hashed: subscribing to
-    // one does not wait for the node's answer. Forgotten when the topology
-    // changes or the link breaks.
-    HashSet64 m_knownUrls;
-    enum class CatalogueState { Stale, Fetching, Current, Refused };
-    CatalogueState m_catalogueState = CatalogueState::Stale;
-    unsigned m_catalogueEpoch = 0;     // moved on by each ForgetCatalogue
-    std::vector<uint64_t> m_catalogue; // sorted wire::CatalogueHash values
-    struct DataFields {
-        uint32_t flags;
-        CadroValue value;
-        int32_t error;
-        uint32_t low, high;
+    KnownMembers m_known; // under m_lock
+    // The lists of the batch of values being delivered, the link thread's
+    // alone, kept from one batch to the next (no allocation per batch).
+    struct Batch {
+        struct Fields {
+            uint32_t flags;
+            CadroValue value;
+            int32_t error;
+            uint32_t low, high;
+        };
+        std::vector<Fields> fields;
+        // id (or feed, with kFeedBit on the index), index of its fields
+        std::vector<std::pair<uint32_t, uint32_t>> ids;
+        std::vector<std::pair<RemoteSubscription *, uint32_t>> subs;
+        std::vector<RemoteSubscription *> feedCall; // CallFeed's
     };
-    // The batch of values being delivered; the link's thread's alone.
-    std::vector<DataFields> m_batchFields;
-    // id (or feed, with kFeedBit on the index), index of its fields
-    std::vector<std::pair<uint32_t, uint32_t>> m_batchIds;
-    std::vector<std::pair<RemoteSubscription *, uint32_t>> m_batchSubs;
-    std::vector<RemoteSubscription *> m_feedCall; // CallFeed's, the link thread's
+    Batch m_batch;
     std::vector<ICadroBrowserReceiver *> m_browserReceivers;
     HANDLE m_wake = nullptr; // cuts the pause between reconnections short
     DWORD m_linkThreadId = 0;

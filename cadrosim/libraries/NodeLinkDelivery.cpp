@@ -10,67 +10,67 @@ using namespace link; // the link's own limits and waits
 
 void NodeLink::TakeData(wire::In &in, bool feeds)
 {
-    DataFields f;
+    Batch::Fields f;
     f.flags = in.U32();
     in.Value(f.value);
     f.error = static_cast<int32_t>(in.U32());
     f.low = in.U32();
     f.high = in.U32();
-    auto index = static_cast<uint32_t>(m_batchFields.size());
-    m_batchFields.push_back(f);
+    auto index = static_cast<uint32_t>(m_batch.fields.size());
+    m_batch.fields.push_back(f);
     uint32_t tagged = index | (feeds ? kFeedBit : 0);
     while (in.Ok() && !in.AtEnd()) {
         uint32_t id = in.U32();
         if (in.Ok())
-            m_batchIds.emplace_back(id, tagged);
+            m_batch.ids.emplace_back(id, tagged);
     }
 }
 
 void NodeLink::PrefetchFeed(size_t i) const
 {
     // The feed's place in the table a few entries before the feed itself.
-    auto slotOf = [&](size_t at) { return wire::FeedSlot(m_batchIds[at].first); };
-    if (i + kPrefetchAhead < m_batchIds.size() && (m_batchIds[i + kPrefetchAhead].second & kFeedBit) &&
+    auto slotOf = [&](size_t at) { return wire::FeedSlot(m_batch.ids[at].first); };
+    if (i + kPrefetchAhead < m_batch.ids.size() && (m_batch.ids[i + kPrefetchAhead].second & kFeedBit) &&
         slotOf(i + kPrefetchAhead) < m_feeds.size())
         __builtin_prefetch(&m_feeds[slotOf(i + kPrefetchAhead)]);
-    if (i < m_batchIds.size() && (m_batchIds[i].second & kFeedBit) && slotOf(i) < m_feeds.size())
+    if (i < m_batch.ids.size() && (m_batch.ids[i].second & kFeedBit) && slotOf(i) < m_feeds.size())
         PrefetchObject(m_feeds[slotOf(i)]);
 }
 
 void NodeLink::DeliverData()
 {
-    if (m_batchFields.empty())
+    if (m_batch.fields.empty())
         return;
     {
         std::lock_guard<SlimMutex> l(m_lock);
         m_delivering = true;
-        for (size_t i = 0; i < m_batchIds.size(); ++i) {
+        for (size_t i = 0; i < m_batch.ids.size(); ++i) {
             PrefetchFeed(i + kPrefetchAhead);
-            auto [id, tagged] = m_batchIds[i];
+            auto [id, tagged] = m_batch.ids[i];
             uint32_t index = tagged & ~kFeedBit;
-            const DataFields &f = m_batchFields[index];
+            const Batch::Fields &f = m_batch.fields[index];
             if (tagged & kFeedBit) {
                 // A feed's value: remembered once, for all its members.
                 if (LinkFeed *feed = FeedOf(id)) {
                     feed->mirror.Remember(f.flags, f.value, f.error, f.low, f.high);
-                    feed->ForEachMember([&](RemoteSubscription *sub) { m_batchSubs.emplace_back(sub, index); });
+                    feed->ForEachMember([&](RemoteSubscription *sub) { m_batch.subs.emplace_back(sub, index); });
                 }
             } else if (RemoteSubscription *sub = Lookup(id)) {
                 sub->feed->mirror.Remember(f.flags, f.value, f.error, f.low, f.high);
-                m_batchSubs.emplace_back(sub, index);
+                m_batch.subs.emplace_back(sub, index);
             }
         }
     }
     // No pins: a subscription let go during the batch is deleted after it
     // (Forget), and the one being called is published first, so that its
     // holder either is seen here or sees the call and waits for it.
-    for (size_t i = 0; i < m_batchSubs.size(); ++i) {
-        if (i + kPrefetchAhead < m_batchSubs.size())
-            PrefetchObject(m_batchSubs[i + kPrefetchAhead].first);
-        auto [sub, index] = m_batchSubs[i];
+    for (size_t i = 0; i < m_batch.subs.size(); ++i) {
+        if (i + kPrefetchAhead < m_batch.subs.size())
+            PrefetchObject(m_batch.subs[i + kPrefetchAhead].first);
+        auto [sub, index] = m_batch.subs[i];
         m_callingSub.store(sub);
         if (!sub->IsForgotten()) {
-            const DataFields &f = m_batchFields[index];
+            const Batch::Fields &f = m_batch.fields[index];
             sub->receiver->OnData(sub->cookie, f.flags, &f.value, f.error, f.low, f.high);
         }
         if (m_callWaiters.load() != 0)
@@ -85,11 +85,11 @@ void NodeLink::DeliverData()
     }
     for (RemoteSubscription *sub : graveyard)
         sub->Unpin();
-    for (DataFields &f : m_batchFields)
+    for (Batch::Fields &f : m_batch.fields)
         ClearCadroValue(f.value);
-    m_batchFields.clear();
-    m_batchIds.clear();
-    m_batchSubs.clear();
+    m_batch.fields.clear();
+    m_batch.ids.clear();
+    m_batch.subs.clear();
 }
 
 void NodeLink::WakeWaiters(RemoteSubscription *calling)
@@ -187,8 +187,7 @@ void NodeLink::TopologyChanged()
     std::vector<ICadroBrowserReceiver *> receivers;
     {
         std::lock_guard<SlimMutex> l(m_lock);
-        m_knownUrls.Clear();
-        ForgetCatalogue();
+        m_known.Forget();
         receivers = m_browserReceivers;
         for (auto *r : receivers)
             r->AddRef();

@@ -17,7 +17,6 @@ inline constexpr DWORD kReplyWaitMs = 60000;
 inline constexpr DWORD kReconnectPauseMs = 500;
 inline constexpr DWORD kRestartMs = 2000;
 inline constexpr DWORD kTcpConnectMs = 3000;
-inline constexpr size_t kMostKnownUrls = 4u << 20;
 inline constexpr uint32_t kFeedBit = 1u << 31; // on a batch entry's index: a feed's
 } // namespace link
 
@@ -79,7 +78,7 @@ template <class Call, class Note> void NodeLink::CallFeed(uint32_t feedId, Call 
     // The link thread's own list, kept between calls: a new subscription's
     // feed brings five of them, and allocations from two threads meet in
     // the process heap's lock.
-    std::vector<RemoteSubscription *> &members = m_feedCall;
+    std::vector<RemoteSubscription *> &members = m_batch.feedCall;
     members.clear();
     {
         std::lock_guard<SlimMutex> l(m_lock);

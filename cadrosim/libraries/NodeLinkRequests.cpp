@@ -10,31 +10,23 @@
 namespace cadrosim {
 using namespace link; // the link's own limits and waits
 
-void NodeLink::ForgetCatalogue()
-{
-    std::vector<uint64_t>().swap(m_catalogue);
-    m_catalogueState = CatalogueState::Stale;
-    ++m_catalogueEpoch;
-}
-
 bool NodeLink::Catalogued(const wchar_t *url)
 {
     const uint64_t hash = wire::CatalogueHash(url);
     std::unique_lock<SlimMutex> l(m_lock);
     for (;;) {
-        switch (m_catalogueState) {
-        case CatalogueState::Current:
-            return std::binary_search(m_catalogue.begin(), m_catalogue.end(), hash);
-        case CatalogueState::Refused:
+        switch (m_known.State()) {
+        case KnownMembers::Catalogue::Current:
+            return m_known.InCatalogue(hash);
+        case KnownMembers::Catalogue::Refused:
             return false;
-        case CatalogueState::Fetching:
+        case KnownMembers::Catalogue::Fetching:
             m_changed.wait(l); // the fetch always ends: Ask has a deadline
             continue;
-        case CatalogueState::Stale:
+        case KnownMembers::Catalogue::Stale:
             break;
         }
-        m_catalogueState = CatalogueState::Fetching;
-        const unsigned epoch = m_catalogueEpoch;
+        const unsigned ticket = m_known.BeginFetch();
         l.unlock();
         std::string reply;
         bool answered = Ask(
@@ -46,15 +38,11 @@ bool NodeLink::Catalogued(const wchar_t *url)
         if (whole) {
             hashes.resize(count);
             memcpy(hashes.data(), reply.data() + 4, count * sizeof(uint64_t));
-            if (!std::is_sorted(hashes.begin(), hashes.end()))
-                std::sort(hashes.begin(), hashes.end());
         }
         l.lock();
         m_changed.notify_all();
-        if (epoch != m_catalogueEpoch)
+        if (!m_known.Fetched(ticket, whole, std::move(hashes)))
             return false; // out of date on arrival; the next subscriber fetches anew
-        m_catalogueState = whole ? CatalogueState::Current : CatalogueState::Refused;
-        m_catalogue.swap(hashes);
     }
 }
 
@@ -87,7 +75,7 @@ HRESULT NodeLink::Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeRece
             id, [](RemoteSubscription &s) { s.receiver->StatusChange(s.cookie, kCadroStatusConnecting, 0, 0); });
         return S_OK;
     }
-    bool known = OnLinkThread() || m_knownUrls.Contains(wire::UrlHash(url));
+    bool known = OnLinkThread() || m_known.Listed(wire::UrlHash(url));
     if (!known) {
         l.unlock();
         known = Catalogued(url);
@@ -210,10 +198,7 @@ bool NodeLink::Browse(const std::wstring &url, std::vector<BrowseEntry> &out)
         return false;
     }
     std::lock_guard<SlimMutex> l(m_lock);
-    if (m_knownUrls.Size() + known.size() > kMostKnownUrls)
-        m_knownUrls.Clear();
-    for (uint64_t hash : known)
-        m_knownUrls.Insert(hash);
+    m_known.AddListed(known);
     return found;
 }
 
@@ -251,7 +236,7 @@ bool NodeLink::Load(const std::wstring &description, std::wstring &error)
 bool NodeLink::Knows(const std::wstring &url)
 {
     std::lock_guard<SlimMutex> l(m_lock);
-    return m_knownUrls.Contains(wire::UrlHash(url));
+    return m_known.Listed(wire::UrlHash(url));
 }
 
 void NodeLink::AddBrowserReceiver(ICadroBrowserReceiver *receiver)

@@ -4,6 +4,7 @@
 #include "Wire.h"
 #include "FlatMap.h"
 #include "HashSet64.h"
+#include "KnownMembers.h"
 #include "Network.h"
 
 #include <gtest/gtest.h>
@@ -227,6 +228,30 @@ TEST(Wire, FlatIndexFindsEachHandleByTheKeyItsObjectHolds)
     index.Clear();
     EXPECT_EQ(index.Size(), 0u);
     EXPECT_EQ(index.Find(reference.begin()->first), 0u);
+}
+
+// A catalogue that arrives after the network changed is out of date: it is
+// refused and the next subscriber fetches anew; the change also forgets what
+// listings confirmed.
+TEST(Wire, ACatalogueFetchedAcrossAChangeIsRefused)
+{
+    KnownMembers known;
+    known.AddListed({11, 12});
+    unsigned ticket = known.BeginFetch();
+    EXPECT_EQ(known.State(), KnownMembers::Catalogue::Fetching);
+    known.Forget();
+    EXPECT_FALSE(known.Fetched(ticket, true, {3, 1, 2}));
+    EXPECT_EQ(known.State(), KnownMembers::Catalogue::Stale);
+    EXPECT_FALSE(known.Listed(11));
+
+    ticket = known.BeginFetch();
+    EXPECT_TRUE(known.Fetched(ticket, true, {3, 1, 2})); // unsorted as it came
+    EXPECT_EQ(known.State(), KnownMembers::Catalogue::Current);
+    EXPECT_TRUE(known.InCatalogue(1) && known.InCatalogue(2) && known.InCatalogue(3));
+    EXPECT_FALSE(known.InCatalogue(4));
+    ticket = known.BeginFetch();
+    EXPECT_TRUE(known.Fetched(ticket, false, {}));
+    EXPECT_EQ(known.State(), KnownMembers::Catalogue::Refused);
 }
 
 // The node keeps two hashes of a URL instead of the URL: they differ in
