@@ -203,10 +203,11 @@ CAddrSpace::CAddrSpace() : m_root(std::make_shared<CAddrNode>())
     m_root->m_branch = std::make_unique<CAddrNode::Branch>();
 }
 
-void CAddrSpace::SetBrowserSource(BrowserSource source)
+void CAddrSpace::SetBrowserSource(BrowserSource source, BrowserSource parallel)
 {
     CSingleLock lock(&m_lock);
     m_browserSource = std::move(source);
+    m_parallelSource = std::move(parallel);
 }
 
 void CAddrSpace::AddRoot(const std::wstring &name, const std::wstring &url)
@@ -315,7 +316,12 @@ HRESULT CAddrSpace::ReadChildren(const AddrNodePtr &node)
         return OPC_E_UNKNOWNITEMID;
     if (FAILED(browser.open(m_url.c_str())))
         return OPC_E_UNKNOWNITEMID;
+    MergeRecords(node, [&](BrowseRecord *record) { return browser.next(record); });
+    return S_OK;
+}
 
+void CAddrSpace::MergeRecords(const AddrNodePtr &node, const std::function<HRESULT(BrowseRecord *record)> &next)
+{
     // Each record is looked up among the present children by its part
     // without regard to case and marks the child it finds: a name the tree
     // has keeps its node (and subtree); only names it lacks make new nodes,
@@ -326,7 +332,7 @@ HRESULT CAddrSpace::ReadChildren(const AddrNodePtr &node)
     size_t seen = 0;
     std::vector<AddrNodePtr> fresh;
     BrowseRecord record = {};
-    while (SUCCEEDED(browser.next(&record))) {
+    while (SUCCEEDED(next(&record))) {
         if (const AddrNodePtr *known = FindPart(*node, IdPartOf(record))) {
             if ((*known)->m_seenMark != mark) {
                 // A kept node keeps its texts and subtree, and takes the
@@ -346,7 +352,6 @@ HRESULT CAddrSpace::ReadChildren(const AddrNodePtr &node)
     }
     if (!fresh.empty() || seen != children.size())
         Merge(node, fresh);
-    return S_OK;
 }
 
 void CAddrSpace::Merge(const AddrNodePtr &node, std::vector<AddrNodePtr> &fresh)
@@ -458,6 +463,40 @@ AddrNodePtr CAddrSpace::FindFrom(const AddrNodePtr &node, std::wstring_view text
         if (AddrNodePtr found = FindFrom(*child, rest))
             return found;
     return nullptr;
+}
+
+CAddrSpace::Ahead CAddrSpace::NextRead(const AddrNodePtr &node, std::wstring_view text, uint64_t pass,
+                                       AddrNodePtr &toRead)
+{
+    // FindFrom's walk, stopping where it would read a branch.
+    std::wstring_view rest = text;
+    if (!node->IsRoot() && !node->IdPart().empty()) {
+        std::wstring_view separator = node->Separator(), part = node->IdPart();
+        if (rest.substr(0, separator.size()) != separator || rest.substr(separator.size(), part.size()) != part)
+            return Ahead::Missing;
+        rest.remove_prefix(separator.size() + part.size());
+        if (rest.empty())
+            return Ahead::Found;
+        if (!node->IsBranch())
+            return Ahead::Missing;
+        const CAddrNode::Branch &branch = *node->m_branch;
+        if (branch.refreshPass != pass) {
+            toRead = node;
+            return Ahead::Read;
+        }
+        if (FAILED(branch.refreshResult))
+            return Ahead::Missing;
+    } else if (!node->IsBranch()) {
+        return rest.empty() ? Ahead::Found : Ahead::Missing;
+    }
+    Steps candidates;
+    Candidates(*node, rest, candidates);
+    for (const AddrNodePtr *child : candidates) {
+        Ahead ahead = NextRead(*child, rest, pass, toRead);
+        if (ahead != Ahead::Missing)
+            return ahead;
+    }
+    return Ahead::Missing;
 }
 
 AddrNodePtr CAddrSpace::FindByItemId(std::wstring_view itemId)

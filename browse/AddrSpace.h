@@ -32,6 +32,14 @@ public:
     // The node an item identifier names, descending (and refreshing) from
     // the root; null when none.
     AddrNodePtr FindByItemId(std::wstring_view itemId);
+    // Reads ahead the branches that lookups of these identifiers will read
+    // in this call's pass, several at once: level by level, each round reads
+    // together every branch that some lookup would read next, so that a call
+    // naming items of a hundred objects waits for one round trip to the
+    // network rather than a hundred. The lookups then find them read; each
+    // branch is still read once in the pass, and the same ones are read as
+    // the lookups alone would. Nothing without a pass or a parallel source.
+    void ReadAhead(const std::vector<std::wstring_view> &itemIds);
     // The direct child whose display name (or part, without one) equals name
     // exactly; no refresh.
     AddrNodePtr FindChild(const AddrNodePtr &node, const std::wstring &name);
@@ -61,7 +69,9 @@ public:
         }
     };
     using BrowserSource = std::function<bool(Browser &browser)>;
-    void SetBrowserSource(BrowserSource source);
+    // parallel, when given, hands out browsers of sessions of their own,
+    // which threads may use side by side (for ReadAhead).
+    void SetBrowserSource(BrowserSource source, BrowserSource parallel = nullptr);
 
 private:
     CAddrSpace();
@@ -78,12 +88,22 @@ private:
     static void IndexChildren(CAddrNode &node);
     void Candidates(CAddrNode &node, std::wstring_view text, Steps &out);
     HRESULT ReadChildren(const AddrNodePtr &node);
+    // Merges the records that next(record) gives until it fails (each
+    // record's texts freed) into the branch's children.
+    void MergeRecords(const AddrNodePtr &node, const std::function<HRESULT(BrowseRecord *record)> &next);
+    // What a lookup of text from node would do next in pass: find its node,
+    // fail, or read a branch first (Read: that branch, in toRead).
+    enum class Ahead { Found, Missing, Read };
+    Ahead NextRead(const AddrNodePtr &node, std::wstring_view text, uint64_t pass, AddrNodePtr &toRead);
+    // One round of ReadAhead: false when no lookup has a branch left to read.
+    bool ReadAheadRound(const std::vector<std::wstring_view> &itemIds, uint64_t pass);
     void Merge(const AddrNodePtr &node, std::vector<AddrNodePtr> &fresh);
     void AddRoot(const std::wstring &name, const std::wstring &url);
 
     CCriticalSection m_lock;
     AddrNodePtr m_root;
     BrowserSource m_browserSource;
+    BrowserSource m_parallelSource;
     std::wstring m_url;      // a refresh's browse URL, kept for its capacity
     uint64_t m_lastMark = 0; // marks of refreshes on the children they saw
 };

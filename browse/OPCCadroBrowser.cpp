@@ -35,12 +35,23 @@ OPCCadroBrowser *OPCCadroBrowser::AcquireCurrent()
 HRESULT OPCCadroBrowser::Open(const wchar_t *url)
 {
     // No session (the factory failed): nothing can be browsed.
-    if (!m_browser || !url)
+    return OpenOn(m_browser, url);
+}
+
+HRESULT OPCCadroBrowser::OpenOn(CadroBrowser *browser, const wchar_t *url)
+{
+    if (!browser || !url)
         return E_FAIL;
     wchar_t *expanded = ExpandLocalMachine(url, true);
-    HRESULT hr = m_browser->Open(expanded ? expanded : url);
+    HRESULT hr = browser->Open(expanded ? expanded : url);
     cdd_free(expanded);
     return hr;
+}
+
+CadroBrowser *OPCCadroBrowser::NewSession()
+{
+    CadroBrowser *session = nullptr;
+    return m_browser && NewCadroBrowser(0, this, &session) ? session : nullptr;
 }
 
 HRESULT OPCCadroBrowser::Next(uint32_t fieldMask, BrowseRecord *record)

@@ -17,6 +17,12 @@ public:
     // E_FAIL without a browse session.
     HRESULT Open(const wchar_t *url);
     HRESULT Next(uint32_t fieldMask, BrowseRecord *record);
+    // Another browse session of the network, for reads beside this one's (a
+    // lookup reads several branches at once); its notices come here. Null
+    // when none can be had; the caller releases it.
+    CadroBrowser *NewSession();
+    // Open on a session of this process's: "\\." names this machine.
+    static HRESULT OpenOn(CadroBrowser *browser, const wchar_t *url);
 
     // The process's browser receiver while the services run; the caller
     // releases the reference it gets.

@@ -74,8 +74,10 @@ STDMETHODIMP COPCGroup::AddItems(DWORD dwCount, OPCITEMDEF *pItemArray, OPCITEMR
         TaskMem<OPCITEMRESULT> results;
         TaskMem<HRESULT> errors;
         HRESULT hr = BeginItemDefinitions(dwCount, pItemArray, ppAddResults, ppErrors, results, errors);
-        if (SUCCEEDED(hr))
+        if (SUCCEEDED(hr)) {
+            ItemServices::ReadAhead(pItemArray, dwCount);
             hr = AddItemsLocked(dwCount, pItemArray, results.Get(), errors.Get());
+        }
         if (FAILED(hr))
             return hr;
         *ppAddResults = results.Detach();
@@ -132,6 +134,7 @@ STDMETHODIMP COPCGroup::ValidateItems(DWORD dwCount, OPCITEMDEF *pItemArray, BOO
         HRESULT begun = BeginItemDefinitions(dwCount, pItemArray, ppValidationResults, ppErrors, results, errors);
         if (FAILED(begun))
             return begun;
+        ItemServices::ReadAhead(pItemArray, dwCount);
         for (DWORD i = 0; i < dwCount; ++i) {
             const OPCITEMDEF &def = pItemArray[i];
             VARTYPE canonical = VT_R8;

@@ -3,11 +3,13 @@
 #include "SyncObject.h"
 
 #include <atomic>
+#include <new>
 
 namespace {
 CCriticalSection g_clientLock;
 ComPtr<OPCCadroClient> g_client; // guarded by g_clientLock
 std::atomic<ItemServices::NodeLookup> g_lookup{nullptr};
+std::atomic<ItemServices::ReadAheadFunction> g_readAhead{nullptr};
 } // namespace
 
 void ItemServices::SetRealTimeClient(OPCCadroClient *client)
@@ -32,4 +34,26 @@ bool ItemServices::FindNode(std::wstring_view itemId, VARTYPE &type, DWORD &righ
 {
     NodeLookup lookup = g_lookup;
     return lookup && lookup(itemId, type, rights);
+}
+
+void ItemServices::SetReadAhead(ReadAheadFunction readAhead)
+{
+    g_readAhead = readAhead;
+}
+
+void ItemServices::ReadAhead(const OPCITEMDEF *items, DWORD count)
+{
+    ReadAheadFunction readAhead = g_readAhead;
+    if (!readAhead || count < 2)
+        return;
+    std::vector<std::wstring_view> ids;
+    try {
+        ids.reserve(count);
+    } catch (const std::bad_alloc &) {
+        return; // the lookups read as they go
+    }
+    for (DWORD i = 0; i < count; ++i)
+        if (items[i].szItemID && *items[i].szItemID)
+            ids.push_back(items[i].szItemID);
+    readAhead(ids);
 }

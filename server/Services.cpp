@@ -51,6 +51,27 @@ bool CurrentBrowser(CAddrSpace::Browser &browser)
     return true;
 }
 
+// A browse session of its own for each reader of a read-ahead.
+bool SessionBrowser(CAddrSpace::Browser &browser)
+{
+    OPCCadroBrowser *current = OPCCadroBrowser::AcquireCurrent();
+    CadroBrowser *session = current ? current->NewSession() : nullptr;
+    if (current)
+        current->Release();
+    if (!session)
+        return false;
+    browser.release = [session] { session->Release(); };
+    browser.open = [session](const wchar_t *url) { return OPCCadroBrowser::OpenOn(session, url); };
+    browser.next = [session](BrowseRecord *record) { return session->Next(kBrowseFieldMask, record); };
+    return true;
+}
+
+void ReadAhead(const std::vector<std::wstring_view> &itemIds)
+{
+    if (CAddrSpace *space = g_addrSpace.get())
+        space->ReadAhead(itemIds);
+}
+
 // Items take their canonical type and access rights from the tree.
 bool LookupNode(std::wstring_view itemId, VARTYPE &type, DWORD &rights)
 {
@@ -71,9 +92,10 @@ void BuildAddressSpace()
         INTERNAL_ASSERT_FAILED("address space construction");
         return;
     }
-    space->SetBrowserSource(CurrentBrowser);
+    space->SetBrowserSource(CurrentBrowser, SessionBrowser);
     g_addrSpace = std::move(space);
     ItemServices::SetNodeLookup(LookupNode);
+    ItemServices::SetReadAhead(ReadAhead);
 }
 } // namespace
 

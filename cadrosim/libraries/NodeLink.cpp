@@ -272,7 +272,7 @@ void NodeLink::Disconnected()
             m_state = State::Down;
         m_known.Forget();
         for (auto &entry : m_pending)
-            entry.second->done = true; // unanswered
+            entry.second->Finish(); // unanswered
         m_pending.clear();
         DropFeeds(); // the node's feeds are the connection's
         // Told once, however often a connection fails before the node is

@@ -166,10 +166,21 @@ public:
 
 private:
     enum class State { Stopped, Connecting, Connected, Down };
+    // A request waiting for its answer. Its asker alone is woken: a read
+    // ahead has several requests in flight, and a wake of every asker for
+    // each answer costs a round through the system for each.
     struct Pending {
         bool done = false;
         bool answered = false;
         std::string reply;
+        SlimCondition wake;
+        // Under m_lock: the asker may leave (and the Pending go) as soon as
+        // the lock is let go, so the wake is given under it.
+        void Finish()
+        {
+            done = true;
+            wake.notify_all();
+        }
     };
 
     NodeLink(uint8_t index, std::wstring address) : m_index(index), m_address(std::move(address)) {}
@@ -243,7 +254,7 @@ private:
     const uint8_t m_index;
     const std::wstring m_address; // empty: this machine's node, by its pipe
     SlimMutex m_lock;
-    SlimCondition m_changed;      // the state, and replies
+    SlimCondition m_changed;      // the state, and the catalogue
     SlimCondition m_callReturned; // a call to a forgotten subscription returned
     std::atomic<int> m_callWaiters{0};
     std::atomic<RemoteSubscription *> m_callingSub{nullptr}; // by DeliverData

@@ -163,10 +163,9 @@ void NodeLink::Dispatch(wire::Kind kind, wire::In &in)
                 return;
             it->second->reply = in.Rest();
             it->second->answered = true;
-            it->second->done = true;
+            it->second->Finish();
             m_pending.erase(it);
         }
-        m_changed.notify_all();
         return;
     }
     case wire::Kind::Topology:

@@ -45,7 +45,7 @@ template <class Fill> bool NodeLink::Ask(wire::Kind kind, Fill fill, std::string
     l.lock();
     auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(link::kReplyWaitMs);
     while (!pending.done && std::chrono::steady_clock::now() < deadline)
-        m_changed.wait_until(l, deadline);
+        pending.wake.wait_until(l, deadline);
     m_pending.erase(request);
     if (!pending.answered)
         return false;

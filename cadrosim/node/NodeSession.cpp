@@ -75,7 +75,6 @@ void NodeSession::Join()
 template <class Fill> void NodeSession::Reply(Fill fill)
 {
     m_queue.Push(wire::Kind::Reply, fill);
-    m_queue.Flush();
 }
 
 void NodeSession::ReadLoop()
@@ -83,11 +82,15 @@ void NodeSession::ReadLoop()
     std::string buffer;
     size_t consumed = 0;
     bool fine = true;
-    while (fine && m_channel->Read(buffer))
+    while (fine && m_channel->Read(buffer)) {
         fine = wire::TakeFrames(buffer, consumed, [&](wire::Kind kind, wire::In in) {
             if (fine)
                 fine = Handle(kind, in);
         });
+        // The replies to what one read brought go out in one write: a
+        // library that reads ahead asks for many listings at once.
+        m_queue.Flush();
+    }
     m_channel->Close();
     ReleaseAll();
     m_queue.Stop(false);

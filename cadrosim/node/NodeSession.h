@@ -146,7 +146,8 @@ private:
     template <class Push> void PushHeld(Push &push);
     // The writer has caught up: the values held back go out.
     void SendHeld();
-    // A reply: written by the reading thread itself, at once.
+    // A reply: written by the reading thread itself, once it has handled
+    // everything that one read brought.
     template <class Fill> void Reply(Fill fill);
     void ReleaseAll();
 

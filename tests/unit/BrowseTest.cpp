@@ -8,9 +8,14 @@
 #include "OpcErrors.h"
 #include "PatternMatch.h"
 
+#include <algorithm>
 #include <chrono>
+#include <condition_variable>
 #include <map>
 #include <memory>
+#include <mutex>
+#include <set>
+#include <utility>
 
 namespace {
 BrowseRecord Record(const wchar_t *name, wchar_t kind, bool leaf, uint16_t type = 0, uint16_t access = 3)
@@ -482,4 +487,134 @@ TEST(AddressSpace, IndexedLookupsFindWhatTheWalkOverEverySiblingFinds)
     EXPECT_EQ(implicit->DisplayName(), L"Sub");
     EXPECT_FALSE(space->FindByItemId(L"\\\\x\\PROC1\\Obj.cos"));
     EXPECT_TRUE(space->FindByItemId(L"\\\\x\\proc10\\Obj.v"));
+}
+
+namespace {
+// A network whose browsers each keep their own place, so that threads may
+// read side by side. The read of one URL waits (a few seconds at most) until
+// another one is under way: reads that never overlap show as one at a time.
+struct SharedNetwork {
+    std::map<std::wstring, std::vector<std::tuple<std::wstring, wchar_t, bool>>> listings;
+    std::map<std::wstring, uint16_t> access; // by name; rw when absent
+    std::mutex lock;
+    std::condition_variable changed;
+    std::vector<std::wstring> opened;
+    int reading = 0, mostReading = 0;
+    std::wstring waitForCompany; // the URL whose read waits, once
+
+    CAddrSpace::BrowserSource Source()
+    {
+        return [this](CAddrSpace::Browser &b) {
+            auto cursor = std::make_shared<std::pair<std::vector<std::tuple<std::wstring, wchar_t, bool>>, size_t>>();
+            b.open = [this, cursor](const wchar_t *url) { return Open(url, *cursor); };
+            b.next = [this, cursor](BrowseRecord *r) {
+                auto &[records, next] = *cursor;
+                if (next >= records.size())
+                    return E_FAIL;
+                auto &[name, kind, leaf] = records[next++];
+                auto rights = access.find(name);
+                *r = Record(name.c_str(), kind, leaf, kCadroNumber, rights == access.end() ? 3 : rights->second);
+                return S_OK;
+            };
+            return true;
+        };
+    }
+    HRESULT Open(const wchar_t *url, std::pair<std::vector<std::tuple<std::wstring, wchar_t, bool>>, size_t> &cursor)
+    {
+        std::unique_lock<std::mutex> l(lock);
+        opened.push_back(url);
+        mostReading = std::max(mostReading, ++reading);
+        changed.notify_all();
+        if (url == waitForCompany && !std::exchange(waitForCompany, L"").empty()) {
+            size_t before = opened.size();
+            changed.wait_for(l, std::chrono::seconds(10), [&] { return opened.size() > before; });
+        }
+        --reading;
+        auto it = listings.find(url);
+        if (it == listings.end())
+            return E_FAIL;
+        cursor = {it->second, 0};
+        return S_OK;
+    }
+};
+
+struct Looked {
+    bool found;
+    VARTYPE type;
+    DWORD rights;
+    bool operator==(const Looked &o) const { return found == o.found && type == o.type && rights == o.rights; }
+};
+
+// One call's lookups of ids, read ahead first or not; what they found, and
+// the URLs the call read.
+std::vector<Looked> LookUp(CAddrSpace &space, SharedNetwork &net, const std::vector<std::wstring> &ids, bool ahead,
+                           std::multiset<std::wstring> &read)
+{
+    net.opened.clear();
+    CCallPass pass;
+    if (ahead)
+        space.ReadAhead(std::vector<std::wstring_view>(ids.begin(), ids.end()));
+    std::vector<Looked> found;
+    for (const std::wstring &id : ids) {
+        AddrNodePtr node = space.FindByItemId(id);
+        Looked looked = {node != nullptr, VT_EMPTY, 0};
+        if (node)
+            looked.type = node->DataType(), looked.rights = node->AccessRights();
+        found.push_back(looked);
+    }
+    read = std::multiset<std::wstring>(net.opened.begin(), net.opened.end());
+    return found;
+}
+} // namespace
+
+// Items of many objects in one call: the branches their lookups need are
+// read several at once, level by level, and the lookups then find exactly
+// what they find without reading ahead, having read the same branches, each
+// once; the next call reads them again and sees the network's changes.
+TEST(AddressSpace, ReadingAheadReadsTheSameBranchesOnceEachAndSeveralAtOnce)
+{
+    SharedNetwork net;
+    net.listings[L"\\\\x"] = {{L"proc", L'\\', false}};
+    std::vector<std::wstring> ids;
+    for (int o = 0; o < 20; ++o) {
+        std::wstring object = L"o" + std::to_wstring(o);
+        net.listings[L"\\\\x\\proc"].push_back({object, L'\\', false});
+        for (int m = 0; m < 5; ++m) {
+            std::wstring member = L"m" + std::to_wstring(m);
+            net.listings[L"\\\\x\\proc\\" + object].push_back({member, L'.', true});
+            ids.push_back(L"\\\\x\\proc\\" + object + L"." + member);
+        }
+    }
+    net.access[L"m3"] = 1;
+    ids.push_back(L"\\\\x\\proc\\gone.m0");   // an object the network lacks
+    ids.push_back(L"\\\\x\\proc\\o1.absent"); // a member it lacks
+    ids.push_back(L"\\\\y\\elsewhere.m0");    // a machine below "Network" only
+    ids.push_back(L"\\\\x\\proc\\o2.m0");     // again, apart from its siblings
+
+    std::unique_ptr<CAddrSpace> plain(CAddrSpace::Create()), ahead(CAddrSpace::Create());
+    for (CAddrSpace *space : {plain.get(), ahead.get()}) {
+        space->AddRoots("A=\\\\x,Network=\\\\");
+        space->SetBrowserSource(net.Source(), net.Source());
+    }
+    for (int call = 0; call < 2; ++call) {
+        std::multiset<std::wstring> readPlain, readAhead;
+        std::vector<Looked> expected = LookUp(*plain, net, ids, false, readPlain);
+        net.waitForCompany = L"\\\\x\\proc\\o7";
+        net.mostReading = 0;
+        std::vector<Looked> found = LookUp(*ahead, net, ids, true, readAhead);
+        EXPECT_TRUE(found == expected) << "call " << call;
+        EXPECT_EQ(readAhead, readPlain) << "call " << call;
+        for (const std::wstring &url : readAhead)
+            EXPECT_EQ(readAhead.count(url), 1u) << url;
+        EXPECT_GE(net.mostReading, 2) << "the objects were read one at a time";
+        EXPECT_TRUE(found[3].found);
+        EXPECT_EQ(found[3].rights, call == 0 ? static_cast<DWORD>(OPC_READABLE) : OPC_READABLE | OPC_WRITEABLE);
+        EXPECT_EQ(found[0].found, call == 0);
+        EXPECT_FALSE(found[100].found);
+        EXPECT_FALSE(found[101].found);
+
+        // Between calls a member goes and another becomes writable.
+        net.listings[L"\\\\x\\proc\\o0"].erase(net.listings[L"\\\\x\\proc\\o0"].begin());
+        net.access[L"m3"] = 3;
+    }
 }

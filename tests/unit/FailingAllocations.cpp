@@ -5,11 +5,13 @@
 
 namespace {
 thread_local long t_successesLeft = -1;
+thread_local bool t_fired = false;
 } // namespace
 
 void FailingAllocations::Arm(long successes)
 {
     t_successesLeft = successes;
+    t_fired = false;
 }
 
 void FailingAllocations::Disarm()
@@ -17,10 +19,17 @@ void FailingAllocations::Disarm()
     t_successesLeft = -1;
 }
 
+bool FailingAllocations::Fired()
+{
+    return t_fired;
+}
+
 void *operator new(std::size_t size)
 {
-    if (t_successesLeft >= 0 && t_successesLeft-- == 0)
+    if (t_successesLeft >= 0 && t_successesLeft-- == 0) {
+        t_fired = true;
         throw std::bad_alloc();
+    }
     if (void *p = std::malloc(size ? size : 1))
         return p;
     throw std::bad_alloc();

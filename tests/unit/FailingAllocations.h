@@ -6,4 +6,7 @@ namespace FailingAllocations {
 // Fails the allocation after `successes` more have succeeded; -1 disarms.
 void Arm(long successes);
 void Disarm();
+// Whether the allocation armed for failed (a call that never reached it
+// made fewer allocations).
+bool Fired();
 } // namespace FailingAllocations
