@@ -6,6 +6,7 @@
 #include <cstring>
 #include <new>
 #include <shared_mutex>
+#include <utility>
 #include <vector>
 
 namespace cadrosim {
@@ -75,6 +76,7 @@ void NodeSession::Join()
 template <class Fill> void NodeSession::Reply(Fill fill)
 {
     m_queue.Push(wire::Kind::Reply, fill);
+    m_replied = true;
 }
 
 void NodeSession::ReadLoop()
@@ -88,8 +90,10 @@ void NodeSession::ReadLoop()
                 fine = Handle(kind, in);
         });
         // The replies to what one read brought go out in one write: a
-        // library that reads ahead asks for many listings at once.
-        m_queue.Flush();
+        // library that reads ahead asks for many listings at once. Without
+        // a reply the writing thread writes: this one goes on reading.
+        if (std::exchange(m_replied, false))
+            m_queue.Flush();
     }
     m_channel->Close();
     ReleaseAll();

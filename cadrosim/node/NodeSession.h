@@ -174,6 +174,7 @@ private:
     // By the library's id (one id, kNoMember, cannot be subscribed).
     FlatMap<uint32_t, Membership, kNoMember> m_memberships;
     FrameQueue m_queue;
+    bool m_replied = false; // the reading thread's: a reply waits to be written
     std::thread m_reader;
 };
 

@@ -70,6 +70,19 @@ void FrameQueue::Flush()
         return;
     m_writing = true;
     Drain(l);
+    DrainedWith(l);
+}
+
+void FrameQueue::DrainedWith(std::unique_lock<SlimMutex> &l)
+{
+    // Whichever thread wrote the last of the queue tells the handler: what
+    // waits for the queue to be written (values held back) would otherwise
+    // wait for the next frame.
+    if (m_drained && m_out.Empty() && !m_stopping) {
+        l.unlock();
+        m_drained();
+        l.lock();
+    }
 }
 
 void FrameQueue::Drain(std::unique_lock<SlimMutex> &l)
@@ -115,11 +128,7 @@ void FrameQueue::WriteLoop()
         }
         m_writing = true;
         Drain(l);
-        if (m_drained && m_out.Empty() && !m_stopping) {
-            l.unlock();
-            m_drained();
-            l.lock();
-        }
+        DrainedWith(l);
     }
 }
 

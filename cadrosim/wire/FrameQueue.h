@@ -74,6 +74,9 @@ private:
     bool Queued(bool wake);
     // Under the lock: PushId's frame or id.
     void Add(wire::Kind kind, std::string_view fields, uint32_t id);
+    // After a drain, under l (let go for the call): the drained handler,
+    // when the queue is empty.
+    void DrainedWith(std::unique_lock<SlimMutex> &l);
     void WriteLoop();
     // Under l: writes batches until the queue is empty; m_writing is ours.
     void Drain(std::unique_lock<SlimMutex> &l);

@@ -138,27 +138,51 @@ double ShownValue(Engine &engine, const std::wstring &url)
     size_t at = shown.find(L"\nvalue ");
     return at == std::wstring::npos ? -1 : _wtof(shown.c_str() + at + 7);
 }
+
+// A node's session on an engine of the test's own, as a node has it (the
+// libraries' engine in the DLL is another), serving a library whose end of
+// the pipe the test holds.
+class NodeSessionTest : public ::testing::Test {
+protected:
+    void SetUp() override { engine.AddUse(); }
+    // Loads the network and starts the session (held: the library reads
+    // nothing until told).
+    void Start(const std::wstring &network, bool held)
+    {
+        std::wstring error;
+        ASSERT_TRUE(engine.Load(network, error)) << error;
+        channel->Hold(held);
+        session = NodeSession::Start(engine, channel, false, ended);
+        ASSERT_TRUE(session);
+    }
+    void TearDown() override
+    {
+        channel->Close();
+        if (session) {
+            EXPECT_EQ(WaitForSingleObject(ended, 10000), WAIT_OBJECT_0);
+            session->Join();
+            session->Release();
+        }
+        CloseHandle(ended);
+        engine.ReleaseUse();
+    }
+
+    Engine &engine = Engine::Instance();
+    std::shared_ptr<HeldChannel> channel = std::make_shared<HeldChannel>();
+    HANDLE ended = CreateEventW(nullptr, TRUE, FALSE, nullptr);
+    NodeSession *session = nullptr;
+};
 } // namespace
 
-TEST(SlowReader, ALibraryThatStopsReadingGetsEachMembersNewestValueAndCostsTheNodeLittle)
+TEST_F(NodeSessionTest, ALibraryThatStopsReadingGetsEachMembersNewestValueAndCostsTheNodeLittle)
 {
-    // An engine of this test's own, as a node has it (the libraries' engine
-    // in the DLL is another).
-    Engine &engine = Engine::Instance();
-    engine.AddUse();
     const uint32_t count = 2000;
     auto url = [](uint32_t i) { return L"\\\\.\\p\\behind.m" + std::to_wstring(i); };
     std::wstring description = L"machine $HOST\nprocess p\nobject behind\n";
     for (uint32_t i = 0; i < count; ++i)
         description += L"member m" + std::to_wstring(i) + L" type=number access=r source=counter period=5 step=" +
                        std::to_wstring(i + 1) + L"\n"; // values of their own: no frame carries two
-    std::wstring error;
-    ASSERT_TRUE(engine.Load(description, error)) << error;
-    auto channel = std::make_shared<HeldChannel>();
-    channel->Hold(true); // the library reads nothing
-    HANDLE ended = CreateEventW(nullptr, TRUE, FALSE, nullptr);
-    NodeSession *session = NodeSession::Start(engine, channel, false, ended);
-    ASSERT_TRUE(session);
+    ASSERT_NO_FATAL_FAILURE(Start(description, true)); // the library reads nothing
     for (uint32_t i = 0; i < count; ++i)
         SendSubscribe(*channel, i + 1, url(i));
 
@@ -183,13 +207,6 @@ TEST(SlowReader, ALibraryThatStopsReadingGetsEachMembersNewestValueAndCostsTheNo
             behind += !newest.count(i + 1) || newest[i + 1] != atRelease[i];
     }
     EXPECT_EQ(behind, 0u) << "members whose value at the release never arrived";
-
-    channel->Close();
-    EXPECT_EQ(WaitForSingleObject(ended, 10000), WAIT_OBJECT_0);
-    session->Join();
-    session->Release();
-    CloseHandle(ended);
-    engine.ReleaseUse();
 }
 
 // A feed keeps a short value in place and a text that does not fit beside
@@ -197,20 +214,13 @@ TEST(SlowReader, ALibraryThatStopsReadingGetsEachMembersNewestValueAndCostsTheNo
 // last, a text that became short again is never taken for the long one it
 // replaced, and a feed made again in a freed place starts with nothing of
 // the last one's.
-TEST(NodeSessionFeeds, ANewcomerIsToldTheFeedsLastValueWhateverItsLength)
+TEST_F(NodeSessionTest, ANewcomerIsToldTheFeedsLastValueWhateverItsLength)
 {
-    Engine &engine = Engine::Instance();
-    engine.AddUse();
-    std::wstring error;
-    ASSERT_TRUE(engine.Load(L"machine $HOST\nprocess p\nobject t\nmember words type=wtext access=rw value=\"first\"\n"
-                            L"member other type=number access=rw value=1\n",
-                            error))
-        << error;
+    ASSERT_NO_FATAL_FAILURE(
+        Start(L"machine $HOST\nprocess p\nobject t\nmember words type=wtext access=rw value=\"first\"\n"
+              L"member other type=number access=rw value=1\n",
+              false));
     const std::wstring url = L"\\\\.\\p\\t.words";
-    auto channel = std::make_shared<HeldChannel>();
-    HANDLE ended = CreateEventW(nullptr, TRUE, FALSE, nullptr);
-    NodeSession *session = NodeSession::Start(engine, channel, false, ended);
-    ASSERT_TRUE(session);
     auto waitFor = [&](uint32_t id, const std::wstring &text) {
         for (int waited = 0; waited < 200; ++waited, Sleep(25)) {
             auto newest = NewestTextById(channel->Written());
@@ -248,11 +258,4 @@ TEST(NodeSessionFeeds, ANewcomerIsToldTheFeedsLastValueWhateverItsLength)
     EXPECT_EQ(numbers.count(4) ? numbers[4] : -1, 1.0);
     EXPECT_EQ(numbers.count(5) ? numbers[5] : -1, 1.0);
     EXPECT_EQ(NewestTextById(channel->Written())[5], L"(not a text)") << "from the feed that held the place before";
-
-    channel->Close();
-    EXPECT_EQ(WaitForSingleObject(ended, 10000), WAIT_OBJECT_0);
-    session->Join();
-    session->Release();
-    CloseHandle(ended);
-    engine.ReleaseUse();
 }

@@ -1,7 +1,9 @@
 // node_client: another process on the network node, as a server's libraries
 // are. It subscribes to one member and prints what arrives ("status N",
 // "value V age A", A the milliseconds since the value's time stamp) for a
-// number of seconds, or until a given value arrives.
+// number of seconds, or until a given value arrives. With --ready it sets
+// the named event at the first value: a test then knows that the
+// subscription is in place before it acts on the network.
 //
 // With --many it subscribes to members m0 to m<count - 1> of one object,
 // one after another as a server's AddItems does, and prints how many
@@ -31,7 +33,7 @@ long long AgeMs(uint32_t low, uint32_t high)
 
 class Printer : public CSimUnknown<ICadroRealTimeReceiver> {
 public:
-    Printer(double last, HANDLE done) : m_last(last), m_done(done) {}
+    Printer(double last, HANDLE done, HANDLE ready) : m_last(last), m_done(done), m_ready(ready) {}
     HRESULT STDMETHODCALLTYPE OnData(void *, uint32_t flags, const CadroValue *value, int32_t, uint32_t low,
                                      uint32_t high) override
     {
@@ -39,6 +41,8 @@ public:
             printf("value %.17g age %lld\n", value->number, AgeMs(low, high));
             if (value->number == m_last)
                 SetEvent(m_done);
+            if (m_ready)
+                SetEvent(m_ready);
         }
         fflush(stdout);
         return S_OK;
@@ -54,6 +58,7 @@ public:
 private:
     double m_last;
     HANDLE m_done;
+    HANDLE m_ready;
 };
 
 // Counts the subscriptions (their cookies are their indexes) that have had
@@ -114,13 +119,19 @@ int wmain(int argc, wchar_t **argv)
 {
     if (argc == 5 && wcscmp(argv[1], L"--many") == 0)
         return SubscribeMany(argv[2], wcstoul(argv[3], nullptr, 10), wcstoul(argv[4], nullptr, 10));
+    HANDLE ready = nullptr;
+    if (argc > 2 && wcscmp(argv[1], L"--ready") == 0) {
+        ready = OpenEventW(EVENT_MODIFY_STATE, FALSE, argv[2]);
+        argc -= 2;
+        argv += 2;
+    }
     if (argc != 3 && argc != 4) {
-        fwprintf(stderr, L"usage: node_client <member url> <seconds> [<last value>]\n"
+        fwprintf(stderr, L"usage: node_client [--ready <event name>] <member url> <seconds> [<last value>]\n"
                          L"       node_client --many <object url> <count> <seconds>\n");
         return 2;
     }
     HANDLE done = CreateEventW(nullptr, TRUE, FALSE, nullptr);
-    Printer *printer = new Printer(argc == 4 ? _wtof(argv[3]) : NAN, done);
+    Printer *printer = new Printer(argc == 4 ? _wtof(argv[3]) : NAN, done, ready);
     CadroRealTime *realTime = nullptr;
     if (!CadroSim_NewRealTime(printer, &realTime)) {
         printer->Release();
@@ -137,5 +148,7 @@ int wmain(int argc, wchar_t **argv)
     realTime->Release();
     printer->Release();
     CloseHandle(done);
+    if (ready)
+        CloseHandle(ready);
     return SUCCEEDED(hr) ? 0 : 1;
 }

@@ -56,6 +56,26 @@ bool WaitForNewNode(DWORD previous, DWORD timeoutMs)
 }
 
 // The lines of text from the first that starts with from.
+// node_client on a member, printing what it is told until the last value
+// arrives; returns once its subscription has had its first value (false
+// when it has none within a minute).
+bool StartNodeClient(const std::wstring &url, int seconds, int last, std::future<std::string> &printed)
+{
+    std::wstring name =
+        L"NodeE2EClientReady-" + std::to_wstring(GetCurrentProcessId()) + L"-" + std::to_wstring(GetTickCount64());
+    UniqueHandle ready(CreateEventW(nullptr, TRUE, FALSE, name.c_str()));
+    if (!ready)
+        return false;
+    std::wstring command = L"\"" + BinPath(L"node_client.exe") + L"\" --ready " + name + L" " + url + L" " +
+                           std::to_wstring(seconds) + L" " + std::to_wstring(last);
+    printed = std::async(std::launch::async, [command, seconds] {
+        std::string output;
+        RunAndCapture(command, output, (seconds + 20) * 1000);
+        return output;
+    });
+    return WaitForSingleObject(ready.Get(), 60000) == WAIT_OBJECT_0;
+}
+
 std::string From(const std::string &text, const std::string &from)
 {
     size_t at = text.find(from);
@@ -160,12 +180,8 @@ TEST(NodeE2E, AKilledNodeIsReportedToEverySubscriptionWhichResumesOnTheNextNode)
     ASSERT_TRUE(sink.WaitFor([](auto &calls) { return HasValueFor(calls, 2, 21.5); }));
 
     // A second process on the same node, printing what it is told.
-    auto other = std::async(std::launch::async, [] {
-        std::string output;
-        RunAndCapture(L"\"" + BinPath(L"node_client.exe") + L"\" " + kTemperature + L" 40 77", output, 60000);
-        return output;
-    });
-    Sleep(2000);
+    std::future<std::string> other;
+    ASSERT_TRUE(StartNodeClient(kTemperature, 40, 77, other));
     std::string out;
     EXPECT_EQ(RunCadroctl(L"publish \\\\.\\proc1\\Setpoints.temperature 31", out), 0) << out;
     ASSERT_TRUE(sink.WaitFor([](auto &calls) { return HasDataChange(calls, 31); }));
@@ -313,11 +329,10 @@ TEST(NodeE2E, AMachineServedByAnotherNodeIsReachedOverTcp)
     ASSERT_EQ(here.Load(), 0);
     ASSERT_NO_FATAL_FAILURE(first.Add(kLevel, 5));
     TestSink &sink = first.sink;
-    auto client = std::async(std::launch::async, [] {
-        std::string output;
-        RunAndCapture(L"\"" + BinPath(L"node_client.exe") + L"\" " + kLevel + L" 50 77", output, 80000);
-        return output;
-    });
+    // Subscribed (and connected through this node to the other) before
+    // anything happens there.
+    std::future<std::string> client;
+    ASSERT_TRUE(StartNodeClient(kLevel, 50, 77, client));
 
     // Published there, seen here; written here, stored there.
     std::string out;
