@@ -491,8 +491,9 @@ TEST(AddressSpace, IndexedLookupsFindWhatTheWalkOverEverySiblingFinds)
 
 namespace {
 // A network whose browsers each keep their own place, so that threads may
-// read side by side. The read of one URL waits (a few seconds at most) until
-// another one is under way: reads that never overlap show as one at a time.
+// read side by side. Reads of URLs that begin with waitPrefix wait (a few
+// seconds at most) for another read to be under way at the same time, until
+// two have been: reads that never overlap show as one at a time.
 struct SharedNetwork {
     std::map<std::wstring, std::vector<std::tuple<std::wstring, wchar_t, bool>>> listings;
     std::map<std::wstring, uint16_t> access; // by name; rw when absent
@@ -500,7 +501,7 @@ struct SharedNetwork {
     std::condition_variable changed;
     std::vector<std::wstring> opened;
     int reading = 0, mostReading = 0;
-    std::wstring waitForCompany; // the URL whose read waits, once
+    std::wstring waitPrefix;
 
     CAddrSpace::BrowserSource Source()
     {
@@ -525,10 +526,9 @@ struct SharedNetwork {
         opened.push_back(url);
         mostReading = std::max(mostReading, ++reading);
         changed.notify_all();
-        if (url == waitForCompany && !std::exchange(waitForCompany, L"").empty()) {
-            size_t before = opened.size();
-            changed.wait_for(l, std::chrono::seconds(10), [&] { return opened.size() > before; });
-        }
+        if (!waitPrefix.empty() && std::wstring_view(url).substr(0, waitPrefix.size()) == waitPrefix &&
+            !changed.wait_for(l, std::chrono::seconds(10), [&] { return mostReading > 1; }))
+            waitPrefix.clear(); // alone: the reads are one at a time, and the test fails once
         --reading;
         auto it = listings.find(url);
         if (it == listings.end())
@@ -599,9 +599,10 @@ TEST(AddressSpace, ReadingAheadReadsTheSameBranchesOnceEachAndSeveralAtOnce)
     for (int call = 0; call < 2; ++call) {
         std::multiset<std::wstring> readPlain, readAhead;
         std::vector<Looked> expected = LookUp(*plain, net, ids, false, readPlain);
-        net.waitForCompany = L"\\\\x\\proc\\o7";
+        net.waitPrefix = L"\\\\x\\proc\\o"; // the objects' reads
         net.mostReading = 0;
         std::vector<Looked> found = LookUp(*ahead, net, ids, true, readAhead);
+        net.waitPrefix.clear();
         EXPECT_TRUE(found == expected) << "call " << call;
         EXPECT_EQ(readAhead, readPlain) << "call " << call;
         for (const std::wstring &url : readAhead)
