@@ -30,6 +30,16 @@ BrowseRecord Record(const wchar_t *name, wchar_t kind, bool leaf, uint16_t type 
     return r;
 }
 
+// A listing's entry as the network gives it: a number, with the rights the
+// test set for its name (read and write when none).
+BrowseRecord RecordOf(const std::tuple<std::wstring, wchar_t, bool> &entry,
+                      const std::map<std::wstring, uint16_t> &access)
+{
+    auto &[name, kind, leaf] = entry;
+    auto rights = access.find(name);
+    return Record(name.c_str(), kind, leaf, kCadroNumber, rights == access.end() ? 3 : rights->second);
+}
+
 // A network whose listings the test sets per URL.
 struct FakeNetwork {
     std::map<std::wstring, std::vector<std::tuple<std::wstring, wchar_t, bool>>> listings;
@@ -53,9 +63,7 @@ struct FakeNetwork {
             b.next = [this](BrowseRecord *r) {
                 if (next >= current.size())
                     return E_FAIL;
-                auto &[name, kind, leaf] = current[next++];
-                auto rights = access.find(name);
-                *r = Record(name.c_str(), kind, leaf, kCadroNumber, rights == access.end() ? 3 : rights->second);
+                *r = RecordOf(current[next++], access);
                 return S_OK;
             };
             return true;
@@ -512,9 +520,7 @@ struct SharedNetwork {
                 auto &[records, next] = *cursor;
                 if (next >= records.size())
                     return E_FAIL;
-                auto &[name, kind, leaf] = records[next++];
-                auto rights = access.find(name);
-                *r = Record(name.c_str(), kind, leaf, kCadroNumber, rights == access.end() ? 3 : rights->second);
+                *r = RecordOf(records[next++], access);
                 return S_OK;
             };
             return true;
