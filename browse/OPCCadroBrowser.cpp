@@ -34,12 +34,12 @@ OPCCadroBrowser *OPCCadroBrowser::AcquireCurrent()
 
 HRESULT OPCCadroBrowser::Open(const wchar_t *url)
 {
-    // No session (the factory failed): nothing can be browsed.
     return OpenOn(m_browser, url);
 }
 
 HRESULT OPCCadroBrowser::OpenOn(CadroBrowser *browser, const wchar_t *url)
 {
+    // No session (the factory failed): nothing can be browsed.
     if (!browser || !url)
         return E_FAIL;
     wchar_t *expanded = ExpandLocalMachine(url, true);
