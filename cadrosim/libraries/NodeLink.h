@@ -195,6 +195,13 @@ private:
     // batch, then the receivers are called without it.
     void TakeData(wire::In &in, bool feeds);
     void DeliverData();
+    // Under m_lock: remembers the values of the batch's entries from from
+    // on and lists the calls they make, until the round holds
+    // kCallsPerRound (a feed's members all go in one); returns the entry
+    // after the last taken.
+    size_t GatherCalls(size_t from);
+    // Without the lock: the calls listed.
+    void MakeGatheredCalls();
     // Asks for the feed of the batch's entry i, and for the place in the
     // table of one further on.
     void PrefetchFeed(size_t i) const;

@@ -41,26 +41,50 @@ void NodeLink::DeliverData()
 {
     if (m_batch.fields.empty())
         return;
-    {
-        std::lock_guard<SlimMutex> l(m_lock);
-        m_delivering = true;
-        for (size_t i = 0; i < m_batch.ids.size(); ++i) {
-            PrefetchFeed(i + kPrefetchAhead);
-            auto [id, tagged] = m_batch.ids[i];
-            uint32_t index = tagged & ~kFeedBit;
-            const Batch::Fields &f = m_batch.fields[index];
-            if (tagged & kFeedBit) {
-                // A feed's value: remembered once, for all its members.
-                if (LinkFeed *feed = FeedOf(id)) {
-                    feed->mirror.Remember(f.flags, f.value, f.error, f.low, f.high);
-                    feed->ForEachMember([&](RemoteSubscription *sub) { m_batch.subs.emplace_back(sub, index); });
-                }
-            } else if (RemoteSubscription *sub = Lookup(id)) {
-                sub->feed->mirror.Remember(f.flags, f.value, f.error, f.low, f.high);
-                m_batch.subs.emplace_back(sub, index);
+    std::unique_lock<SlimMutex> l(m_lock);
+    m_delivering = true;
+    for (size_t next = 0; next < m_batch.ids.size();) {
+        next = GatherCalls(next);
+        l.unlock();
+        MakeGatheredCalls();
+        l.lock();
+    }
+    m_delivering = false;
+    std::vector<RemoteSubscription *> graveyard;
+    graveyard.swap(m_graveyard);
+    l.unlock();
+    for (RemoteSubscription *sub : graveyard)
+        sub->Unpin();
+    for (Batch::Fields &f : m_batch.fields)
+        ClearCadroValue(f.value);
+    m_batch.fields.clear();
+    m_batch.ids.clear();
+}
+
+size_t NodeLink::GatherCalls(size_t from)
+{
+    size_t i = from;
+    for (; i < m_batch.ids.size() && m_batch.subs.size() < kCallsPerRound; ++i) {
+        PrefetchFeed(i + kPrefetchAhead);
+        auto [id, tagged] = m_batch.ids[i];
+        uint32_t index = tagged & ~kFeedBit;
+        const Batch::Fields &f = m_batch.fields[index];
+        if (tagged & kFeedBit) {
+            // A feed's value: remembered once, for all its members.
+            if (LinkFeed *feed = FeedOf(id)) {
+                feed->mirror.Remember(f.flags, f.value, f.error, f.low, f.high);
+                feed->ForEachMember([&](RemoteSubscription *sub) { m_batch.subs.emplace_back(sub, index); });
             }
+        } else if (RemoteSubscription *sub = Lookup(id)) {
+            sub->feed->mirror.Remember(f.flags, f.value, f.error, f.low, f.high);
+            m_batch.subs.emplace_back(sub, index);
         }
     }
+    return i;
+}
+
+void NodeLink::MakeGatheredCalls()
+{
     // No pins: a subscription let go during the batch is deleted after it
     // (Forget), and the one being called is published first, so that its
     // holder either is seen here or sees the call and waits for it.
@@ -77,18 +101,6 @@ void NodeLink::DeliverData()
             WakeWaiters(nullptr);
     }
     WakeWaiters(nullptr);
-    std::vector<RemoteSubscription *> graveyard;
-    {
-        std::lock_guard<SlimMutex> l(m_lock);
-        m_delivering = false;
-        graveyard.swap(m_graveyard);
-    }
-    for (RemoteSubscription *sub : graveyard)
-        sub->Unpin();
-    for (Batch::Fields &f : m_batch.fields)
-        ClearCadroValue(f.value);
-    m_batch.fields.clear();
-    m_batch.ids.clear();
     m_batch.subs.clear();
 }
 

@@ -18,6 +18,10 @@ inline constexpr DWORD kReconnectPauseMs = 500;
 inline constexpr DWORD kRestartMs = 2000;
 inline constexpr DWORD kTcpConnectMs = 3000;
 inline constexpr uint32_t kFeedBit = 1u << 31; // on a batch entry's index: a feed's
+// The most calls a batch gathers before it makes them: a read that holds
+// many ticks for many subscriptions would otherwise gather them all (a
+// million entries, 16 MB, kept after the subscriptions are gone).
+inline constexpr size_t kCallsPerRound = 8192;
 } // namespace link
 
 template <class Fill> bool NodeLink::Send(wire::Kind kind, Fill fill)

@@ -62,14 +62,17 @@ private:
 };
 
 // Counts the subscriptions (their cookies are their indexes) that have had
-// a value; done when all have.
+// a value, and the values that were not their member's (member m<i> holds
+// i); done when all have had one.
 class FirstValues : public CSimUnknown<ICadroRealTimeReceiver> {
 public:
     FirstValues(size_t count, HANDLE done) : m_seen(count), m_done(done) {}
-    HRESULT STDMETHODCALLTYPE OnData(void *cookie, uint32_t flags, const CadroValue *, int32_t, uint32_t,
+    HRESULT STDMETHODCALLTYPE OnData(void *cookie, uint32_t flags, const CadroValue *value, int32_t, uint32_t,
                                      uint32_t) override
     {
         size_t i = reinterpret_cast<size_t>(cookie);
+        if ((flags & kCadroHasValue) && (value->type != kCadroNumber || value->number != static_cast<double>(i)))
+            ++m_wrong;
         if ((flags & kCadroHasValue) && i < m_seen.size() && !m_seen[i].exchange(true) && ++m_count == m_seen.size())
             SetEvent(m_done);
         return S_OK;
@@ -77,8 +80,10 @@ public:
     HRESULT STDMETHODCALLTYPE OnAttributes(void *, const CadroAttributes *) override { return S_OK; }
     HRESULT STDMETHODCALLTYPE StatusChange(void *, uint32_t, uint32_t, uint32_t) override { return S_OK; }
     size_t Count() const { return m_count.load(); }
+    size_t Wrong() const { return m_wrong.load(); }
 
 private:
+    std::atomic<size_t> m_wrong{0};
     std::vector<std::atomic<bool>> m_seen;
     std::atomic<size_t> m_count{0};
     HANDLE m_done;
@@ -105,6 +110,7 @@ int SubscribeMany(const std::wstring &object, size_t count, DWORD seconds)
     fflush(stdout);
     WaitForSingleObject(done, seconds * 1000);
     printf("first values %lu\n", static_cast<unsigned long>(receiver->Count()));
+    printf("wrong values %lu\n", static_cast<unsigned long>(receiver->Wrong()));
     for (CadroDataItem *item : items)
         if (item)
             item->Release();

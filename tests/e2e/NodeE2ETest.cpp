@@ -441,6 +441,7 @@ TEST(NodeE2E, MembersNothingListedAreSubscribedAtOnceAndUnknownOnesStillFail)
     RunAndCapture(L"\"" + BinPath(L"node_client.exe") + L"\" --many \\\\.\\bulk\\o 10000 120", out, 180000);
     EXPECT_TRUE(Has(out, "subscribed 10000 failed 0")) << out;
     EXPECT_TRUE(Has(out, "first values 10000")) << out;
+    EXPECT_TRUE(Has(out, "wrong values 0")) << out;
 
     // What the node does not have is refused at once, as before, however
     // close its name is to members it has: a process's name is exact.
