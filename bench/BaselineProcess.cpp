@@ -14,13 +14,14 @@ std::string ReadLine(HANDLE pipe)
 }
 } // namespace
 
-BaselineProcess::BaselineProcess(DWORD n)
+BaselineProcess::BaselineProcess(DWORD n, bool singleThreaded)
 {
     wchar_t exe[MAX_PATH];
     GetModuleFileNameW(nullptr, exe, MAX_PATH);
     std::wstring path(exe);
     path = path.substr(0, path.find_last_of(L"\\/") + 1) + L"baseline_server.exe";
-    std::wstring command = L"\"" + path + L"\" " + std::to_wstring(n) + L" " + std::to_wstring(GetCurrentProcessId());
+    std::wstring command = L"\"" + path + L"\" " + std::to_wstring(n) + L" " + std::to_wstring(GetCurrentProcessId()) +
+                           (singleThreaded ? L" sta" : L"");
 
     SECURITY_ATTRIBUTES inherit = {sizeof(inherit), nullptr, TRUE};
     HANDLE readEnd = nullptr, writeEnd = nullptr;

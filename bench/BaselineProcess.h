@@ -12,8 +12,10 @@
 class BaselineProcess {
 public:
     // Starts baseline_server.exe (beside this program) for deliveries of n
-    // items; Ready() tells whether its object came.
-    explicit BaselineProcess(DWORD n);
+    // items, sent from a thread of the multithreaded apartment or, with
+    // singleThreaded, from a thread of an apartment of its own; Ready() tells
+    // whether its object came.
+    explicit BaselineProcess(DWORD n, bool singleThreaded = false);
     // Lets go of the object and waits a while for the process, which ends
     // once released.
     ~BaselineProcess();

@@ -9,7 +9,9 @@
 //   every item at once without looking anything up (a double, readable and
 //   writable, good quality).
 //
-// Usage: baseline_server N CLIENT_PID. It writes its object's IUnknown,
+// Usage: baseline_server N CLIENT_PID [sta]. With sta the calls go from a
+// thread of a single-threaded apartment (else of the multithreaded one), to
+// compare what each costs a sender. It writes its object's IUnknown,
 // marshalled for another process on this machine, as one line of hex on
 // stdout, and exits once the client has released it or has ended.
 #include "ComObject.h"
@@ -32,9 +34,9 @@ const DWORD kRateMs = 10;
 
 class BaselineSource : public CComObjectRoot, public IConnectionPoint, public IOPCItemMgt, public IOPCSyncIO {
 public:
-    BaselineSource(DWORD items, HANDLE released)
-        : m_released(released), m_handles(items), m_values(items), m_qualities(items, OPC_QUALITY_GOOD), m_times(items),
-          m_errors(items, S_OK)
+    BaselineSource(DWORD items, HANDLE released, DWORD apartment)
+        : m_released(released), m_apartment(apartment), m_handles(items), m_values(items),
+          m_qualities(items, OPC_QUALITY_GOOD), m_times(items), m_errors(items, S_OK)
     {
         FILETIME now;
         GetSystemTimeAsFileTime(&now);
@@ -65,8 +67,12 @@ public:
         ComPtr<IOPCDataCallback> callback;
         if (FAILED(sink->QueryInterface(IID_IOPCDataCallback, reinterpret_cast<void **>(callback.Out()))))
             return CONNECT_E_CANNOTCONNECT;
+        // The sending thread takes the sink into its own apartment.
+        IStream *stream = nullptr;
+        if (FAILED(CoMarshalInterThreadInterfaceInStream(IID_IOPCDataCallback, callback.Get(), &stream)))
+            return CONNECT_E_CANNOTCONNECT;
         m_stop = false;
-        m_sender = std::thread([this, callback] { Send(callback.Get()); });
+        m_sender = std::thread([this, stream] { Send(stream); });
         *cookie = 1;
         return S_OK;
     }
@@ -157,9 +163,19 @@ private:
         SetEvent(m_released);
     }
 
-    void Send(IOPCDataCallback *sink)
+    void Send(IStream *stream)
     {
-        CoInitializeEx(nullptr, COINIT_MULTITHREADED);
+        CoInitializeEx(nullptr, m_apartment);
+        {
+            ComPtr<IOPCDataCallback> sink;
+            if (SUCCEEDED(CoGetInterfaceAndReleaseStream(stream, IID_IOPCDataCallback,
+                                                         reinterpret_cast<void **>(sink.Out()))))
+                SendTo(sink.Get());
+        }
+        CoUninitialize();
+    }
+    void SendTo(IOPCDataCallback *sink)
+    {
         const DWORD n = static_cast<DWORD>(m_handles.size());
         ULONGLONG due = GetTickCount64();
         while (!m_stop) {
@@ -172,7 +188,6 @@ private:
             else
                 due = now; // late: the next call goes at once
         }
-        CoUninitialize();
     }
     void Stop()
     {
@@ -182,6 +197,7 @@ private:
     }
 
     HANDLE m_released;
+    DWORD m_apartment; // the sending thread's
     std::vector<OPCHANDLE> m_handles;
     std::vector<VARIANT> m_values;
     std::vector<WORD> m_qualities;
@@ -222,7 +238,8 @@ int main(int argc, char **argv)
     int status = 1;
     {
         ComPtr<IUnknown> source;
-        CreateComObject(NewComObject<BaselineSource>(items, released.Get()), IID_IUnknown,
+        DWORD apartment = argc > 3 && strcmp(argv[3], "sta") == 0 ? COINIT_APARTMENTTHREADED : COINIT_MULTITHREADED;
+        CreateComObject(NewComObject<BaselineSource>(items, released.Get(), apartment), IID_IUnknown,
                         reinterpret_cast<void **>(source.Out()));
         if (source && WriteMarshalled(source.Get()))
             status = 0;
