@@ -7,6 +7,7 @@
 #include "ServerLifetime.h"
 #include "ServerProcess.h"
 #include "TestAdviseSink.h"
+#include "TestProgress.h"
 #include "TestSink.h"
 #include "opcda.h"
 
@@ -140,6 +141,7 @@ struct ReentrantClient {
             return;
         SetEvent(entered.Get());
         Sleep(300);
+        TestStep("inside the callback: GetStatus");
         OPCSERVERSTATUS *status = nullptr;
         statusResult = server->GetStatus(&status);
         if (status) {
@@ -149,11 +151,14 @@ struct ReentrantClient {
         OPCHANDLE other = 0;
         DWORD rate = 0;
         ComPtr<IUnknown> unknown;
+        TestStep("inside the callback: AddGroup");
         addResult =
             server->AddGroup(L"", FALSE, 1000, 2, nullptr, nullptr, 0, &other, &rate, IID_IUnknown, unknown.Out());
         unknown.Reset();
+        TestStep("inside the callback: RemoveGroup of the group it added");
         if (other)
             server->RemoveGroup(other, TRUE);
+        TestStep("inside the callback: GetState of the group being removed");
         ComPtr<IOPCGroupStateMgt> state;
         if (SUCCEEDED(items.As(state))) {
             DWORD updateRate, lcid;
@@ -165,6 +170,7 @@ struct ReentrantClient {
             stateResult = state->GetState(&updateRate, &active, &name, &bias, &deadband, &lcid, &client, &handle);
             CoTaskMemFree(name);
         }
+        TestStep("inside the callback: returning");
         SetEvent(done.Get());
     }
 
@@ -217,6 +223,7 @@ TEST_F(ConcurrencyE2E, ACallbackThatCallsTheServerWhileItsGroupIsRemovedNeverFre
             SCOPED_TRACE(std::string(dataObject ? "IAdviseSink" : "IOPCDataCallback") +
                          (force ? ", forced removal" : ", plain removal"));
             ReentrantClient client;
+            TestStep("creating the server and the group");
             client.Create();
             ASSERT_TRUE(client.server);
             TestSink sink;
@@ -238,8 +245,11 @@ TEST_F(ConcurrencyE2E, ACallbackThatCallsTheServerWhileItsGroupIsRemovedNeverFre
                 ASSERT_EQ(data->DAdvise(&format, 0, &adviseSink, &cookie), S_OK);
             }
             client.armed = true;
+            TestStep("waiting for a callback");
             ASSERT_EQ(WaitForSingleObject(client.entered.Get(), 20000), WAIT_OBJECT_0) << "no callback came";
+            TestStep("removing the group from another thread");
             HRESULT removed = client.RemoveFromAnotherThread(force);
+            TestStep("waiting for the callback to return");
             EXPECT_NE(removed, E_PENDING) << "RemoveGroup never returned";
             EXPECT_TRUE(removed == S_OK || removed == OPC_S_INUSE) << std::hex << removed;
             ASSERT_EQ(WaitForSingleObject(client.done.Get(), 60000), WAIT_OBJECT_0) << "the callback never returned";
@@ -247,7 +257,9 @@ TEST_F(ConcurrencyE2E, ACallbackThatCallsTheServerWhileItsGroupIsRemovedNeverFre
             EXPECT_EQ(client.addResult.load(), S_OK) << "AddGroup from inside the callback";
             HRESULT state = client.stateResult.load();
             EXPECT_TRUE(state == S_OK || state == E_FAIL || state == RPC_E_DISCONNECTED) << std::hex << state;
+            TestStep("checking that the server still delivers");
             ExpectServerStillDelivers(client.server.Get());
+            TestStep("releasing the client's references");
             point.Reset();
             data.Reset();
             client.items.Reset();
