@@ -24,6 +24,7 @@
 #include "CadroSim.h"
 #include "ClassFactory.h"
 #include "ComPtr.h"
+#include "DataChangeSink.h"
 #include "DistinctNetwork.h"
 #include "GroupState.h"
 #include "Handle.h"
@@ -47,9 +48,8 @@ bool inProcessOnly = false;
 using Clock = std::chrono::steady_clock;
 const CLSID kServer = {0x5b1e7a20, 0x4c3d, 0x11d3, {0x9a, 0x44, 0x00, 0xa0, 0xc9, 0xe2, 0xb7, 0xf1}};
 
-class CountingSink : public CComObjectRoot, public IOPCDataCallback {
+class CountingSink : public CDataChangeSink {
 public:
-    DECLARE_COM_UNKNOWN()
     STDMETHODIMP OnDataChange(DWORD, OPCHANDLE, HRESULT, HRESULT, DWORD count, OPCHANDLE *, VARIANT *values, WORD *,
                               FILETIME *times, HRESULT *) override
     {
@@ -60,14 +60,6 @@ public:
             SampleLatency(count, times);
         return S_OK;
     }
-    STDMETHODIMP OnReadComplete(DWORD, OPCHANDLE, HRESULT, HRESULT, DWORD, OPCHANDLE *, VARIANT *, WORD *, FILETIME *,
-                                HRESULT *) override
-    {
-        return S_OK;
-    }
-    STDMETHODIMP OnWriteComplete(DWORD, OPCHANDLE, HRESULT, DWORD, OPCHANDLE *, HRESULT *) override { return S_OK; }
-    STDMETHODIMP OnCancelComplete(DWORD, OPCHANDLE) override { return S_OK; }
-
     static ComPtr<CountingSink> Create()
     {
         ComPtr<CountingSink> sink(NewComObject<CountingSink>());
@@ -99,11 +91,6 @@ private:
 
     CCriticalSection m_latencyLock{LockOrder::Leaf};
     std::vector<double> m_latenciesMs;
-
-    void *FindInterface(REFIID riid) override
-    {
-        return IsEqualIID(riid, IID_IOPCDataCallback) ? static_cast<IOPCDataCallback *>(this) : nullptr;
-    }
 };
 
 struct Group {

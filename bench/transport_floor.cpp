@@ -18,6 +18,7 @@
 #include "BaselineProcess.h"
 #include "ComObject.h"
 #include "ComPtr.h"
+#include "DataChangeSink.h"
 #include "Handle.h"
 #include "OpcErrors.h"
 #include "ProcessTimes.h"
@@ -331,29 +332,15 @@ private:
 
 // ---- the baseline server through COM ----------------------------------------
 
-class CountingSink : public CComObjectRoot, public IOPCDataCallback {
+class CountingSink : public CDataChangeSink {
 public:
-    DECLARE_COM_UNKNOWN()
     STDMETHODIMP OnDataChange(DWORD, OPCHANDLE, HRESULT, HRESULT, DWORD count, OPCHANDLE *, VARIANT *, WORD *,
                               FILETIME *, HRESULT *) override
     {
         items += count;
         return S_OK;
     }
-    STDMETHODIMP OnReadComplete(DWORD, OPCHANDLE, HRESULT, HRESULT, DWORD, OPCHANDLE *, VARIANT *, WORD *, FILETIME *,
-                                HRESULT *) override
-    {
-        return S_OK;
-    }
-    STDMETHODIMP OnWriteComplete(DWORD, OPCHANDLE, HRESULT, DWORD, OPCHANDLE *, HRESULT *) override { return S_OK; }
-    STDMETHODIMP OnCancelComplete(DWORD, OPCHANDLE) override { return S_OK; }
     std::atomic<unsigned long long> items{0};
-
-private:
-    void *FindInterface(REFIID riid) override
-    {
-        return IsEqualIID(riid, IID_IOPCDataCallback) ? static_cast<IOPCDataCallback *>(this) : nullptr;
-    }
 };
 
 // In-process cost of the marshalling alone, per item: sizing and writing
