@@ -14,7 +14,7 @@
 // marshalling: nothing that uses the standard proxy can send it with less.
 //
 // Usage: transport_floor [N]   (items per call, 10,000 by default)
-//        transport_floor --receive PIPE N   (the receiving side; internal)
+//        transport_floor --receive PIPE   (the receiving side; internal)
 #include "BaselineProcess.h"
 #include "ComObject.h"
 #include "ComPtr.h"
@@ -266,7 +266,7 @@ public:
                                       kFragmentBytes, kFragmentBytes, 0, nullptr));
         wchar_t exe[MAX_PATH];
         GetModuleFileNameW(nullptr, exe, MAX_PATH);
-        std::wstring command = L"\"" + std::wstring(exe) + L"\" --receive " + name + L" " + std::to_wstring(n);
+        std::wstring command = L"\"" + std::wstring(exe) + L"\" --receive " + name;
         STARTUPINFOW si = {};
         si.cb = sizeof(si);
         PROCESS_INFORMATION pi = {};
@@ -287,7 +287,6 @@ public:
 
     bool Ready() const { return m_connected; }
     HANDLE Receiver() const { return m_receiver.Get(); }
-    ULONG BodyBytes() { return CallBody::Size(m_args); }
     const std::atomic<unsigned long long> &Items() const { return m_items; }
 
     // Calls back to back for ms milliseconds.

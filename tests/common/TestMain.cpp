@@ -92,10 +92,6 @@ void TestStep(const char *step)
 {
     g_step = step;
 }
-const char *LastTestStep()
-{
-    return g_step.load();
-}
 
 int main(int argc, char **argv)
 {

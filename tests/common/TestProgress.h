@@ -1,5 +1,5 @@
 #pragma once
-// A test's last step, which the test programs print when a test runs for
-// longer than a test runner would wait: a hang then says where it is.
+// Names a test's current step: the test programs print the last one named
+// when a test runs longer than a test runner would wait, so that a hang
+// says where it is.
 void TestStep(const char *step);
-const char *LastTestStep();
