@@ -1,6 +1,7 @@
 #include "AdvisoryConnectionMgr.h"
 
 #include "IdMgr.h"
+#include "SinkRelease.h"
 
 #include <cstring>
 
@@ -17,7 +18,7 @@ DVTARGETDEVICE *CopyTargetDevice(const DVTARGETDEVICE *device)
 } // namespace
 
 CConnectionData::CConnectionData(const FORMATETC &f, DWORD a, IAdviseSink *s)
-    : format(f), advf(a), id(CIdMgr::Instance().GetId()), sink(s)
+    : format(f), advf(a), id(CIdMgr::Instance().GetId()), sink(s), remoteSink(SinkRelease::IsRemote(s))
 {
     format.ptd = CopyTargetDevice(f.ptd);
     sink->AddRef();
@@ -27,7 +28,7 @@ CConnectionData::~CConnectionData()
 {
     CoTaskMemFree(format.ptd);
     CIdMgr::Instance().ReleaseId(id);
-    sink->Release();
+    SinkRelease::Release(sink, remoteSink);
 }
 
 HRESULT CAdvisoryConnectionMgr::Add(const FORMATETC &format, DWORD advf, IAdviseSink *sink, DWORD *id)

@@ -23,6 +23,7 @@ public:
     DWORD advf;
     DWORD id;
     IAdviseSink *sink;
+    bool remoteSink; // released as a client's sink (SinkRelease)
 };
 
 // Connections taken out of a manager for one send: the sinks are called

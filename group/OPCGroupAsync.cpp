@@ -191,7 +191,7 @@ HRESULT COPCGroup::SendReadResults(CSingleLock &lock, DWORD clientId, OPCDATASOU
     std::vector<ReadResult> results;
     HRESULT overall = ReadPass(source, static_cast<DWORD>(handles.size()), handles.data(), results);
     Delivery d(std::move(results));
-    ComPtr<IOPCDataCallback> sink = m_callback.Sink<IOPCDataCallback>();
+    CSinkRef<IOPCDataCallback> sink = m_callback.Sink<IOPCDataCallback>();
     if (!sink)
         return E_FAIL;
     OPCHANDLE hGroup = m_clientHandle;
@@ -213,7 +213,7 @@ HRESULT COPCGroup::ExecuteWrite2(DWORD clientId, const std::vector<OPCHANDLE> &h
     CSingleLock lock(&m_lock);
     WriteResults w(handles.size());
     WritePass(handles, values, w);
-    ComPtr<IOPCDataCallback> sink = m_callback.Sink<IOPCDataCallback>();
+    CSinkRef<IOPCDataCallback> sink = m_callback.Sink<IOPCDataCallback>();
     if (!sink)
         return E_FAIL;
     OPCHANDLE hGroup = m_clientHandle;
@@ -297,7 +297,7 @@ BOOL COPCGroup::Scan(LONGLONG &next)
     columns.SetUsed(n);
 
     HRESULT callbackResult = S_FALSE;
-    ComPtr<IOPCDataCallback> sink = m_enable ? m_callback.Sink<IOPCDataCallback>() : nullptr;
+    CSinkRef<IOPCDataCallback> sink = m_enable ? m_callback.Sink<IOPCDataCallback>() : nullptr;
     if (sink) {
         HRESULT masterError = S_OK;
         for (size_t i = 0; i < n; ++i) {

@@ -6,6 +6,7 @@
 #include "CommandLine.h"
 #include "ExitWatchdog.h"
 #include "ServerLifetime.h"
+#include "SinkRelease.h"
 
 #include <objbase.h>
 
@@ -47,6 +48,7 @@ int RunLocalServer(REFCLSID clsid, IClassFactory &factory, bool startedByCom)
 int EndLocalServer(int exitCode)
 {
     CExitWatchdog watchdog(kExitBoundMs, static_cast<UINT>(exitCode));
+    SinkRelease::Flush(); // sinks still held a moment longer go now
     CoUninitialize();
     return exitCode;
 }

@@ -40,12 +40,14 @@ STDMETHODIMP CSinkSlot::Advise(IUnknown *pUnkSink, DWORD *pdwCookie)
         if (m_closed)
             return E_FAIL;
     }
-    ComPtr<IUnknown> sink; // one not stored is released with the holder, after the lock
-    HRESULT hr = pUnkSink->QueryInterface(m_iid, reinterpret_cast<void **>(sink.Out()));
+    IUnknown *queried = nullptr;
+    HRESULT hr = pUnkSink->QueryInterface(m_iid, reinterpret_cast<void **>(&queried));
     if (hr == E_NOINTERFACE)
         return CONNECT_E_CANNOTCONNECT;
     if (FAILED(hr))
         return hr;
+    // One not stored is released with the holder, after the lock.
+    CSinkRef<IUnknown> sink = CSinkRef<IUnknown>::Attach(queried, SinkRelease::IsRemote(queried));
     CSingleLock lock(&m_lock);
     if (m_closed)
         return E_FAIL;
@@ -58,7 +60,7 @@ STDMETHODIMP CSinkSlot::Advise(IUnknown *pUnkSink, DWORD *pdwCookie)
 
 STDMETHODIMP CSinkSlot::Unadvise(DWORD dwCookie)
 {
-    ComPtr<IUnknown> released; // released after the lock
+    CSinkRef<IUnknown> released; // released after the lock
     CSingleLock lock(&m_lock);
     if (dwCookie != m_cookie || !m_sink)
         return CONNECT_E_NOCONNECTION;
@@ -72,7 +74,7 @@ STDMETHODIMP CSinkSlot::EnumConnections(IEnumConnections **ppEnum)
         return E_POINTER;
     *ppEnum = nullptr;
     std::vector<CONNECTDATA> connections;
-    ComPtr<IUnknown> sink = SlotSink();
+    CSinkRef<IUnknown> sink = SlotSink();
     if (sink)
         connections.push_back({sink.Detach(), m_cookie});
     return CEnumConnections::Create(std::move(connections), true, IID_IEnumConnections,
@@ -100,7 +102,7 @@ HRESULT CSinkSlot::Enumerate(IEnumConnectionPoints **ppEnum)
     return CEnumConnectionPoints::Create({this}, true, IID_IEnumConnectionPoints, reinterpret_cast<void **>(ppEnum));
 }
 
-ComPtr<IUnknown> CSinkSlot::SlotSink()
+CSinkRef<IUnknown> CSinkSlot::SlotSink()
 {
     CSingleLock lock(&m_lock);
     return m_sink;
@@ -114,7 +116,7 @@ bool CSinkSlot::IsFilled()
 
 void CSinkSlot::Clear()
 {
-    ComPtr<IUnknown> released;
+    CSinkRef<IUnknown> released;
     CSingleLock lock(&m_lock);
     released = std::move(m_sink);
 }

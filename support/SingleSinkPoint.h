@@ -5,6 +5,7 @@
 // identity of its own but its container's reference count (it must answer
 // GetConnectionPointContainer, and owning the container would be a cycle).
 #include "ComPtr.h"
+#include "SinkRelease.h"
 #include "SyncObject.h"
 
 #include <ocidl.h>
@@ -39,11 +40,7 @@ public:
     // The sink as its interface (the slot holds it queried for the sink
     // interface), with a reference of the caller's own: a concurrent
     // Unadvise cannot free it.
-    template <class I> ComPtr<I> Sink()
-    {
-        ComPtr<IUnknown> sink = SlotSink();
-        return ComPtr<I>(static_cast<I *>(sink.Get()));
-    }
+    template <class I> CSinkRef<I> Sink() { return SlotSink().As<I>(); }
     bool IsFilled();
     // Releases the sink, after the slot's lock.
     void Clear();
@@ -51,12 +48,12 @@ public:
     void Close();
 
 private:
-    ComPtr<IUnknown> SlotSink();
+    CSinkRef<IUnknown> SlotSink();
 
     const IID &m_iid;
     const DWORD m_cookie;
     IUnknown *const m_container;
     CCriticalSection m_lock{LockOrder::Inner}; // guards the two below
-    ComPtr<IUnknown> m_sink;
+    CSinkRef<IUnknown> m_sink;
     bool m_closed = false;
 };

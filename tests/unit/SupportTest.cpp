@@ -1,9 +1,11 @@
 #include "ManualResetEvent.h"
+#include "SinkRelease.h"
 #include "tw/hmx/osdep/OSException.h"
 #include "tw/hmx/osdep/WideToAnsi.h"
 
 #include <gtest/gtest.h>
 
+#include <atomic>
 #include <string>
 #include <thread>
 #include <vector>
@@ -156,4 +158,51 @@ TEST(Support, ManualResetEventWakesItsWaitersAndTimesOut)
         event.Set();
     }
     EXPECT_TRUE(event.Wait(lock, 0)); // already set: no sleep
+}
+
+namespace {
+// A sink that says it is a proxy, as the proxy manager does, and counts its
+// references.
+class ProxyLikeSink : public IMultiQI {
+public:
+    STDMETHODIMP QueryInterface(REFIID riid, void **ppv) override
+    {
+        if (!IsEqualIID(riid, IID_IUnknown) && !(IsEqualIID(riid, IID_IMultiQI) && proxy)) {
+            *ppv = nullptr;
+            return E_NOINTERFACE;
+        }
+        *ppv = this;
+        AddRef();
+        return S_OK;
+    }
+    STDMETHODIMP_(ULONG) AddRef() override { return ++refs; }
+    STDMETHODIMP_(ULONG) Release() override { return --refs; }
+    STDMETHODIMP QueryMultipleInterfaces(ULONG, MULTI_QI *) override { return E_NOTIMPL; }
+
+    bool proxy = true;
+    std::atomic<ULONG> refs{1};
+};
+} // namespace
+
+TEST(SinkReleaseTest, AClientsSinkIsLetGoAMomentLaterAndOneInThisProcessAtOnce)
+{
+    ProxyLikeSink remote, local;
+    local.proxy = false;
+    EXPECT_TRUE(SinkRelease::IsRemote(&remote));
+    EXPECT_FALSE(SinkRelease::IsRemote(&local));
+    EXPECT_EQ(remote.refs.load(), 1u) << "the question holds no reference";
+    {
+        remote.AddRef();
+        local.AddRef();
+        CSinkRef<IUnknown> a = CSinkRef<IUnknown>::Attach(&remote, true);
+        CSinkRef<IUnknown> b = CSinkRef<IUnknown>::Attach(&local, false);
+        CSinkRef<IMultiQI> copy = a.As<IMultiQI>();
+        EXPECT_EQ(remote.refs.load(), 3u);
+    }
+    EXPECT_EQ(local.refs.load(), 1u) << "released at once";
+    EXPECT_EQ(remote.refs.load(), 3u) << "both references still held a moment";
+    DWORD start = GetTickCount();
+    while (remote.refs.load() != 1 && GetTickCount() - start < 20000)
+        Sleep(10);
+    EXPECT_EQ(remote.refs.load(), 1u) << "released later, by the releaser";
 }
