@@ -202,7 +202,7 @@ void NodeSession::Subscribe(wire::In &in)
     std::wstring url = in.Text();
     if (!in.Ok())
         return;
-    if (id == kNoMember) {
+    if (wire::SubscriptionSlot(id) == UINT32_MAX) {
         if (request)
             Reply([&](wire::Out &out) {
                 out.U32(request);
@@ -210,12 +210,21 @@ void NodeSession::Subscribe(wire::In &in)
             });
         return;
     }
-    Unsubscribe(id); // an id used twice: the later subscription wins
+    // A slot used twice (the same id, or a later one of its slot): the
+    // later subscription wins.
+    uint32_t occupant;
+    {
+        std::lock_guard<SlimMutex> l(m_feedsLock);
+        occupant = Occupant(id);
+    }
+    if (occupant)
+        Unsubscribe(occupant);
     HRESULT hr = S_OK;
     uint32_t fresh = 0; // a new feed, to subscribe on the engine
     {
         std::lock_guard<SlimMutex> l(m_feedsLock);
-        uint64_t hash = wire::UrlHash(url), check = wire::UrlCheck(url);
+        uint64_t hash = wire::UrlHash(url);
+        uint32_t check = static_cast<uint32_t>(wire::UrlCheck(url));
         Feed *feed = SharedFeed(hash, check);
         if (!feed) {
             feed = NewFeed(hash, check);
@@ -262,7 +271,7 @@ NodeSession::Feed *NodeSession::FeedOf(uint32_t feedId)
     return feed.id == feedId ? &feed : nullptr;
 }
 
-NodeSession::Feed *NodeSession::SharedFeed(uint64_t hash, uint64_t check)
+NodeSession::Feed *NodeSession::SharedFeed(uint64_t hash, uint32_t check)
 {
     uint32_t handle = m_feedOfUrl.Find(hash);
     Feed *feed = handle ? &FeedAt(handle - 1) : nullptr;
@@ -276,18 +285,18 @@ void NodeSession::Unshare(Feed &feed)
 
 void NodeSession::StoreData(Feed &feed, std::string_view fields)
 {
-    if (fields.size() <= sizeof feed.data.bytes) {
-        memcpy(feed.data.bytes, fields.data(), fields.size());
-        feed.data.size = static_cast<uint8_t>(fields.size());
-        if (feed.data.isLong)
+    if (fields.size() <= sizeof feed.data) {
+        memcpy(feed.data, fields.data(), fields.size());
+        feed.dataSize = static_cast<uint8_t>(fields.size());
+        if (feed.Has(Feed::kLongData))
             m_longData.erase(wire::FeedSlot(feed.id));
-        feed.data.isLong = false;
+        feed.Set(Feed::kLongData, false);
         return;
     }
-    feed.data.size = 0;
+    feed.dataSize = 0;
     try {
         m_longData[wire::FeedSlot(feed.id)].assign(fields);
-        feed.data.isLong = true;
+        feed.Set(Feed::kLongData, true);
     } catch (const std::bad_alloc &) {
         // No memory for the text: a newcomer gets no value until the next.
         ClearData(feed);
@@ -296,18 +305,18 @@ void NodeSession::StoreData(Feed &feed, std::string_view fields)
 
 std::string_view NodeSession::DataOf(const Feed &feed) const
 {
-    if (!feed.data.isLong)
-        return {feed.data.bytes, feed.data.size};
+    if (!feed.Has(Feed::kLongData))
+        return {feed.data, feed.dataSize};
     auto found = m_longData.find(wire::FeedSlot(feed.id));
     return found != m_longData.end() ? std::string_view(found->second) : std::string_view();
 }
 
 void NodeSession::ClearData(Feed &feed)
 {
-    if (feed.data.isLong)
+    if (feed.Has(Feed::kLongData))
         m_longData.erase(wire::FeedSlot(feed.id));
-    feed.data.isLong = false;
-    feed.data.size = 0;
+    feed.Set(Feed::kLongData, false);
+    feed.dataSize = 0;
 }
 
 void NodeSession::FeedMembers::Add(uint32_t id)
@@ -334,7 +343,7 @@ void NodeSession::FeedMembers::RemoveLast()
         m_more.reset();
 }
 
-NodeSession::Feed *NodeSession::NewFeed(uint64_t hash, uint64_t check)
+NodeSession::Feed *NodeSession::NewFeed(uint64_t hash, uint32_t check)
 {
     uint32_t slot;
     try {
@@ -374,13 +383,16 @@ NodeSession::Feed *NodeSession::NewFeed(uint64_t hash, uint64_t check)
 bool NodeSession::Join(Feed &feed, uint32_t id)
 {
     // The membership first: it is what can fail for want of memory.
+    Membership *membership;
     try {
-        m_memberships.Reserve(1);
+        membership = m_memberships.PlaceSlotOf(id);
+        if (!membership)
+            return false;
         feed.members.Add(id);
     } catch (const std::bad_alloc &) {
         return false;
     }
-    m_memberships[id] = {feed.id, feed.members.Size() - 1};
+    *membership = {feed.id, feed.members.Size() - 1};
     // A newcomer hears what a new subscription would: the statuses since
     // "connecting", and once subscribed, the attributes and the value.
     for (uint8_t i = 0; i < feed.statusCount; ++i)
@@ -389,12 +401,12 @@ bool NodeSession::Join(Feed &feed, uint32_t id)
             out.U32(feed.statuses[i]);
         });
     if (feed.statusCount && feed.statuses[feed.statusCount - 1] == kCadroStatusSubscribed) {
-        if (feed.hasAttributes)
+        if (feed.Has(Feed::kHasAttributes))
             m_queue.Push(wire::Kind::Attributes, [&](wire::Out &out) {
                 out.U32(id);
-                out.Attributes(feed.attributes);
+                out.Attributes(AttributesOf(feed));
             });
-        if (!feed.data.Empty())
+        if (feed.HasData())
             m_queue.PushId(wire::Kind::Data, DataOf(feed), id);
     }
     m_queue.Push(wire::Kind::Joined, [&](wire::Out &out) {
@@ -406,18 +418,16 @@ bool NodeSession::Join(Feed &feed, uint32_t id)
 
 CadroDataItem *NodeSession::Leave(uint32_t id)
 {
-    Membership *found = m_memberships.Find(id);
+    Membership *found = MembershipOf(id);
     if (!found)
         return nullptr;
-    Membership membership = *found;
-    m_memberships.Erase(id);
+    Membership membership = std::exchange(*found, Membership());
     Feed *feed = FeedOf(membership.feed);
-    if (!feed)
-        return nullptr;
     FeedMembers &members = feed->members;
     if (membership.index + 1 < members.Size()) {
-        members[membership.index] = members[members.Size() - 1];
-        if (Membership *moved = m_memberships.Find(members[membership.index]))
+        uint32_t last = members[members.Size() - 1];
+        members[membership.index] = last;
+        if (Membership *moved = m_memberships.AtSlotOf(last))
             moved->index = membership.index;
     }
     members.RemoveLast();
@@ -431,7 +441,11 @@ CadroDataItem *NodeSession::Leave(uint32_t id)
 
 void NodeSession::DropFeed(Feed &feed)
 {
-    feed.members.ForEach([&](uint32_t member) { m_memberships.Erase(member); });
+    feed.members.ForEach([&](uint32_t member) {
+        Membership *membership = m_memberships.AtSlotOf(member);
+        if (membership && membership->feed == feed.id)
+            *membership = Membership();
+    });
     Unshare(feed);
     ClearData(feed);
     uint32_t slot = wire::FeedSlot(feed.id);
@@ -455,12 +469,39 @@ void NodeSession::Unsubscribe(uint32_t id)
 CadroDataItem *NodeSession::Find(uint32_t id)
 {
     std::lock_guard<SlimMutex> l(m_feedsLock);
-    Membership *membership = m_memberships.Find(id);
+    Membership *membership = MembershipOf(id);
     Feed *feed = membership ? FeedOf(membership->feed) : nullptr;
     if (!feed || !feed->item)
         return nullptr;
     feed->item->AddRef();
     return feed->item;
+}
+
+Membership *NodeSession::MembershipOf(uint32_t id)
+{
+    Membership *membership = m_memberships.AtSlotOf(id);
+    Feed *feed = membership ? FeedOf(membership->feed) : nullptr;
+    if (!feed || membership->index >= feed->members.Size() || feed->members[membership->index] != id)
+        return nullptr;
+    return membership;
+}
+
+uint32_t NodeSession::Occupant(uint32_t id)
+{
+    Membership *membership = m_memberships.AtSlotOf(id);
+    Feed *feed = membership ? FeedOf(membership->feed) : nullptr;
+    if (!feed || membership->index >= feed->members.Size())
+        return 0;
+    return feed->members[membership->index];
+}
+
+CadroAttributes NodeSession::AttributesOf(const Feed &feed)
+{
+    CadroAttributes attributes = {};
+    attributes.mask = feed.attributeMask;
+    attributes.access = feed.access;
+    attributes.dataType = feed.dataType;
+    return attributes;
 }
 
 void NodeSession::List(uint32_t request, const std::wstring &url)
@@ -557,9 +598,9 @@ template <class FeedIdOf, class FieldsOf> void NodeSession::TakeData(size_t coun
 
 void NodeSession::Hold(Feed &feed)
 {
-    if (feed.held)
+    if (feed.Has(Feed::kHeld))
         return;
-    feed.held = true;
+    feed.Set(Feed::kHeld, true);
     m_held.push_back(feed.id);
     m_holding = true;
 }
@@ -570,10 +611,10 @@ template <class Push> void NodeSession::PushHeld(Push &push)
         return;
     for (uint32_t id : m_held) {
         Feed *feed = FeedOf(id); // gone meanwhile: nothing to send
-        if (feed && feed->held && !feed->data.Empty())
+        if (feed && feed->Has(Feed::kHeld) && feed->HasData())
             push(wire::Kind::FeedData, DataOf(*feed), feed->id);
         if (feed)
-            feed->held = false;
+            feed->Set(Feed::kHeld, false);
     }
     m_held.clear();
     m_holding = false;
@@ -594,8 +635,10 @@ HRESULT STDMETHODCALLTYPE NodeSession::OnAttributes(void *cookie, const CadroAtt
     Feed *feed = FeedOf(IdOf(cookie));
     if (!feed)
         return S_OK;
-    feed->hasAttributes = true;
-    feed->attributes = *attributes;
+    feed->Set(Feed::kHasAttributes, true);
+    feed->attributeMask = static_cast<uint8_t>(attributes->mask);
+    feed->access = static_cast<uint8_t>(attributes->access);
+    feed->dataType = attributes->dataType;
     m_queue.Push(wire::Kind::FeedAttributes, [&](wire::Out &out) {
         out.U32(feed->id);
         out.Attributes(*attributes);
@@ -618,8 +661,8 @@ HRESULT STDMETHODCALLTYPE NodeSession::StatusChange(void *cookie, uint32_t statu
     } else if (feed->statusCount < sizeof feed->statuses) {
         feed->statuses[feed->statusCount++] = static_cast<uint8_t>(status);
     }
-    if (status == kCadroStatusSubscribeFailed && !feed->dead) {
-        feed->dead = true; // the member has gone: a newcomer asks the engine again
+    if (status == kCadroStatusSubscribeFailed && !feed->Has(Feed::kDead)) {
+        feed->Set(Feed::kDead, true); // the member has gone: a newcomer asks the engine again
         Unshare(*feed);
     }
     m_queue.Push(wire::Kind::FeedStatus, [&](wire::Out &out) {

@@ -12,6 +12,7 @@
 #include "Engine.h"
 #include "FlatMap.h"
 #include "FrameQueue.h"
+#include "Memberships.h"
 
 #include <memory>
 #include <string>
@@ -53,16 +54,6 @@ private:
     NodeSession(Engine &engine, std::shared_ptr<Channel> channel, bool fromNode, HANDLE ended);
     void ReadLoop();
     bool Handle(wire::Kind kind, wire::In &in);
-    // The last Data fields, in place: a number's or a boolean's fit (a
-    // text's are kept in the session's table of long ones, by the feed's
-    // slot: they are rare, and each feed would otherwise carry a pointer).
-    struct LastData {
-        char bytes[28];
-        uint8_t size = 0;
-        bool isLong = false;
-        bool Empty() const { return size == 0 && !isLong; }
-    };
-    static_assert(sizeof(LastData::bytes) >= wire::PackedFields::kMostBytes, "a packed value fits in place");
     // The library's ids that share a feed: nearly always one, kept in place.
     class FeedMembers {
     public:
@@ -90,33 +81,51 @@ private:
     // its own (a block's header and the pointer to it cost a fifth of it).
     // What a value reads and writes first, in the feed's first cache line.
     struct Feed {
+        enum Flag : uint8_t {
+            kHasAttributes = 1,
+            kDead = 2,     // its member has gone: a newcomer makes a new feed
+            kHeld = 4,     // a value not sent yet: the library is behind
+            kLongData = 8, // the last Data fields are in the session's table of long ones
+        };
         uint32_t id = 0;         // with its slot's generation: the engine's cookie; 0 while free
         uint16_t generation = 0; // of the slot: kept while it is free
         uint8_t statusCount = 0; // statuses since the last "connecting"
-        bool hasAttributes = false;
-        bool dead = false; // its member has gone: a newcomer makes a new feed
-        bool held = false; // a value not sent yet: the library is behind
-        LastData data;
+        uint8_t flags = 0;
         uint8_t statuses[6];
-        CadroAttributes attributes = {};
-        // The URL's two hashes: URLs that agree on both are taken as one
-        // (the URL itself is not kept: it would double the feed's size).
-        uint64_t hash = 0, check = 0;
+        // The attributes: the mask's and the access's low bytes (the network
+        // sets no other bits) and the data type.
+        uint8_t attributeMask = 0;
+        uint8_t access = 0;
+        uint16_t dataType = 0;
+        // The last Data fields, in place when a number's or a boolean's (a
+        // text's are kept in the session's table of long ones, by the
+        // feed's slot: they are rare, and each feed would otherwise carry a
+        // pointer); 0 bytes when there are none or they are long.
+        uint8_t dataSize = 0;
+        char data[wire::PackedFields::kMostBytes];
+        // The URL's two hashes, 96 bits: URLs that agree on both are taken
+        // as one (the URL itself is not kept: it would double the feed).
+        uint32_t check = 0;
+        uint64_t hash = 0;
         CadroDataItem *item = nullptr;
         FeedMembers members;
+
+        bool Has(Flag flag) const { return (flags & flag) != 0; }
+        void Set(Flag flag, bool on) { flags = on ? (flags | flag) : (flags & ~flag); }
+        bool HasData() const { return dataSize != 0 || Has(kLongData); }
     };
     static constexpr uint32_t kPageBits = 10;
     static constexpr uint32_t kPageSize = 1u << kPageBits;
-    struct Membership {
-        uint32_t feed;
-        uint32_t index; // in the feed's members
-    };
-    static constexpr uint32_t kNoMember = UINT32_MAX;
 
     void Subscribe(wire::In &in);
     void Unsubscribe(uint32_t id);
     void List(uint32_t request, const std::wstring &url);
     CadroDataItem *Find(uint32_t id);
+    // Under m_feedsLock: the membership of exactly this id, and the id that
+    // has the slot of id (0: none).
+    Membership *MembershipOf(uint32_t id);
+    uint32_t Occupant(uint32_t id);
+    static CadroAttributes AttributesOf(const Feed &feed);
     // Under m_feedsLock.
     Feed *FeedOf(uint32_t feedId);
     Feed &FeedAt(uint32_t slot) { return m_pages[slot >> kPageBits][slot & (kPageSize - 1)]; }
@@ -127,9 +136,9 @@ private:
     // stored in its feed and queued, or held in the feed while the library
     // is behind. feedIdOf(i) names the feeds to ask for ahead.
     template <class FeedIdOf, class FieldsOf> void TakeData(size_t count, FeedIdOf feedIdOf, FieldsOf fieldsOf);
-    Feed *NewFeed(uint64_t hash, uint64_t check);
+    Feed *NewFeed(uint64_t hash, uint32_t check);
     // The running feed of the URL that a newcomer joins, if any.
-    Feed *SharedFeed(uint64_t hash, uint64_t check);
+    Feed *SharedFeed(uint64_t hash, uint32_t check);
     void Unshare(Feed &feed);
     // False, and nothing changed, when memory is short.
     bool Join(Feed &feed, uint32_t id);
@@ -171,8 +180,7 @@ private:
         uint64_t operator()(uint32_t handle) const { return session->FeedAt(handle - 1).hash; }
     };
     FlatIndex<UrlHashOf> m_feedOfUrl{UrlHashOf{this}};
-    // By the library's id (one id, kNoMember, cannot be subscribed).
-    FlatMap<uint32_t, Membership, kNoMember> m_memberships;
+    Memberships m_memberships;
     FrameQueue m_queue;
     bool m_replied = false; // the reading thread's: a reply waits to be written
     std::thread m_reader;

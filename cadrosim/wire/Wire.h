@@ -51,6 +51,18 @@ constexpr uint32_t FeedSlot(uint32_t feedId)
     return (feedId & kFeedSlotMask) - 1;
 }
 
+// A subscription's id: its slot in the library's table plus one, in the low
+// bits, under a generation that tells it from an earlier subscription of the
+// slot. A library has one subscription a slot: the node keeps them by slot,
+// and a new id in a slot ends the subscription that had it.
+constexpr uint32_t kSubscriptionSlotBits = 22;
+constexpr uint32_t kSubscriptionSlotMask = (1u << kSubscriptionSlotBits) - 1;
+// The slot of a subscription's id: UINT32_MAX for an id without one.
+constexpr uint32_t SubscriptionSlot(uint32_t id)
+{
+    return (id & kSubscriptionSlotMask) - 1;
+}
+
 // The machine's node: its pipe, which every server's libraries reach.
 constexpr const wchar_t *kNodeName = L"CadroNode";
 inline std::wstring PipeNameOf(const std::wstring &nodeName)
