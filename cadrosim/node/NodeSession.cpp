@@ -479,11 +479,7 @@ CadroDataItem *NodeSession::Find(uint32_t id)
 
 Membership *NodeSession::MembershipOf(uint32_t id)
 {
-    Membership *membership = m_memberships.AtSlotOf(id);
-    Feed *feed = membership ? FeedOf(membership->feed) : nullptr;
-    if (!feed || membership->index >= feed->members.Size() || feed->members[membership->index] != id)
-        return nullptr;
-    return membership;
+    return Occupant(id) == id ? m_memberships.AtSlotOf(id) : nullptr;
 }
 
 uint32_t NodeSession::Occupant(uint32_t id)

@@ -3,6 +3,7 @@
 // IDataObject streams to an IAdviseSink (DA 1.0).
 #include "ComObject.h"
 #include "Commands.h"
+#include "DataChangeSink.h"
 #include "DataStream.h"
 #include "Format.h"
 #include "Handle.h"
@@ -55,10 +56,9 @@ private:
     std::atomic<unsigned long long> m_printed{0};
 };
 
-class DataCallback : public CComObjectRoot, public IOPCDataCallback {
+class DataCallback : public CDataChangeSink {
 public:
     explicit DataCallback(ChangePrinter &printer) : m_printer(printer) {}
-    DECLARE_COM_UNKNOWN()
 
     STDMETHODIMP OnDataChange(DWORD, OPCHANDLE, HRESULT, HRESULT, DWORD count, OPCHANDLE *clients, VARIANT *values,
                               WORD *qualities, FILETIME *times, HRESULT *errors) override
@@ -69,19 +69,8 @@ public:
             m_printer.Print(clients[i], values[i], qualities[i], times[i], errors[i]);
         return S_OK;
     }
-    STDMETHODIMP OnReadComplete(DWORD, OPCHANDLE, HRESULT, HRESULT, DWORD, OPCHANDLE *, VARIANT *, WORD *, FILETIME *,
-                                HRESULT *) override
-    {
-        return S_OK;
-    }
-    STDMETHODIMP OnWriteComplete(DWORD, OPCHANDLE, HRESULT, DWORD, OPCHANDLE *, HRESULT *) override { return S_OK; }
-    STDMETHODIMP OnCancelComplete(DWORD, OPCHANDLE) override { return S_OK; }
 
 private:
-    void *FindInterface(REFIID riid) override
-    {
-        return IsEqualIID(riid, IID_IOPCDataCallback) ? static_cast<IOPCDataCallback *>(this) : nullptr;
-    }
     ChangePrinter &m_printer;
 };
 

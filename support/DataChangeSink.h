@@ -1,7 +1,7 @@
 #pragma once
-// A benchmark's data callback: only OnDataChange does anything (the derived
-// class's); the completions of asynchronous calls, which the benchmarks do
-// not make, are taken and ignored.
+// A data callback for programs that only watch data changes: OnDataChange is
+// the derived class's; the completions of asynchronous calls, which such a
+// program does not make, are taken and ignored.
 #include "ComObject.h"
 #include "opcda.h"
 
