@@ -3,6 +3,8 @@
 #include "ComPtr.h"
 #include "OPCServer.h"
 
+#include <ocidl.h>
+
 namespace {
 HRESULT CreateServer(IUnknown *outer, REFIID riid, void **ppv)
 {
@@ -20,3 +22,25 @@ HRESULT CreateServer(IUnknown *outer, REFIID riid, void **ppv)
 } // namespace
 
 CServerClassFactory::CServerClassFactory() : CLocalClassFactory(&CreateServer) {}
+
+const ExportedInterfaces &ServerInterfaces()
+{
+    static const ExportedInterfaces interfaces = {&IID_IOPCServer,
+                                                  &IID_IOPCCommon,
+                                                  &IID_IOPCItemProperties,
+                                                  &IID_IOPCBrowseServerAddressSpace,
+                                                  &IID_IConnectionPointContainer,
+                                                  &IID_IConnectionPoint,
+                                                  &IID_IEnumConnectionPoints,
+                                                  &IID_IEnumConnections,
+                                                  &IID_IOPCGroupStateMgt,
+                                                  &IID_IOPCItemMgt,
+                                                  &IID_IOPCSyncIO,
+                                                  &IID_IOPCAsyncIO,
+                                                  &IID_IOPCAsyncIO2,
+                                                  &IID_IDataObject,
+                                                  &IID_IEnumOPCItemAttributes,
+                                                  &IID_IEnumString,
+                                                  &IID_IEnumUnknown};
+    return interfaces;
+}

@@ -5,8 +5,10 @@
 #include "ComModule.h"
 #include "CommandLine.h"
 #include "ExitWatchdog.h"
+#include "InterfaceAnchor.h"
 #include "ServerLifetime.h"
 #include "SinkRelease.h"
+#include "Trace.h"
 
 #include <objbase.h>
 
@@ -14,6 +16,13 @@ namespace {
 // Once the process has decided to exit, the rest of its exit (COM's
 // uninitialisation included) may take this long before the process is ended.
 constexpr DWORD kExitBoundMs = 5000;
+
+// Held from before the class object is registered until COM is uninitialised.
+CInterfaceAnchor &Anchor()
+{
+    static CInterfaceAnchor anchor;
+    return anchor;
+}
 
 void WaitForStep(HANDLE wake, DWORD waitMs)
 {
@@ -24,8 +33,14 @@ void WaitForStep(HANDLE wake, DWORD waitMs)
 }
 } // namespace
 
-int RunLocalServer(REFCLSID clsid, IClassFactory &factory, bool startedByCom)
+int RunLocalServer(REFCLSID clsid, IClassFactory &factory, bool startedByCom, const ExportedInterfaces &exported)
 {
+    // Without the anchor the server still serves, open to the freeze the
+    // anchor prevents (InterfaceAnchor.h): a missing proxy/stub registration
+    // is no reason to refuse clients.
+    HRESULT anchored = Anchor().Hold(exported);
+    if (FAILED(anchored))
+        Trace("not every exported interface could be anchored: 0x%08lx\n", static_cast<unsigned long>(anchored));
     // One run per process: the lifetime and the call hook stay for the
     // process's life (COM keeps the hook). Both are in place before the
     // class object is registered: a client may create an object the moment
@@ -49,11 +64,13 @@ int EndLocalServer(int exitCode)
 {
     CExitWatchdog watchdog(kExitBoundMs, static_cast<UINT>(exitCode));
     SinkRelease::Flush(); // sinks still held a moment longer go now
+    Anchor().Release();
     CoUninitialize();
     return exitCode;
 }
 
-int LocalServerMain(REFCLSID clsid, IClassFactory &factory, int (*registerServer)(), int (*unregisterServer)())
+int LocalServerMain(REFCLSID clsid, IClassFactory &factory, const ExportedInterfaces &exported, int (*registerServer)(),
+                    int (*unregisterServer)())
 {
     const char *commandLine = GetCommandLineA();
     CoInitializeEx(nullptr, COINIT_MULTITHREADED);
@@ -66,7 +83,7 @@ int LocalServerMain(REFCLSID clsid, IClassFactory &factory, int (*registerServer
         exitCode = registerServer();
         break;
     case ServerCommand::Run:
-        exitCode = RunLocalServer(clsid, factory, StartedByCom(commandLine));
+        exitCode = RunLocalServer(clsid, factory, StartedByCom(commandLine), exported);
         break;
     }
     return EndLocalServer(exitCode);

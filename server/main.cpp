@@ -9,7 +9,7 @@ int WINAPI WinMain(HINSTANCE, HINSTANCE, LPSTR, int)
 {
     static CServerClassFactory factory;
     return LocalServerMain(
-        CLSID_SkylarcOPCServer, factory, [] { return static_cast<int>(RegisterServer()); },
+        CLSID_SkylarcOPCServer, factory, ServerInterfaces(), [] { return static_cast<int>(RegisterServer()); },
         [] {
             UnregisterServer();
             return 0;

@@ -29,7 +29,10 @@ int SwitchResult(HRESULT hr)
 int WINAPI WinMain(HINSTANCE, HINSTANCE, LPSTR, int)
 {
     static CLocalClassFactory factory(&COPCServerList::Create);
+    static const ExportedInterfaces exported = {&IID_IOPCServerList, &IID_IOPCServerList2, &IID_IEnumGUID,
+                                                &IID_IOPCEnumGUID};
     return LocalServerMain(
-        CLSID_OPCServerList, factory, [] { return SwitchResult(ServerListRegistration::Register(ModulePath())); },
+        CLSID_OPCServerList, factory, exported,
+        [] { return SwitchResult(ServerListRegistration::Register(ModulePath())); },
         [] { return SwitchResult(ServerListRegistration::Unregister(ModulePath())); });
 }

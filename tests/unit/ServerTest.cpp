@@ -1,6 +1,8 @@
 #include "AsyncIOMgr.h"
+#include "ClassFactory.h"
 #include "ComModule.h"
 #include "InProcServer.h"
+#include "InterfaceAnchor.h"
 #include "ItemServices.h"
 #include "OPCGroup.h"
 #include "OpcErrors.h"
@@ -37,6 +39,41 @@ TEST(Server, ClassObjectFollowsTheCreationRules)
     EXPECT_EQ(ComModule::LockCount(), locks + 1);
     EXPECT_EQ(factory.LockServer(FALSE), S_OK);
     EXPECT_EQ(ComModule::LockCount(), locks);
+}
+
+TEST(Server, TheAnchorHoldsEveryExportedInterfaceWithoutKeepingTheServerAlive)
+{
+    LONG locks = ComModule::LockCount();
+    CInterfaceAnchor anchor;
+    ASSERT_EQ(anchor.Hold(ServerInterfaces()), S_OK); // every proxy/stub is registered
+    EXPECT_EQ(anchor.HeldCount(), ServerInterfaces().size() + 1);
+    EXPECT_EQ(ComModule::LockCount(), locks);
+
+    // A real object's stubs come and go beside the anchor's.
+    CServerClassFactory factory;
+    ComPtr<IOPCServer> server;
+    ASSERT_EQ(factory.CreateInstance(nullptr, IID_IOPCServer, reinterpret_cast<void **>(server.Out())), S_OK);
+    for (int round = 0; round < 3; ++round) {
+        IStream *raw = nullptr;
+        ASSERT_EQ(CreateStreamOnHGlobal(nullptr, TRUE, &raw), S_OK);
+        ComPtr<IStream> stream = ComPtr<IStream>::Attach(raw);
+        ASSERT_EQ(
+            CoMarshalInterface(stream.Get(), IID_IOPCServer, server.Get(), MSHCTX_LOCAL, nullptr, MSHLFLAGS_NORMAL),
+            S_OK);
+        LARGE_INTEGER start = {};
+        stream->Seek(start, STREAM_SEEK_SET, nullptr);
+        EXPECT_EQ(CoReleaseMarshalData(stream.Get()), S_OK);
+    }
+    server.Reset();
+    EXPECT_EQ(ComModule::LockCount(), locks);
+
+    // An interface without a proxy/stub fails alone; the rest stay held.
+    static const IID unknownToCom = {0x0badf00d, 0x1234, 0x5678, {1, 2, 3, 4, 5, 6, 7, 8}};
+    CInterfaceAnchor partial;
+    EXPECT_TRUE(FAILED(partial.Hold({&unknownToCom, &IID_IOPCServer})));
+    EXPECT_EQ(partial.HeldCount(), 2u);
+    partial.Release();
+    EXPECT_EQ(partial.HeldCount(), 0u);
 }
 
 TEST(Server, SharedServicesLiveWhileAnyServerObjectDoes)
