@@ -97,6 +97,11 @@ void FrameQueue::Drain(std::unique_lock<SlimMutex> &l)
         if (!channel->Write(batch))
             channel->Close(); // the reading side sees it and ends the connection
         batch.clear();
+        // A burst (the first frames of 100,000 subscriptions) leaves both
+        // buffers as large as itself; kept, they would cost as much as the
+        // subscriptions. Steady batches stay well below the bound.
+        if (batch.capacity() > kKeptBatchBytes)
+            std::string().swap(batch);
         l.lock();
     }
     m_writing = false;

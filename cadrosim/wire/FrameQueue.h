@@ -81,6 +81,8 @@ private:
     // Under l: writes batches until the queue is empty; m_writing is ours.
     void Drain(std::unique_lock<SlimMutex> &l);
 
+    static constexpr size_t kKeptBatchBytes = 1u << 20;
+
     size_t m_limit;
     SlimMutex m_lock;
     SlimCondition m_ready;
