@@ -42,8 +42,11 @@ private:
     friend class CAddrSpace;
 
     // What only branches carry: the children in ascending order of part
-    // without regard to case, and the distinct lengths of their parts, which
-    // bound the probes of a lookup step.
+    // without regard to case, and what bounds the probes of a lookup step:
+    // the distinct lengths of the branch children's parts and of the leaf
+    // children's (a leaf's part must end the identifier, so one probe at
+    // the length of the rest finds it), the separators that children have,
+    // and whether any part has none.
     //
     // And an index of the children by their parts, so that a lookup step
     // and a refresh find a child in constant time rather than by a search
@@ -57,7 +60,10 @@ private:
     // has tens of thousands, is as small as it can be.
     struct Branch {
         std::vector<AddrNodePtr> children;
-        std::vector<uint32_t> partLengths;
+        std::vector<uint32_t> branchLengths;
+        std::vector<uint32_t> leafLengths;
+        std::wstring separators;
+        bool bareParts = false;                  // a child with a part and no separator
         std::vector<Slot> index;                 // empty: search the list instead
         uint64_t refreshPass = 0;                // the call pass that last read the children
         HRESULT refreshResult = S_OK;            // and what that read gave

@@ -375,13 +375,21 @@ void CAddrSpace::Merge(const AddrNodePtr &node, std::vector<AddrNodePtr> &fresh)
     std::merge(std::make_move_iterator(kept.begin()), std::make_move_iterator(kept.end()),
                std::make_move_iterator(fresh.begin()), std::make_move_iterator(fresh.end()),
                std::back_inserter(children), PartLess);
-    std::vector<uint32_t> &lengths = node->m_branch->partLengths;
-    lengths.clear();
+    CAddrNode::Branch &branch = *node->m_branch;
+    branch.branchLengths.clear();
+    branch.leafLengths.clear();
+    branch.separators.clear();
+    branch.bareParts = false;
     for (const AddrNodePtr &child : children) {
         child->m_parent = node;
         uint32_t length = static_cast<uint32_t>(child->IdPart().size());
+        std::vector<uint32_t> &lengths = child->IsBranch() ? branch.branchLengths : branch.leafLengths;
         if (std::find(lengths.begin(), lengths.end(), length) == lengths.end())
             lengths.push_back(length);
+        if (length != 0 && !child->m_separator)
+            branch.bareParts = true;
+        if (child->m_separator && branch.separators.find(child->m_separator) == std::wstring::npos)
+            branch.separators.push_back(child->m_separator);
     }
     IndexChildren(*node);
 }
@@ -420,23 +428,34 @@ void CAddrSpace::Candidates(CAddrNode &node, std::wstring_view text, Steps &out)
         return;
     }
     // A child can be the next step only if the text begins with its
-    // separator and part: probe the part at each length that a child's part
-    // has, with and without a separator before it (through the branch's
-    // index of parts). A part without
-    // text (an implicit member) matches whatever follows, and sorts first.
-    for (uint32_t length : node.m_branch->partLengths) {
-        if (length == 0) {
-            out.Add(&children.front());
+    // separator and part: probe the part (through the branch's index of
+    // parts) with a separator before it when the text begins with one that
+    // a child has, and without when a child has none; at each length that a
+    // branch child's part has, and at the length of the whole rest for a
+    // leaf, whose part must end the identifier (any other leaf would fail
+    // the next step). A part without text (an implicit member) matches
+    // whatever follows, and sorts first.
+    const CAddrNode::Branch &branch = *node.m_branch;
+    auto has = [](const std::vector<uint32_t> &lengths, size_t length) {
+        return std::find(lengths.begin(), lengths.end(), length) != lengths.end();
+    };
+    if (has(branch.branchLengths, 0) || has(branch.leafLengths, 0))
+        out.Add(&children.front());
+    auto probe = [&](size_t separator, size_t length) {
+        if (length == 0 || text.size() < separator + length)
+            return;
+        const AddrNodePtr *child = FindPart(node, text.substr(separator, length));
+        if (child && (*child)->IdPart() == text.substr(separator, length) &&
+            (*child)->Separator() == text.substr(0, separator))
+            out.Add(child);
+    };
+    for (size_t separator = 0; separator <= 1; ++separator) {
+        if (separator == 0 ? !branch.bareParts : text.empty() || branch.separators.find(text[0]) == std::wstring::npos)
             continue;
-        }
-        for (size_t separator = 0; separator <= 1; ++separator) {
-            if (text.size() < separator + length)
-                continue;
-            const AddrNodePtr *child = FindPart(node, text.substr(separator, length));
-            if (child && (*child)->IdPart() == text.substr(separator, length) &&
-                (*child)->Separator() == text.substr(0, separator))
-                out.Add(child);
-        }
+        for (uint32_t length : branch.branchLengths)
+            probe(separator, length);
+        if (text.size() > separator && has(branch.leafLengths, text.size() - separator))
+            probe(separator, text.size() - separator);
     }
     // In list order, as the walk over every child would try them.
     std::sort(out.begin(), out.end(), std::less<const AddrNodePtr *>());

@@ -425,7 +425,10 @@ TEST(AddressSpace, IndexedLookupsFindWhatTheWalkOverEverySiblingFinds)
                                           {L"cosine-Cosine wave", L'.', true},
                                           {L"cos", L'.', true},
                                           {L"Sub", L'\\', false},
-                                          {L"a-b", L'.', true}};
+                                          {L"a-b", L'.', true},
+                                          {L"bare", 0, true}, // parts without a separator
+                                          {L"br", 0, false}};
+    net.listings[L"\\\\x\\proc1\\Objbr"] = {{L"y", L'.', true}, {L"bare", 0, true}};
     net.listings[L"\\\\x\\proc1\\Ob"] = {{L"j", L'\\', false}};
     net.listings[L"\\\\x\\proc1\\Ob\\j"] = {{L"x", L'.', true}};
     net.listings[L"\\\\x\\proc1\\Obj\\Sub"] = {{L"(implicit)", L'.', true}, {L"x", L'.', true}};
@@ -441,6 +444,11 @@ TEST(AddressSpace, IndexedLookupsFindWhatTheWalkOverEverySiblingFinds)
         L"\\\\x\\proc1\\Obj.a",        // only members split at the dash
         L"\\\\x\\proc1\\Obj.cosinex",  // past a leaf
         L"\\\\x\\proc1\\Obj.cosine.x", // past a leaf
+        L"\\\\x\\proc1\\Objbare",      // a bare leaf
+        L"\\\\x\\proc1\\Obj.bare",     // a bare part with a separator before it
+        L"\\\\x\\proc1\\Objbr.y",      // a bare branch
+        L"\\\\x\\proc1\\Objbrbare",    // and its bare leaf
+        L"\\\\x\\proc1\\Objbarex",     // past a bare leaf
         L"\\\\x\\proc1\\Obj\\Sub",     // a branch whose implicit member comes first
         L"\\\\x\\proc1\\Obj\\Sub.x",
         L"\\\\x\\proc1\\Ob\\j.x", // a sibling that is a prefix: its own subtree
