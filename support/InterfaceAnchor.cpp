@@ -2,9 +2,10 @@
 
 // The inert object: it answers a query for IUnknown or an interface it is
 // anchoring with itself (never for the ones COM asks about on its own, such
-// as IMarshal), and every method beyond IUnknown's refuses. Its stubs' marshals never leave the
-// process, so no client holds a reference through which to call them; the
-// refusal is there for a caller that guesses an interface pointer identifier.
+// as IMarshal), and every method beyond IUnknown's refuses. Its stubs'
+// marshals never leave the process, so no client holds a reference through
+// which to call them; the refusal is there for a caller that guesses an
+// interface pointer identifier.
 // One entry serves every method because the x64 calling convention leaves
 // the arguments to the caller: a method that reads none of them may stand in
 // for any signature.
@@ -76,7 +77,7 @@ HRESULT CInterfaceAnchor::HoldOne(REFIID iid)
         return hr;
     ComPtr<IStream> stream = ComPtr<IStream>::Attach(raw);
     if (!m_inert->Answers(iid))
-        m_inert->answered.push_back(iid);
+        m_inert->answered.push_back(iid); // COM queries for it while marshalling
     hr = CoMarshalInterface(stream.Get(), iid, m_inert->Unknown(), MSHCTX_LOCAL, nullptr, MSHLFLAGS_TABLESTRONG);
     if (SUCCEEDED(hr))
         m_marshals.push_back(std::move(stream));
