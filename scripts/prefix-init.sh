@@ -19,18 +19,43 @@ fi
 # script, or of a test, would wait for them.
 wineserver -p </dev/null >/dev/null 2>&1 || true
 "$RUN" cmd /c exit </dev/null >/dev/null 2>&1 || true
-"$RUN" regsvr32 /s "$BUILD_DIR/bin/SkylarcOPCProxy.dll"
+# A program start can fail on a loaded machine with Wine's "Application could
+# not be started ... ShellExecuteEx failed"; a step is tried again before the
+# setup gives up, and each step says whether it did its work.
+retry() {
+    tries=1
+    until "$@"; do
+        [ "$tries" -ge 3 ] && return 1
+        echo "prefix-init: trying again: $*" >&2
+        tries=$((tries + 1))
+        sleep 2
+    done
+}
+registered() {
+    "$RUN" reg query "HKCR\\CLSID\\$1\\LocalServer32" >/dev/null 2>&1
+}
 # The executable carries no type library, so "RegServer" writes every record
 # and then exits with the type-library failure; check the records instead.
-"$RUN" "$BUILD_DIR/bin/Local.exe" /RegServer || true
-"$RUN" reg query 'HKCR\CLSID\{5B1E7A20-4C3D-11d3-9A44-00A0C9E2B7F1}\LocalServer32' >/dev/null 2>&1 || {
-    echo "prefix-init: the server did not register" >&2
-    exit 1
+register_server() {
+    "$RUN" "$BUILD_DIR/bin/Local.exe" /RegServer || true
+    registered '{5B1E7A20-4C3D-11d3-9A44-00A0C9E2B7F1}'
 }
 # The server list registers itself only where no other server list is (exit
 # code 1 then); the prefix's own list is this one.
-"$RUN" "$BUILD_DIR/bin/SkylarcServerList.exe" /RegServer || true
-"$RUN" reg query 'HKCR\CLSID\{13486D51-4821-11D2-A494-3CB306C10000}\LocalServer32' >/dev/null 2>&1 || {
+register_server_list() {
+    "$RUN" "$BUILD_DIR/bin/SkylarcServerList.exe" /RegServer || true
+    registered '{13486D51-4821-11D2-A494-3CB306C10000}'
+}
+
+retry "$RUN" regsvr32 /s "$BUILD_DIR/bin/SkylarcOPCProxy.dll" || {
+    echo "prefix-init: the proxy/stub did not register" >&2
+    exit 1
+}
+retry register_server || {
+    echo "prefix-init: the server did not register" >&2
+    exit 1
+}
+retry register_server_list || {
     echo "prefix-init: the server list did not register" >&2
     exit 1
 }
