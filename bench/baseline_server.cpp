@@ -16,6 +16,7 @@
 // stdout, and exits once the client has released it or has ended.
 #include "ComObject.h"
 #include "ComPtr.h"
+#include "ExitWatchdog.h"
 #include "Handle.h"
 #include "OpcErrors.h"
 #include "TaskMem.h"
@@ -248,6 +249,10 @@ int main(int argc, char **argv)
     HANDLE ends[] = {released.Get(), client.Get()};
     if (status == 0)
         WaitForMultipleObjects(2, ends, FALSE, INFINITE);
+    // A client that went without releasing leaves Wine's CoUninitialize
+    // waiting forever to unregister the object's interface: the exit is
+    // bounded, as the server's is, so that no baseline outlives its bench.
+    CExitWatchdog watchdog(5000, static_cast<UINT>(status));
     CoUninitialize();
     return status;
 }
