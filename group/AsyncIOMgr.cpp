@@ -20,7 +20,7 @@ CAsyncIOMgr::~CAsyncIOMgr()
 
 HRESULT CAsyncIOMgr::Start()
 {
-    if (FAILED(m_thread.Start([this](HANDLE stop) { Run(stop); })))
+    if (FAILED(m_thread.Start(L"async I/O", [this](HANDLE stop) { Run(stop); })))
         INTERNAL_ASSERT_FAILED("transaction worker thread");
     return S_OK;
 }

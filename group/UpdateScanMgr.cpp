@@ -54,7 +54,7 @@ CUpdateScanMgr::~CUpdateScanMgr()
 
 HRESULT CUpdateScanMgr::Start()
 {
-    HRESULT hr = m_thread.Start([this](HANDLE stop) { Run(stop); });
+    HRESULT hr = m_thread.Start(L"update scanner", [this](HANDLE stop) { Run(stop); });
     if (FAILED(hr))
         INTERNAL_ASSERT_FAILED("scanner thread");
     return S_OK;

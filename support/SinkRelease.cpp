@@ -2,6 +2,7 @@
 
 #include "Handle.h"
 #include "SyncObject.h"
+#include "WorkerThread.h"
 
 #include <objbase.h>
 
@@ -30,7 +31,10 @@ public:
         }
         m_waiting.push_back({sink, GetTickCount64() + kDelayMs});
         if (!m_thread.joinable())
-            m_thread = std::thread([this] { Run(); });
+            m_thread = std::thread([this] {
+                NameThisThread(L"sink release");
+                Run();
+            });
         else if (m_waiting.size() == 1)
             SetEvent(m_wake.Get());
     }

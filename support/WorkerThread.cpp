@@ -4,8 +4,19 @@
 
 #include <objbase.h>
 
-HRESULT CWorkerThread::Start(Body body)
+void NameThisThread(const wchar_t *name)
 {
+    // Looked up, not imported: older systems lack it.
+    using Describe = HRESULT(WINAPI *)(HANDLE, PCWSTR);
+    static const auto describe = reinterpret_cast<Describe>(
+        reinterpret_cast<void *>(GetProcAddress(GetModuleHandleW(L"kernel32.dll"), "SetThreadDescription")));
+    if (describe)
+        describe(GetCurrentThread(), name);
+}
+
+HRESULT CWorkerThread::Start(const wchar_t *name, Body body)
+{
+    m_name = name;
     m_body = std::move(body);
     m_stop.Reset(CreateEventW(nullptr, TRUE, FALSE, nullptr));
     if (!m_stop)
@@ -35,6 +46,7 @@ void CWorkerThread::Stop()
 DWORD WINAPI CWorkerThread::ThreadProc(void *self)
 {
     auto *worker = static_cast<CWorkerThread *>(self);
+    NameThisThread(worker->m_name);
     // Callbacks to clients are COM calls: the thread joins the MTA.
     HRESULT hr = CoInitializeEx(nullptr, COINIT_MULTITHREADED);
     worker->m_body(worker->m_stop.Get());

@@ -5,6 +5,10 @@
 
 #include <functional>
 
+// Names the calling thread for debuggers and the system's thread list (under
+// Wine, /proc/PID/task/TID/comm).
+void NameThisThread(const wchar_t *name);
+
 class CWorkerThread {
 public:
     using Body = std::function<void(HANDLE stopEvent)>;
@@ -14,13 +18,15 @@ public:
     CWorkerThread(const CWorkerThread &) = delete;
     CWorkerThread &operator=(const CWorkerThread &) = delete;
 
-    HRESULT Start(Body body);
+    // The thread is named name (debuggers and the system's thread list show it).
+    HRESULT Start(const wchar_t *name, Body body);
     void Stop();
     DWORD ThreadId() const { return m_threadId; }
 
 private:
     static DWORD WINAPI ThreadProc(void *self);
 
+    const wchar_t *m_name = nullptr;
     Body m_body;
     UniqueHandle m_stop;
     UniqueHandle m_thread;

@@ -4,6 +4,7 @@
 
 #include "PipeChannel.h"
 #include "SocketChannel.h"
+#include "ThreadName.h"
 
 #include <utility>
 
@@ -134,7 +135,10 @@ void NodeLink::Start()
     m_state = State::Connecting;
     if (!m_wake)
         m_wake = CreateEventW(nullptr, FALSE, FALSE, nullptr);
-    m_thread = std::thread([this, generation] { Run(generation); });
+    m_thread = std::thread([this, generation] {
+        NameThisThread(L"node link");
+        Run(generation);
+    });
 }
 
 void NodeLink::Stop(std::unique_lock<SlimMutex> &l)

@@ -1,5 +1,6 @@
 #include "CadroSim.h"
 #include "Engine.h"
+#include "ThreadName.h"
 
 namespace cadrosim {
 
@@ -21,7 +22,10 @@ bool Await(HANDLE pipe, OVERLAPPED &ov, HANDLE stop, DWORD &bytes)
 
 ControlPipe::ControlPipe(Engine &engine) : m_engine(engine), m_stop(CreateEventW(nullptr, TRUE, FALSE, nullptr))
 {
-    m_thread = std::thread([this] { Run(); });
+    m_thread = std::thread([this] {
+        NameThisThread(L"control pipe");
+        Run();
+    });
 }
 
 ControlPipe::~ControlPipe()

@@ -2,6 +2,7 @@
 
 #include "Prefetch.h"
 #include "Source.h"
+#include "ThreadName.h"
 
 #include <algorithm>
 
@@ -32,7 +33,10 @@ void Shard::Start()
 {
     std::lock_guard<SlimMutex> l(lock);
     unsigned generation = ++m_generation;
-    m_thread = std::thread([this, generation] { Run(generation); });
+    m_thread = std::thread([this, generation] {
+        NameThisThread(L"shard");
+        Run(generation);
+    });
 }
 
 void Shard::Stop()

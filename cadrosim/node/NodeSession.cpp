@@ -2,6 +2,7 @@
 
 #include "Prefetch.h"
 #include "SimValue.h"
+#include "ThreadName.h"
 
 #include <cstring>
 #include <new>
@@ -64,7 +65,10 @@ NodeSession::NodeSession(Engine &engine, std::shared_ptr<Channel> channel, bool 
 {
     m_queue.SetDrainedHandler([this] { SendHeld(); });
     m_queue.Attach(m_channel);
-    m_reader = std::thread([this] { ReadLoop(); });
+    m_reader = std::thread([this] {
+        NameThisThread(L"session reader");
+        ReadLoop();
+    });
 }
 
 void NodeSession::Join()

@@ -1,5 +1,7 @@
 #include "FrameQueue.h"
 
+#include "ThreadName.h"
+
 namespace cadrosim {
 
 void FrameQueue::Attach(std::shared_ptr<Channel> channel)
@@ -10,7 +12,10 @@ void FrameQueue::Attach(std::shared_ptr<Channel> channel)
     m_stopping = false;
     m_closeWhenWritten = false;
     if (!m_thread.joinable())
-        m_thread = std::thread([this] { WriteLoop(); });
+        m_thread = std::thread([this] {
+            NameThisThread(L"frame writer");
+            WriteLoop();
+        });
 }
 
 bool FrameQueue::Queued(bool wake)

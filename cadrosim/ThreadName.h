@@ -1,0 +1,18 @@
+#pragma once
+// Names the calling thread for debuggers and the system's thread list (under
+// Wine, /proc/PID/task/TID/comm): a process's threads are told apart there.
+// SetThreadDescription is looked up, not imported: older systems lack it.
+#include <windows.h>
+
+namespace cadrosim {
+
+inline void NameThisThread(const wchar_t *name)
+{
+    using Describe = HRESULT(WINAPI *)(HANDLE, PCWSTR);
+    static const auto describe = reinterpret_cast<Describe>(
+        reinterpret_cast<void *>(GetProcAddress(GetModuleHandleW(L"kernel32.dll"), "SetThreadDescription")));
+    if (describe)
+        describe(GetCurrentThread(), name);
+}
+
+} // namespace cadrosim
