@@ -44,7 +44,7 @@ public:
         }
         m_type = type;
         memcpy(&m_data, &V_UI8(&value), sizeof m_data);
-        VariantInit(&value);
+        V_VT(&value) = VT_EMPTY; // VariantInit's whole work, without a call per update
     }
 
     // By the copy rule of CopyVariant: a failed copy leaves VT_ERROR

@@ -76,7 +76,9 @@ private:
     CSlimLock m_lock;
     // What the network writes at every update and the scan reads at every
     // period comes first, next to the lock, so that both touch few cache
-    // lines of items that are not in the cache any more.
+    // lines of items that are not in the cache any more (an update touches
+    // the first 40 bytes, the event in the lock's padding included).
+    CManualResetEvent m_valueArrived; // created unsignalled; sleeps on m_lock
     CNetworkValue m_deviceValue;
     FILETIME m_deviceTime = {};
     WORD m_deviceQuality = 0xC0;
@@ -91,7 +93,6 @@ private:
     BYTE m_accessRights = 3; // OPC_READABLE | OPC_WRITEABLE
     bool m_active = false;
     bool m_narrowTexts = false;
-    CManualResetEvent m_valueArrived; // created unsignalled; sleeps on m_lock
     CItemOwner *m_group = nullptr;
     CActiveItemList::Links m_activeLinks;
     CadroDataItem *m_dataItem = nullptr;

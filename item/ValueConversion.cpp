@@ -90,41 +90,43 @@ void SetText(VARIANT &v, const std::wstring &text)
         V_ERROR(&v) = E_OUTOFMEMORY;
     }
 }
+
+// A text value into an empty VARIANT.
+HRESULT TextToVariant(const CadroValue &value, VARIANT &out)
+{
+    std::wstring text;
+    if (value.text && !(value.type == kCadroWideText ? WideChars(value.text, text) : NarrowChars(value.text, text)))
+        return E_FAIL; // an object without the text interface of its kind
+    SetText(out, text);
+    return S_OK;
+}
 } // namespace
 
 HRESULT CadroValueToVariant(const CadroValue &value, VARIANT *out)
 {
-    VARIANT v;
-    VariantInit(&v);
-    HRESULT hr = S_OK;
-    std::wstring text;
+    // Numbers and booleans (nearly every update) are written in place,
+    // without a call into the platform.
+    if (!IsPlainVariant(*out))
+        VariantClear(out);
+    V_VT(out) = VT_EMPTY;
     switch (value.type) {
     case kCadroNoValue:
     case kCadroCleared:
-        break;
+        return S_OK;
     case kCadroBoolean:
-        V_VT(&v) = VT_BOOL;
-        V_BOOL(&v) = value.boolean ? VARIANT_TRUE : VARIANT_FALSE;
-        break;
+        V_VT(out) = VT_BOOL;
+        V_BOOL(out) = value.boolean ? VARIANT_TRUE : VARIANT_FALSE;
+        return S_OK;
     case kCadroNumber:
-        V_VT(&v) = VT_R8;
-        V_R8(&v) = value.number;
-        break;
+        V_VT(out) = VT_R8;
+        V_R8(out) = value.number;
+        return S_OK;
     case kCadroWideText:
     case kCadroNarrowText:
-        if (value.text && !(value.type == kCadroWideText ? WideChars(value.text, text) : NarrowChars(value.text, text)))
-            hr = E_FAIL; // an object without the text interface of its kind
-        else
-            SetText(v, text);
-        break;
+        return TextToVariant(value, *out);
     default:
-        hr = E_FAIL;
-        break;
+        return E_FAIL;
     }
-    if (!IsPlainVariant(*out))
-        VariantClear(out);
-    *out = v;
-    return hr;
 }
 
 HRESULT VariantToCadroValue(const VARIANT &value, CCadroValue &out)

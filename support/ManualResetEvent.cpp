@@ -1,11 +1,9 @@
 #include "ManualResetEvent.h"
 
-void CManualResetEvent::Set()
+void CManualResetEvent::Signal()
 {
-    if (!m_signalled) {
-        m_signalled = 1;
-        WakeByAddressAll(const_cast<char *>(&m_signalled));
-    }
+    m_signalled = 1;
+    WakeByAddressAll(const_cast<char *>(&m_signalled));
 }
 
 bool CManualResetEvent::Wait(CSlimLock &lock, DWORD timeoutMs)

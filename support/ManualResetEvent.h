@@ -19,11 +19,19 @@ public:
     CManualResetEvent(const CManualResetEvent &) = delete;
     CManualResetEvent &operator=(const CManualResetEvent &) = delete;
 
-    void Set();
+    // Inline: an item's event is set at every network update, and nearly
+    // always is already.
+    void Set()
+    {
+        if (!m_signalled)
+            Signal();
+    }
     void Reset() { m_signalled = 0; }
     // True when the event is (or becomes) signalled within timeoutMs.
     bool Wait(CSlimLock &lock, DWORD timeoutMs);
 
 private:
+    void Signal();
+
     volatile char m_signalled = 0;
 };
