@@ -228,6 +228,7 @@ bool Network::List(const std::wstring &url, std::vector<BrowseEntry> &out)
         return false;
     if (path.hasMember) // a member has no children
         return FindMember(url) != nullptr;
+    out.reserve(object->objects.size() + object->members.size());
     for (auto &o : object->objects)
         out.push_back(Branch(o->name));
     for (auto &m : object->members) {
@@ -237,24 +238,27 @@ bool Network::List(const std::wstring &url, std::vector<BrowseEntry> &out)
         e.leaf = true;
         e.dataType = static_cast<uint16_t>(m->type);
         e.access = static_cast<uint16_t>(m->access);
-        e.named = NamesAMember(*object, e.name);
+        e.named = NamesAMember(*object, *m);
         out.push_back(std::move(e));
     }
     return true;
 }
 
-bool Network::NamesAMember(const Object &object, const std::wstring &name)
+bool Network::NamesAMember(const Object &object, const Member &member)
 {
     // The URL is the object's and "." and the name up to its first "-" (the
     // object's own for "(implicit)"): a plain part is read back as the
     // member's name, so the object's index tells. Other parts (empty,
-    // quoted, with a separator) are left to a lookup by URL.
+    // quoted, with a separator) are left to a lookup by URL. Every listed
+    // member is in the index under its own part, so a name whose part is
+    // that one needs no lookup: a listing asks this of each of its members.
+    const std::wstring &name = member.name;
     if (name == L"(implicit)")
-        return object.memberIndex.count(std::wstring()) != 0;
-    std::wstring part = name.substr(0, name.find(L'-'));
-    if (part.empty() || part[0] == L'\'' || part.find_first_of(L"\\.") != std::wstring::npos)
+        return member.idPart.empty() || object.memberIndex.count(std::wstring()) != 0;
+    std::wstring_view part(name.data(), std::min(name.find(L'-'), name.size()));
+    if (part.empty() || part[0] == L'\'' || part.find_first_of(L"\\.") != std::wstring_view::npos)
         return false;
-    return object.memberIndex.count(part) != 0;
+    return part == member.idPart || object.memberIndex.count(std::wstring(part)) != 0;
 }
 
 Object *Network::EnsureObject(const std::wstring &objectUrl, std::wstring &error)

@@ -111,7 +111,7 @@ public:
     bool List(const std::wstring &url, std::vector<BrowseEntry> &out);
     // Whether the URL a library builds from the listed name of one of
     // object's members is known to name a member (BrowseEntry::named).
-    static bool NamesAMember(const Object &object, const std::wstring &name);
+    static bool NamesAMember(const Object &object, const Member &member);
     // The wire::CatalogueHash of every member of the machines served here,
     // as its plain spelling names it (a name that only a quoted spelling
     // reaches is left out): sorted, without repeats.
