@@ -134,12 +134,13 @@ bool CAddrSpace::ReadAheadRound(const std::vector<std::wstring_view> &itemIds, u
             return false;
         parallel = m_parallelSource;
         std::unordered_set<const CAddrNode *> chosen;
-        std::wstring_view lastParent;
+        // Each parent walked once, wherever its identifiers stand in the
+        // list: a client may add the members of many objects interleaved.
+        std::unordered_set<std::wstring_view> walked;
+        walked.reserve(itemIds.size() / 8);
         for (size_t i = 0; i < itemIds.size(); ++i) {
-            std::wstring_view parent = ParentText(itemIds[i]);
-            if (i > 0 && parent == lastParent)
+            if (!walked.insert(ParentText(itemIds[i])).second)
                 continue;
-            lastParent = parent;
             AddrNodePtr toRead;
             if (NextRead(m_root, itemIds[i], pass, toRead) == Ahead::Read && chosen.insert(toRead.get()).second) {
                 fetches.emplace_back();
