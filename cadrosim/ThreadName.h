@@ -4,6 +4,9 @@
 // SetThreadDescription is looked up, not imported: older systems lack it.
 #include <windows.h>
 
+#include <thread>
+#include <utility>
+
 namespace cadrosim {
 
 inline void NameThisThread(const wchar_t *name)
@@ -13,6 +16,15 @@ inline void NameThisThread(const wchar_t *name)
         reinterpret_cast<void *>(GetProcAddress(GetModuleHandleW(L"kernel32.dll"), "SetThreadDescription")));
     if (describe)
         describe(GetCurrentThread(), name);
+}
+
+// A thread that names itself, then runs body.
+template <class Body> std::thread NamedThread(const wchar_t *name, Body body)
+{
+    return std::thread([name, body = std::move(body)]() mutable {
+        NameThisThread(name);
+        body();
+    });
 }
 
 } // namespace cadrosim

@@ -31,31 +31,24 @@ retry() {
         sleep 2
     done
 }
-registered() {
-    "$RUN" reg query "HKCR\\CLSID\\$1\\LocalServer32" >/dev/null 2>&1
-}
-# The executable carries no type library, so "RegServer" writes every record
-# and then exits with the type-library failure; check the records instead.
-register_server() {
-    "$RUN" "$BUILD_DIR/bin/Local.exe" /RegServer || true
-    registered '{5B1E7A20-4C3D-11d3-9A44-00A0C9E2B7F1}'
-}
-# The server list registers itself only where no other server list is (exit
-# code 1 then); the prefix's own list is this one.
-register_server_list() {
-    "$RUN" "$BUILD_DIR/bin/SkylarcServerList.exe" /RegServer || true
-    registered '{13486D51-4821-11D2-A494-3CB306C10000}'
+# An executable registers itself: its exit code does not say whether it did
+# (the server's "RegServer" writes every record and then exits with the
+# missing type library's failure; the server list registers only where no
+# other server list is, with exit code 1 otherwise), so the record is read.
+register() {
+    "$RUN" "$BUILD_DIR/bin/$1" /RegServer || true
+    "$RUN" reg query "HKCR\\CLSID\\$2\\LocalServer32" >/dev/null 2>&1
 }
 
 retry "$RUN" regsvr32 /s "$BUILD_DIR/bin/SkylarcOPCProxy.dll" || {
     echo "prefix-init: the proxy/stub did not register" >&2
     exit 1
 }
-retry register_server || {
+retry register Local.exe '{5B1E7A20-4C3D-11d3-9A44-00A0C9E2B7F1}' || {
     echo "prefix-init: the server did not register" >&2
     exit 1
 }
-retry register_server_list || {
+retry register SkylarcServerList.exe '{13486D51-4821-11D2-A494-3CB306C10000}' || {
     echo "prefix-init: the server list did not register" >&2
     exit 1
 }

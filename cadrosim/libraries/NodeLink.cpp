@@ -135,10 +135,7 @@ void NodeLink::Start()
     m_state = State::Connecting;
     if (!m_wake)
         m_wake = CreateEventW(nullptr, FALSE, FALSE, nullptr);
-    m_thread = std::thread([this, generation] {
-        NameThisThread(L"node link");
-        Run(generation);
-    });
+    m_thread = NamedThread(L"node link", [this, generation] { Run(generation); });
 }
 
 void NodeLink::Stop(std::unique_lock<SlimMutex> &l)

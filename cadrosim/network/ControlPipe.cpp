@@ -22,10 +22,7 @@ bool Await(HANDLE pipe, OVERLAPPED &ov, HANDLE stop, DWORD &bytes)
 
 ControlPipe::ControlPipe(Engine &engine) : m_engine(engine), m_stop(CreateEventW(nullptr, TRUE, FALSE, nullptr))
 {
-    m_thread = std::thread([this] {
-        NameThisThread(L"control pipe");
-        Run();
-    });
+    m_thread = NamedThread(L"control pipe", [this] { Run(); });
 }
 
 ControlPipe::~ControlPipe()

@@ -33,10 +33,7 @@ void Shard::Start()
 {
     std::lock_guard<SlimMutex> l(lock);
     unsigned generation = ++m_generation;
-    m_thread = std::thread([this, generation] {
-        NameThisThread(L"shard");
-        Run(generation);
-    });
+    m_thread = NamedThread(L"shard", [this, generation] { Run(generation); });
 }
 
 void Shard::Stop()

@@ -65,10 +65,7 @@ NodeSession::NodeSession(Engine &engine, std::shared_ptr<Channel> channel, bool 
 {
     m_queue.SetDrainedHandler([this] { SendHeld(); });
     m_queue.Attach(m_channel);
-    m_reader = std::thread([this] {
-        NameThisThread(L"session reader");
-        ReadLoop();
-    });
+    m_reader = NamedThread(L"session reader", [this] { ReadLoop(); });
 }
 
 void NodeSession::Join()

@@ -12,10 +12,7 @@ void FrameQueue::Attach(std::shared_ptr<Channel> channel)
     m_stopping = false;
     m_closeWhenWritten = false;
     if (!m_thread.joinable())
-        m_thread = std::thread([this] {
-            NameThisThread(L"frame writer");
-            WriteLoop();
-        });
+        m_thread = NamedThread(L"frame writer", [this] { WriteLoop(); });
 }
 
 bool FrameQueue::Queued(bool wake)
