@@ -3,6 +3,7 @@
 #include "NodeLinkParts.h"
 
 #include "PipeChannel.h"
+#include "RingChannel.h"
 #include "SocketChannel.h"
 #include "ThreadName.h"
 
@@ -164,7 +165,7 @@ void NodeLink::Stop(std::unique_lock<SlimMutex> &l)
 
 // ---- NodeLink: the connection ----------------------------------------------------
 
-std::unique_ptr<Channel> NodeLink::Connect(bool mayStart, unsigned generation)
+std::shared_ptr<Channel> NodeLink::Connect(bool mayStart, unsigned generation)
 {
     if (!m_address.empty())
         return SocketChannel::Connect(m_address, kTcpConnectMs);
@@ -175,7 +176,7 @@ std::unique_ptr<Channel> NodeLink::Connect(bool mayStart, unsigned generation)
         HANDLE pipe = CreateFileW(wire::NodePipeName(), GENERIC_READ | GENERIC_WRITE, 0, nullptr, OPEN_EXISTING,
                                   FILE_FLAG_OVERLAPPED, nullptr);
         if (pipe != INVALID_HANDLE_VALUE)
-            return std::make_unique<PipeChannel>(pipe);
+            return RingChannel::AskForRings(std::make_shared<PipeChannel>(pipe), kStartWaitMs);
         DWORD error = GetLastError();
         if (error == ERROR_PIPE_BUSY) {
             WaitNamedPipeW(wire::NodePipeName(), 200);

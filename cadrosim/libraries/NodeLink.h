@@ -187,7 +187,7 @@ private:
     void Start();
     void Stop(std::unique_lock<SlimMutex> &l);
     void Run(unsigned generation);
-    std::unique_ptr<Channel> Connect(bool mayStart, unsigned generation);
+    std::shared_ptr<Channel> Connect(bool mayStart, unsigned generation);
     void Serve(Channel &channel);
     void Dispatch(wire::Kind kind, wire::In &in);
     // Values arrive in batches: each id's subscription (or feed's members)

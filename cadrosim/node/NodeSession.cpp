@@ -1,6 +1,8 @@
 #include "NodeSession.h"
 
+#include "PipeChannel.h"
 #include "Prefetch.h"
+#include "RingChannel.h"
 #include "SimValue.h"
 #include "ThreadName.h"
 
@@ -64,7 +66,6 @@ NodeSession::NodeSession(Engine &engine, std::shared_ptr<Channel> channel, bool 
       m_queue(kLargestBacklog)
 {
     m_queue.SetDrainedHandler([this] { SendHeld(); });
-    m_queue.Attach(m_channel);
     m_reader = NamedThread(L"session reader", [this] { ReadLoop(); });
 }
 
@@ -80,12 +81,49 @@ template <class Fill> void NodeSession::Reply(Fill fill)
     m_replied = true;
 }
 
+std::shared_ptr<Channel> NodeSession::Greet(std::string &buffer)
+{
+    auto pipe = std::dynamic_pointer_cast<PipeChannel>(m_channel);
+    if (!pipe)
+        return m_channel;
+    // The question is a frame of its kind alone, which no other frame
+    // starts like.
+    while (buffer.size() < 5)
+        if (!m_channel->Read(buffer))
+            return nullptr;
+    if (static_cast<wire::Kind>(buffer[4]) != wire::Kind::UseRings)
+        return m_channel;
+    uint32_t length;
+    memcpy(&length, buffer.data(), 4);
+    if (length != 1 || buffer.size() != 5)
+        return nullptr; // nothing may follow the question on the pipe
+    buffer.clear();
+    std::wstring name;
+    std::shared_ptr<Channel> rings = RingChannel::Make(pipe, name);
+    wire::Out out;
+    out.Begin(wire::Kind::Rings);
+    out.Text(rings ? name : L"");
+    out.End();
+    std::string answer;
+    out.Take(answer);
+    if (!pipe->Write(answer))
+        return nullptr;
+    return rings ? rings : m_channel;
+}
+
 void NodeSession::ReadLoop()
 {
     std::string buffer;
     size_t consumed = 0;
-    bool fine = true;
-    while (fine && m_channel->Read(buffer)) {
+    std::shared_ptr<Channel> stream = Greet(buffer);
+    bool fine = stream != nullptr;
+    if (fine) {
+        m_queue.Attach(stream);
+        // A closing word said before there was a channel to say it on.
+        if (m_finishing)
+            Finish();
+    }
+    while (fine) {
         fine = wire::TakeFrames(buffer, consumed, [&](wire::Kind kind, wire::In in) {
             if (fine)
                 fine = Handle(kind, in);
@@ -95,7 +133,10 @@ void NodeSession::ReadLoop()
         // a reply the writing thread writes: this one goes on reading.
         if (std::exchange(m_replied, false))
             m_queue.Flush();
+        fine = fine && stream->Read(buffer);
     }
+    if (stream)
+        stream->Close();
     m_channel->Close();
     ReleaseAll();
     m_queue.Stop(false);
@@ -526,6 +567,7 @@ void NodeSession::List(uint32_t request, const std::wstring &url)
 
 void NodeSession::Finish()
 {
+    m_finishing = true;
     m_queue.Push(wire::Kind::Closing, [](wire::Out &) {});
     m_queue.CloseWhenWritten();
 }

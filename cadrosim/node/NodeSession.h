@@ -53,6 +53,10 @@ public:
 private:
     NodeSession(Engine &engine, std::shared_ptr<Channel> channel, bool fromNode, HANDLE ended);
     void ReadLoop();
+    // A library on the node's pipe may ask first for shared rings: the
+    // channel to go on with (null: the connection ends); buffer keeps what
+    // was read and is still to be handled.
+    std::shared_ptr<Channel> Greet(std::string &buffer);
     bool Handle(wire::Kind kind, wire::In &in);
     // The library's ids that share a feed: nearly always one, kept in place.
     class FeedMembers {
@@ -165,6 +169,7 @@ private:
     bool m_fromNode;
     HANDLE m_endedEvent;
     std::atomic<bool> m_ended{false};
+    std::atomic<bool> m_finishing{false};
     SlimMutex m_feedsLock;
     std::vector<std::unique_ptr<Feed[]>> m_pages; // the feeds, by slot
     uint32_t m_slots = 0;                         // slots made so far

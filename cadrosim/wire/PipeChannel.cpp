@@ -24,8 +24,9 @@ void PipeChannel::Close()
         CancelIoEx(m_pipe, nullptr);
 }
 
-bool PipeChannel::Finish(OVERLAPPED &ov, BOOL started, DWORD &bytes)
+bool PipeChannel::Finish(OVERLAPPED &ov, BOOL started, DWORD &bytes, DWORD timeoutMs)
 {
+    const DWORD begin = GetTickCount();
     // Every call that waits is a request to the Wine server: an operation
     // done at once is taken as it is, without waiting for its event.
     if (started)
@@ -35,6 +36,8 @@ bool PipeChannel::Finish(OVERLAPPED &ov, BOOL started, DWORD &bytes)
     // A Close() between the check and the start of the operation would miss
     // it: the wait wakes up now and then to look.
     while (WaitForSingleObject(ov.hEvent, 200) == WAIT_TIMEOUT) {
+        if (timeoutMs != INFINITE && GetTickCount() - begin >= timeoutMs)
+            Close();
         if (m_closed) {
             CancelIoEx(m_pipe, &ov);
             break;
@@ -44,6 +47,11 @@ bool PipeChannel::Finish(OVERLAPPED &ov, BOOL started, DWORD &bytes)
 }
 
 bool PipeChannel::Read(std::string &buffer)
+{
+    return Read(buffer, INFINITE);
+}
+
+bool PipeChannel::Read(std::string &buffer, DWORD timeoutMs)
 {
     if (m_closed || !m_readEvent)
         return false;
@@ -57,7 +65,7 @@ bool PipeChannel::Read(std::string &buffer)
     ResetEvent(m_readEvent);
     DWORD got = 0;
     BOOL started = ReadFile(m_pipe, room, kReadChunk, &got, &ov);
-    bool ok = Finish(ov, started, got) || GetLastError() == ERROR_MORE_DATA;
+    bool ok = Finish(ov, started, got, timeoutMs) || GetLastError() == ERROR_MORE_DATA;
     if (ok)
         buffer.append(room, got);
     return ok && got > 0;

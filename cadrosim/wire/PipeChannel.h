@@ -18,11 +18,15 @@ public:
     PipeChannel &operator=(const PipeChannel &) = delete;
 
     bool Read(std::string &buffer) override;
+    // Read, given up (false, the pipe closed) after timeoutMs.
+    bool Read(std::string &buffer, DWORD timeoutMs);
     bool Write(const std::string &bytes) override;
     void Close() override;
+    bool Closed() const { return m_closed.load(std::memory_order_relaxed); }
+    HANDLE Handle() const { return m_pipe; }
 
 private:
-    bool Finish(OVERLAPPED &ov, BOOL started, DWORD &bytes);
+    bool Finish(OVERLAPPED &ov, BOOL started, DWORD &bytes, DWORD timeoutMs = INFINITE);
 
     HANDLE m_pipe;
     HANDLE m_readEvent;

@@ -23,6 +23,9 @@ enum class Kind : uint8_t {
     Execute,       // request, command
     Load,          // request, description
     Catalogue,     // request: CatalogueHash of every member this node serves
+    // The first frame on a node's pipe, and nothing after it until the
+    // answer: the rest of the connection through shared rings (RingChannel).
+    UseRings,
     // Node → library.
     Reply = 64, // request, then what the request asked for
     Data,       // flags, value, error flag, time low, time high, then ids to the end
@@ -38,6 +41,9 @@ enum class Kind : uint8_t {
     FeedData,       // as Data, with feeds for ids
     FeedAttributes, // feed, data type, access
     FeedStatus,     // feed, status
+    // The answer to UseRings, the last frame on the pipe: the rings' name,
+    // or an empty one when the connection stays on the pipe.
+    Rings,
 };
 
 // A feed's id: its slot on the node plus one, in the low bits, under a
