@@ -5,7 +5,7 @@
 //
 // Usage: cadrosim_bench [--node] [members] [subscriptions] [period-ms]
 // With --node the network is the network node's (started when none runs),
-// reached over its pipe as a server process reaches it; the processor time
+// reached over its rings as a server process reaches it; the processor time
 // of this process and of the node is printed per update.
 #include "CadroSim.h"
 #include "ProcessTimes.h"

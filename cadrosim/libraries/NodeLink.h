@@ -1,10 +1,11 @@
 #pragma once
 // The libraries' side of the network node, one per server process and shared
-// by its sessions: one pipe to the node (started when none runs), the
-// subscriptions made through it and the requests in flight. When the pipe
-// breaks, every subscription is told that the node disconnected it; the link
-// connects again (starting a node unless the last one was shut down on
-// purpose) and subscribes again to all of them.
+// by its sessions: one connection to the node (started when none runs), its
+// pipe and the shared rings set up over it, the subscriptions made through
+// it and the requests in flight. When the connection breaks, every
+// subscription is told that the node disconnected it; the link connects
+// again (starting a node unless the last one was shut down on purpose) and
+// subscribes again to all of them.
 //
 // A node reaches the machines that another machine's node serves the same
 // way, through a link to that node's TCP address (never started from here).

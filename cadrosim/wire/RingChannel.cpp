@@ -193,6 +193,11 @@ bool RingChannel::Read(std::string &buffer)
             return false;
         }
         if (ready) {
+            // A read takes at most what a pipe's would: a burst (100,000
+            // subscriptions) would otherwise grow the reader's buffer to
+            // the whole ring, and keep it.
+            ready = std::min<uint64_t>(ready, kReadChunk);
+            written = m_taken + ready;
             size_t at = static_cast<size_t>(m_taken % kRingBytes);
             size_t first = std::min<size_t>(ready, kRingBytes - at);
             buffer.append(m_inBytes + at, first);

@@ -67,8 +67,7 @@ std::string ReadAll(Channel &channel, size_t want = SIZE_MAX, bool slow = false)
 RingChannel::Header *MapHeader(const std::wstring &name, HANDLE &mapping)
 {
     mapping = OpenFileMappingW(FILE_MAP_ALL_ACCESS, FALSE, name.c_str());
-    return mapping ? static_cast<RingChannel::Header *>(MapViewOfFile(mapping, FILE_MAP_ALL_ACCESS, 0, 0, 0))
-                   : nullptr;
+    return mapping ? static_cast<RingChannel::Header *>(MapViewOfFile(mapping, FILE_MAP_ALL_ACCESS, 0, 0, 0)) : nullptr;
 }
 } // namespace
 
