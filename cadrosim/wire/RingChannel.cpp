@@ -19,6 +19,23 @@ std::wstring RingChannel::EventName(const std::wstring &name, int ring, bool roo
     return name + (room ? L"-room" : L"-data") + std::to_wstring(ring);
 }
 
+RingChannel::Shared::~Shared()
+{
+    for (HANDLE event : events)
+        if (event)
+            CloseHandle(event);
+    if (view)
+        UnmapViewOfFile(view);
+    if (mapping)
+        CloseHandle(mapping);
+}
+
+std::unique_ptr<RingChannel> RingChannel::Build(std::shared_ptr<PipeChannel> pipe, int side,
+                                                std::unique_ptr<Shared> shared)
+{
+    return std::unique_ptr<RingChannel>(new (std::nothrow) RingChannel(std::move(pipe), side, std::move(shared)));
+}
+
 std::unique_ptr<RingChannel> RingChannel::Make(std::shared_ptr<PipeChannel> pipe, std::wstring &name)
 {
     static std::atomic<unsigned> made{0};
@@ -26,60 +43,51 @@ std::unique_ptr<RingChannel> RingChannel::Make(std::shared_ptr<PipeChannel> pipe
     // the node's process id and a count) is passed over, not shared.
     for (int attempt = 0; attempt < 4; ++attempt) {
         name = L"Local\\CadroSim-rings-" + std::to_wstring(GetCurrentProcessId()) + L"-" + std::to_wstring(made++);
-        HANDLE mapping = CreateFileMappingW(INVALID_HANDLE_VALUE, nullptr, PAGE_READWRITE, 0,
-                                            static_cast<DWORD>(kMappingBytes), name.c_str());
-        if (!mapping)
+        std::unique_ptr<Shared> shared(new (std::nothrow) Shared);
+        if (!shared)
+            return nullptr;
+        shared->mapping = CreateFileMappingW(INVALID_HANDLE_VALUE, nullptr, PAGE_READWRITE, 0,
+                                             static_cast<DWORD>(kMappingBytes), name.c_str());
+        if (!shared->mapping)
             return nullptr;
         bool fresh = GetLastError() != ERROR_ALREADY_EXISTS;
-        HANDLE events[4] = {};
         for (int i = 0; i < 4 && fresh; ++i) {
-            events[i] = CreateEventW(nullptr, FALSE, FALSE, EventName(name, i / 2, i % 2).c_str());
-            fresh = events[i] && GetLastError() != ERROR_ALREADY_EXISTS;
+            shared->events[i] = CreateEventW(nullptr, FALSE, FALSE, EventName(name, i / 2, i % 2).c_str());
+            if (!shared->events[i])
+                return nullptr;
+            fresh = GetLastError() != ERROR_ALREADY_EXISTS;
         }
-        void *view = fresh ? MapViewOfFile(mapping, FILE_MAP_ALL_ACCESS, 0, 0, kMappingBytes) : nullptr;
-        if (view) {
-            auto *header = static_cast<Header *>(view);
-            header->magic = kMagic;
-            header->ringBytes = kRingBytes;
-            std::unique_ptr<RingChannel> ring(new (std::nothrow) RingChannel(pipe, 0, view, mapping, events));
-            if (ring)
-                return ring;
-            UnmapViewOfFile(view);
-        }
-        for (HANDLE event : events)
-            if (event)
-                CloseHandle(event);
-        CloseHandle(mapping);
-        if (fresh)
-            return nullptr; // not a name taken: the system refuses
+        if (!fresh)
+            continue;
+        shared->view = MapViewOfFile(shared->mapping, FILE_MAP_ALL_ACCESS, 0, 0, kMappingBytes);
+        if (!shared->view)
+            return nullptr;
+        auto *header = static_cast<Header *>(shared->view);
+        header->magic = kMagic;
+        header->ringBytes = kRingBytes;
+        return Build(std::move(pipe), 0, std::move(shared));
     }
     return nullptr;
 }
 
 std::unique_ptr<RingChannel> RingChannel::Open(std::shared_ptr<PipeChannel> pipe, const std::wstring &name)
 {
-    HANDLE mapping = OpenFileMappingW(FILE_MAP_ALL_ACCESS, FALSE, name.c_str());
-    if (!mapping)
+    std::unique_ptr<Shared> shared(new (std::nothrow) Shared);
+    if (!shared)
         return nullptr;
-    void *view = MapViewOfFile(mapping, FILE_MAP_ALL_ACCESS, 0, 0, 0);
+    shared->mapping = OpenFileMappingW(FILE_MAP_ALL_ACCESS, FALSE, name.c_str());
+    shared->view = shared->mapping ? MapViewOfFile(shared->mapping, FILE_MAP_ALL_ACCESS, 0, 0, 0) : nullptr;
     MEMORY_BASIC_INFORMATION info = {};
-    bool fits = view && VirtualQuery(view, &info, sizeof info) == sizeof info && info.RegionSize >= kMappingBytes &&
-                static_cast<Header *>(view)->magic == kMagic && static_cast<Header *>(view)->ringBytes == kRingBytes;
-    HANDLE events[4] = {};
-    for (int i = 0; i < 4 && fits; ++i) {
-        events[i] = OpenEventW(EVENT_MODIFY_STATE | SYNCHRONIZE, FALSE, EventName(name, i / 2, i % 2).c_str());
-        fits = events[i] != nullptr;
+    auto *header = static_cast<Header *>(shared->view);
+    if (!header || VirtualQuery(header, &info, sizeof info) != sizeof info || info.RegionSize < kMappingBytes ||
+        header->magic != kMagic || header->ringBytes != kRingBytes)
+        return nullptr;
+    for (int i = 0; i < 4; ++i) {
+        shared->events[i] = OpenEventW(EVENT_MODIFY_STATE | SYNCHRONIZE, FALSE, EventName(name, i / 2, i % 2).c_str());
+        if (!shared->events[i])
+            return nullptr;
     }
-    if (fits)
-        if (std::unique_ptr<RingChannel> ring{new (std::nothrow) RingChannel(pipe, 1, view, mapping, events)})
-            return ring;
-    for (HANDLE event : events)
-        if (event)
-            CloseHandle(event);
-    if (view)
-        UnmapViewOfFile(view);
-    CloseHandle(mapping);
-    return nullptr;
+    return Build(std::move(pipe), 1, std::move(shared));
 }
 
 std::shared_ptr<Channel> RingChannel::AskForRings(std::shared_ptr<PipeChannel> pipe, DWORD timeoutMs)
@@ -116,18 +124,19 @@ std::shared_ptr<Channel> RingChannel::AskForRings(std::shared_ptr<PipeChannel> p
     return Open(std::move(pipe), name);
 }
 
-RingChannel::RingChannel(std::shared_ptr<PipeChannel> pipe, int side, void *view, HANDLE mapping, HANDLE events[4])
-    : m_pipe(std::move(pipe)), m_side(side), m_header(static_cast<Header *>(view)), m_mapping(mapping),
-      m_in(m_header->rings[1 - side]), m_out(m_header->rings[side]),
-      m_inBytes(static_cast<const char *>(view) + kHeaderBytes + size_t{kRingBytes} * (1 - side)),
-      m_outBytes(static_cast<char *>(view) + kHeaderBytes + size_t{kRingBytes} * side),
-      m_inData(events[2 * (1 - side)]), m_inRoom(events[2 * (1 - side) + 1]), m_outData(events[2 * side]),
-      m_outRoom(events[2 * side + 1]), m_broken(CreateEventW(nullptr, TRUE, FALSE, nullptr))
+RingChannel::RingChannel(std::shared_ptr<PipeChannel> pipe, int side, std::unique_ptr<Shared> shared)
+    : m_pipe(std::move(pipe)), m_side(side), m_shared(std::move(shared)),
+      m_header(static_cast<Header *>(m_shared->view)), m_in(m_header->rings[1 - side]), m_out(m_header->rings[side]),
+      m_inBytes(static_cast<const char *>(m_shared->view) + kHeaderBytes + size_t{kRingBytes} * (1 - side)),
+      m_outBytes(static_cast<char *>(m_shared->view) + kHeaderBytes + size_t{kRingBytes} * side),
+      m_inData(m_shared->events[2 * (1 - side)]), m_inRoom(m_shared->events[2 * (1 - side) + 1]),
+      m_outData(m_shared->events[2 * side]), m_outRoom(m_shared->events[2 * side + 1]),
+      m_broken(CreateEventW(nullptr, TRUE, FALSE, nullptr))
 {
     // The rings are the connection's, whatever it carries: their pages are
     // brought in now (read, since the peer may be writing already), not
     // by the first burst that runs through them.
-    const volatile char *bytes = static_cast<const volatile char *>(view);
+    const volatile char *bytes = static_cast<const volatile char *>(m_shared->view);
     for (size_t at = 0; at < kMappingBytes; at += 4096)
         (void)bytes[at];
     WatchPipe();
@@ -136,15 +145,13 @@ RingChannel::RingChannel(std::shared_ptr<PipeChannel> pipe, int side, void *view
 RingChannel::~RingChannel()
 {
     Close();
+    // The read on the pipe writes into this object until it has ended.
     if (m_watching) {
         DWORD unused = 0;
         GetOverlappedResult(m_pipe->Handle(), &m_watch, &unused, TRUE);
     }
-    UnmapViewOfFile(m_header);
-    CloseHandle(m_mapping);
-    for (HANDLE event : {m_inData, m_inRoom, m_outData, m_outRoom, m_broken})
-        if (event)
-            CloseHandle(event);
+    if (m_broken)
+        CloseHandle(m_broken);
 }
 
 void RingChannel::WatchPipe()
@@ -168,17 +175,11 @@ bool RingChannel::Ended() const
            m_header->closed[1 - m_side].load(std::memory_order_acquire) != 0;
 }
 
-bool RingChannel::Sleep(HANDLE event)
+void RingChannel::Sleep(HANDLE event)
 {
     HANDLE handles[] = {event, m_broken};
     if (WaitForMultipleObjects(2, handles, FALSE, kLookAgainMs) == WAIT_OBJECT_0 + 1)
         m_peerGone = true;
-    return !Ended();
-}
-
-void RingChannel::Fail()
-{
-    Close();
 }
 
 bool RingChannel::Read(std::string &buffer)
@@ -189,7 +190,7 @@ bool RingChannel::Read(std::string &buffer)
         uint64_t written = m_in.written.load(std::memory_order_acquire);
         uint64_t ready = written - m_taken;
         if (ready > kRingBytes) {
-            Fail(); // a position no writer of ours gives
+            Close(); // a position no writer of ours gives
             return false;
         }
         if (ready) {
@@ -227,7 +228,7 @@ bool RingChannel::Write(const std::string &bytes)
         uint64_t taken = m_out.taken.load(std::memory_order_acquire);
         uint64_t used = m_written - taken;
         if (used > kRingBytes) {
-            Fail();
+            Close(); // a position no reader of ours gives
             return false;
         }
         size_t room = static_cast<size_t>(kRingBytes - used);

@@ -60,27 +60,38 @@ public:
     static constexpr uint32_t kMagic = 0x676e6952; // "Ring"
 
 private:
-    RingChannel(std::shared_ptr<PipeChannel> pipe, int side, void *view, HANDLE mapping, HANDLE events[4]);
+    // The mapping, its view and the four events (data and room of ring 0,
+    // then of ring 1), given back when it goes.
+    struct Shared {
+        HANDLE mapping = nullptr;
+        void *view = nullptr;
+        HANDLE events[4] = {};
+        ~Shared();
+    };
+    RingChannel(std::shared_ptr<PipeChannel> pipe, int side, std::unique_ptr<Shared> shared);
+    // The channel of a side over shared memory that is all there; null
+    // when memory is short.
+    static std::unique_ptr<RingChannel> Build(std::shared_ptr<PipeChannel> pipe, int side,
+                                              std::unique_ptr<Shared> shared);
     static std::wstring EventName(const std::wstring &name, int ring, bool room);
     // Starts the read on the pipe that ends when the peer goes.
     void WatchPipe();
     // Sleeps until woken through event, the connection ends, or a while
-    // passes; false once it has ended.
-    bool Sleep(HANDLE event);
+    // passes.
+    void Sleep(HANDLE event);
     // Closed here, or by the peer, or the peer gone.
     bool Ended() const;
-    // The peer wrote positions that no side of ours writes.
-    void Fail();
 
     std::shared_ptr<PipeChannel> m_pipe;
     const int m_side;
+    std::unique_ptr<Shared> m_shared;
     Header *m_header;
-    HANDLE m_mapping;
     Ring &m_in, &m_out;
     const char *m_inBytes;
     char *m_outBytes;
-    // The data event of the ring read and the room event of the ring
-    // written, which this side waits for; the other two it sets.
+    // m_shared's events: the data event of the ring read and the room
+    // event of the ring written, which this side waits for; the other two
+    // it sets.
     HANDLE m_inData, m_inRoom, m_outData, m_outRoom;
     HANDLE m_broken; // the pipe's read ended: the peer went, or Close()
     OVERLAPPED m_watch = {};
