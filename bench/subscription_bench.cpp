@@ -25,6 +25,7 @@
 #include "ClassFactory.h"
 #include "ComPtr.h"
 #include "DataChangeSink.h"
+#include "Delivery.h"
 #include "DistinctNetwork.h"
 #include "GroupState.h"
 #include "Handle.h"
@@ -138,7 +139,7 @@ void RemoveGroupOf(IOPCServer *server, Group &g)
     server->RemoveGroup(handle, TRUE);
 }
 
-struct Delivery {
+struct DeliveryFigures {
     unsigned long long items = 0;
     double seconds = 0;
     double cpuSeconds = 0;
@@ -149,7 +150,7 @@ struct Delivery {
 
 // Adds to d what the sink receives in one window, after a warm-up, and the
 // processor time the sending process uses meanwhile.
-void MeasureWindow(CountingSink *sink, HANDLE process, DWORD warmUpMs, DWORD windowMs, Delivery &d)
+void MeasureWindow(CountingSink *sink, HANDLE process, DWORD warmUpMs, DWORD windowMs, DeliveryFigures &d)
 {
     Sleep(warmUpMs);
     unsigned long long before = sink->items;
@@ -190,10 +191,10 @@ private:
     ComPtr<IOPCGroupStateMgt> m_state;
 };
 
-Delivery InProcess(IOPCServer *server, DWORD n)
+DeliveryFigures InProcess(IOPCServer *server, DWORD n)
 {
     OurGroup group(server, n);
-    Delivery d;
+    DeliveryFigures d;
     MeasureWindow(group.Sink(), GetCurrentProcess(), 500, 5000, d);
     d.stayedActive = group.Active();
     return d;
@@ -226,7 +227,7 @@ private:
     DWORD m_cookie = 0;
 };
 
-void PrintDelivery(const char *what, DWORD n, const Delivery &d)
+void PrintDelivery(const char *what, DWORD n, const DeliveryFigures &d)
 {
     printf("  %-22s N=%-6lu %10.0f items/s  %7.3f us server CPU per item%s\n", what, static_cast<unsigned long>(n),
            d.ItemsPerSecond(), d.CpuMicrosPerItem(), d.stayedActive ? "" : "  (group deactivated: deliveries failed)");
@@ -252,7 +253,7 @@ void CompareThroughCom(const std::vector<DWORD> &counts)
             printf("  the baseline server did not start\n");
             return;
         }
-        Delivery base, our;
+        DeliveryFigures base, our;
         for (int round = 0; round < kRounds; ++round) {
             baseline.Start();
             MeasureWindow(baseline.Sink(), baseline.Process(), kWarmUpMs, kWindowMs, base);
@@ -399,11 +400,12 @@ int wmain(int argc, wchar_t **argv)
         quiet.items.As(state);
         auto *group = static_cast<COPCGroup *>(state.Get());
         LONGLONG next = 0;
-        group->Scan(next);
+        Delivery columns(0);
+        group->Scan(next, columns);
         const int scans = 200;
         auto start = Clock::now();
         for (int i = 0; i < scans; ++i)
-            group->Scan(next);
+            group->Scan(next, columns);
         double ns = std::chrono::duration<double, std::nano>(Clock::now() - start).count() / (double(scans) * n);
         printf("scan cost per unchanged active item: %.1f ns (%lu items, %d scans)\n", ns,
                static_cast<unsigned long>(n), scans);
@@ -426,7 +428,7 @@ int wmain(int argc, wchar_t **argv)
         for (int i = 0; i < 50; ++i) {
             Sleep(15);
             auto t0 = Clock::now();
-            group->Scan(next);
+            group->Scan(next, columns);
             changedNs += std::chrono::duration<double, std::nano>(Clock::now() - t0).count();
         }
         printf("scan cost per changed active item: %.1f ns (%lu items, 50 scans)\n", changedNs / (50.0 * n),

@@ -8,6 +8,7 @@
 #include <vector>
 
 struct Delivery {
+    static constexpr size_t kKeptRows = 4096; // never given back below this
     std::vector<OPCHANDLE> clients;
     std::vector<VARIANT> values;
     std::vector<WORD> qualities;
@@ -39,10 +40,24 @@ struct Delivery {
     Delivery(const Delivery &) = delete;
     Delivery &operator=(const Delivery &) = delete;
 
+    void Swap(Delivery &other)
+    {
+        clients.swap(other.clients);
+        values.swap(other.values);
+        qualities.swap(other.qualities);
+        times.swap(other.times);
+        errors.swap(other.errors);
+    }
     DWORD Count() const { return static_cast<DWORD>(clients.size()); }
-    // Makes n rows for reuse; the values must be empty.
+    // Makes n rows for reuse; the values must be empty. Rows kept far
+    // beyond what is asked for (a large group's, gone since) are given back.
     void Resize(size_t n)
     {
+        if (n < values.capacity() / 4 && values.capacity() > kKeptRows) {
+            Delivery fitted(n);
+            Swap(fitted);
+            return;
+        }
         size_t old = values.size();
         clients.resize(n);
         values.resize(n);

@@ -114,8 +114,9 @@ public:
 
     // The update scan (scanner thread): delivers the changed active items;
     // next receives the next due time. FALSE when the group is inactive or
-    // delivery failed.
-    BOOL Scan(LONGLONG &next);
+    // delivery failed. columns: the scanning thread's own, lent for the
+    // scan and given back with their values emptied.
+    BOOL Scan(LONGLONG &next, Delivery &columns);
     void SetFailedScans(DWORD count);
     DWORD IncrementFailedScans();
     // A scanner entry or a transaction takes a work unit and a reference to
@@ -201,7 +202,6 @@ private:
     bool GroupActive() const override { return m_active != FALSE; }
 
     COPCItem *FindItem(OPCHANDLE handle);
-    class ScanColumns;
     // The one way into the group for a client's call: every method's body
     // runs in it, inside the COM boundary. E_FAIL once removal has begun;
     // otherwise the call counts as work in flight until it returns.
@@ -324,10 +324,6 @@ private:
     CAdvisoryConnectionMgr m_dataTimeAdvise;
     CAdvisoryConnectionMgr m_writeAdvise;
     DWORD m_failedScans = 0;
-    // The scan's columns, kept between scans: a scan of many items then
-    // neither allocates nor touches fresh pages. Taken out for a scan, so
-    // that two scans of the group can never share them.
-    std::unique_ptr<Delivery> m_scanColumns;
     bool m_destroyed = false;
     DWORD m_updateRate = 0;
     std::atomic<BOOL> m_active{FALSE}; // also read without the lock by items

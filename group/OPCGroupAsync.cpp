@@ -244,45 +244,30 @@ DWORD COPCGroup::IncrementFailedScans()
     return ++m_failedScans;
 }
 
-// Lends the group's kept columns to one scan (or makes new ones when
-// another scan has them) and takes them back, emptied, at its end.
-class COPCGroup::ScanColumns {
+namespace {
+// Empties the rows a scan used, whichever way it ends.
+class UsedRows {
 public:
-    explicit ScanColumns(COPCGroup &group) : m_group(group), m_rows(std::move(group.m_scanColumns))
-    {
-        if (!m_rows)
-            m_rows = std::make_unique<Delivery>(0);
-    }
-    ~ScanColumns()
-    {
-        m_rows->ClearValues(m_used);
-        CSingleLock lock(&m_group.m_lock);
-        if (!m_group.m_scanColumns)
-            m_group.m_scanColumns = std::move(m_rows);
-    }
-    ScanColumns(const ScanColumns &) = delete;
-    ScanColumns &operator=(const ScanColumns &) = delete;
-    Delivery &Rows(size_t n)
-    {
-        m_rows->Resize(n);
-        return *m_rows;
-    }
-    void SetUsed(size_t n) { m_used = n; }
+    explicit UsedRows(Delivery &rows) : m_rows(rows) {}
+    ~UsedRows() { m_rows.ClearValues(m_used); }
+    UsedRows(const UsedRows &) = delete;
+    UsedRows &operator=(const UsedRows &) = delete;
+    void Set(size_t n) { m_used = n; }
 
 private:
-    COPCGroup &m_group;
-    std::unique_ptr<Delivery> m_rows;
+    Delivery &m_rows;
     size_t m_used = 0;
 };
+} // namespace
 
-BOOL COPCGroup::Scan(LONGLONG &next)
+BOOL COPCGroup::Scan(LONGLONG &next, Delivery &d)
 {
     CSingleLock lock(&m_lock);
     if (!m_active)
         return FALSE;
     next = CUpdateScanMgr::Now() + static_cast<LONGLONG>(m_updateRate) * CUpdateScanMgr::TicksPerMs();
-    ScanColumns columns(*this);
-    Delivery &d = columns.Rows(m_activeItems.size());
+    d.Resize(m_activeItems.size());
+    UsedRows used(d);
     size_t n = 0;
     for (COPCItem *item : m_activeItems) {
         bool changed = false;
@@ -294,7 +279,7 @@ BOOL COPCGroup::Scan(LONGLONG &next)
     }
     if (n == 0)
         return TRUE; // nothing changed: nothing is sent
-    columns.SetUsed(n);
+    used.Set(n);
 
     HRESULT callbackResult = S_FALSE;
     CSinkRef<IOPCDataCallback> sink = m_enable ? m_callback.Sink<IOPCDataCallback>() : nullptr;

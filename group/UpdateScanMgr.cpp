@@ -1,5 +1,6 @@
 #include "UpdateScanMgr.h"
 
+#include "Delivery.h"
 #include "OPCGroup.h"
 #include "Trace.h"
 
@@ -39,7 +40,8 @@ LONGLONG CUpdateScanMgr::TicksPerMs()
     return g_time.ticksPerMs;
 }
 
-CUpdateScanMgr::CUpdateScanMgr() : m_wake(CreateEventW(nullptr, FALSE, FALSE, nullptr))
+CUpdateScanMgr::CUpdateScanMgr()
+    : m_columns(std::make_unique<Delivery>(0)), m_wake(CreateEventW(nullptr, FALSE, FALSE, nullptr))
 {
     if (!m_wake)
         INTERNAL_ASSERT_FAILED("CreateEvent for the scanner's wake event");
@@ -144,7 +146,7 @@ COPCGroup *CUpdateScanMgr::TakeAny()
 void CUpdateScanMgr::ScanOne(COPCGroup *group)
 {
     LONGLONG next = 0;
-    if (group->Scan(next)) {
+    if (group->Scan(next, *m_columns)) {
         group->SetFailedScans(0);
     } else if (group->IncrementFailedScans() >= 3) {
         // Deactivated first: the entry's reference still keeps it alive.

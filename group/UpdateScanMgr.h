@@ -6,9 +6,11 @@
 #include "RefSingleton.h"
 #include "WorkerThread.h"
 
+#include <memory>
 #include <vector>
 
 class COPCGroup;
+struct Delivery;
 
 class CUpdateScanMgr {
 public:
@@ -49,6 +51,10 @@ private:
     CCriticalSection m_lock{LockOrder::Inner};
     std::vector<Entry> m_heap;
     int m_yield = 100;
+    // The scanner thread's callback columns, lent to each scan: one set
+    // for every group rather than one kept by each (some 40 bytes an item),
+    // and a scan of many items neither allocates nor touches fresh pages.
+    std::unique_ptr<Delivery> m_columns;
     UniqueHandle m_wake;
     CWorkerThread m_thread;
 };

@@ -6,6 +6,10 @@
 // Every type whose data fits in those 8 bytes can be held. VT_DECIMAL and
 // VT_RECORD, which the network never gives, cannot: taking one leaves
 // VT_ERROR with DISP_E_TYPEMISMATCH, as a failed copy does.
+//
+// Packed to 10 bytes on 2-byte boundaries, so that an item lays its other
+// small fields where the padding would be; the data is only ever copied
+// with memcpy.
 #include "ValueConversion.h"
 #include "Variant.h"
 
@@ -13,6 +17,7 @@
 #include <cstring>
 #include <oleauto.h>
 
+#pragma pack(push, 2)
 class CNetworkValue {
 public:
     CNetworkValue() = default;
@@ -71,3 +76,5 @@ private:
     VARTYPE m_type = VT_EMPTY;
     uint64_t m_data = 0;
 };
+#pragma pack(pop)
+static_assert(sizeof(CNetworkValue) == 10, "a network value is its type and 8 bytes of data");

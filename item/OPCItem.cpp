@@ -56,8 +56,7 @@ void *COPCItem::operator new(size_t size, size_t textBytes, const std::nothrow_t
 
 COPCItem::COPCItem(const wchar_t *itemId, size_t itemIdLength, const wchar_t *accessPath, size_t accessPathLength,
                    bool narrow)
-    : m_narrowTexts(narrow), m_itemIdLength(static_cast<uint32_t>(itemIdLength)),
-      m_accessPathLength(static_cast<uint32_t>(accessPathLength))
+    : m_narrowTexts(narrow)
 {
     if (narrow) {
         Store(Texts<char>(), itemId, itemIdLength);
@@ -66,6 +65,11 @@ COPCItem::COPCItem(const wchar_t *itemId, size_t itemIdLength, const wchar_t *ac
         Store(Texts<wchar_t>(), itemId, itemIdLength);
         Store(Texts<wchar_t>() + itemIdLength + 1, accessPath, accessPathLength);
     }
+}
+
+size_t COPCItem::StoredLength(size_t offset) const
+{
+    return m_narrowTexts ? strlen(Texts<char>() + offset) : wcslen(Texts<wchar_t>() + offset);
 }
 
 wchar_t *COPCItem::CopyText(size_t offset, size_t length, void *(*allocate)(size_t)) const
@@ -99,7 +103,7 @@ HRESULT COPCItem::Init(CItemOwner *group, const OPCITEMDEF &definition, OPCITEMR
         m_serverHandle = CIdMgr::Instance().GetId();
         m_accessRights = OPC_READABLE | OPC_WRITEABLE;
         m_canonicalType = VT_EMPTY;
-        if (m_itemIdLength == 0 || !definition.szItemID)
+        if (StoredLength(0) == 0 || !definition.szItemID)
             return OPC_E_INVALIDITEMID;
         if (m_serverHandle == 0)
             return E_OUTOFMEMORY; // no identifier left for a handle
@@ -186,8 +190,9 @@ HRESULT COPCItem::GetAttributes(OPCITEMATTRIBUTES &record, void *(*allocate)(siz
 {
     CSlimLockHolder lock(&m_lock);
     memset(&record, 0, sizeof record);
-    record.szAccessPath = CopyText(m_itemIdLength + 1, m_accessPathLength, allocate);
-    record.szItemID = CopyText(0, m_itemIdLength, allocate);
+    size_t idLength = StoredLength(0);
+    record.szAccessPath = CopyText(idLength + 1, StoredLength(idLength + 1), allocate);
+    record.szItemID = CopyText(0, idLength, allocate);
     record.bActive = m_active ? TRUE : FALSE;
     record.hClient = m_clientHandle;
     record.hServer = m_serverHandle;

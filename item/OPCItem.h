@@ -64,6 +64,10 @@ private:
     // The identifier, its NUL, the access path and its NUL, after the object:
     // characters of Char (char when m_narrowTexts, else wchar_t).
     template <class Char> Char *Texts() const { return reinterpret_cast<Char *>(const_cast<COPCItem *>(this) + 1); }
+    // The length of the text at offset (in characters): the texts are
+    // kept with their terminators rather than their lengths, which only
+    // GetAttributes needs.
+    size_t StoredLength(size_t offset) const;
     // A copy of the text at offset (in characters), from allocate.
     wchar_t *CopyText(size_t offset, size_t length, void *(*allocate)(size_t)) const;
 
@@ -78,24 +82,24 @@ private:
     // period comes first, next to the lock, so that both touch few cache
     // lines of items that are not in the cache any more (an update touches
     // the first 40 bytes, the event in the lock's padding included).
+    // The fields are ordered so that no padding is left between them (the
+    // values are 10 bytes on 2-byte boundaries).
     CManualResetEvent m_valueArrived; // created unsignalled; sleeps on m_lock
+    bool m_narrowTexts = false;
     CNetworkValue m_deviceValue;
     FILETIME m_deviceTime = {};
     WORD m_deviceQuality = 0xC0;
     WORD m_lastQuality = 0x00;
     HRESULT m_lastReadResult = S_OK;
     CNetworkValue m_lastValue;
-    FILETIME m_lastTime = {};
-    OPCHANDLE m_clientHandle = 0;
-    OPCHANDLE m_serverHandle = 0;
     VARTYPE m_requestedType = VT_EMPTY;
     VARTYPE m_canonicalType = VT_EMPTY;
     BYTE m_accessRights = 3; // OPC_READABLE | OPC_WRITEABLE
     bool m_active = false;
-    bool m_narrowTexts = false;
+    FILETIME m_lastTime = {};
+    OPCHANDLE m_clientHandle = 0;
+    OPCHANDLE m_serverHandle = 0;
     CItemOwner *m_group = nullptr;
     CActiveItemList::Links m_activeLinks;
     CadroDataItem *m_dataItem = nullptr;
-    uint32_t m_itemIdLength;
-    uint32_t m_accessPathLength;
 };

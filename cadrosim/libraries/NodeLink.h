@@ -12,6 +12,7 @@
 #include "Backend.h"
 #include "FrameQueue.h"
 #include "KnownMembers.h"
+#include "LinkFeed.h"
 #include "MemberMirror.h"
 #include "Network.h"
 #include "Unknown.h"
@@ -26,37 +27,18 @@ namespace cadrosim {
 class NodeLink;
 class RemoteSubscription;
 
-// The member as the node last sent it, and the subscriptions that take its
-// frames. Every subscription is in one: the node's subscription that this
-// process's subscriptions to one URL share (the node's feed, by its id), or
-// one of its own until the node says which feed it joined (id 0). When the
-// node drops a feed, each member goes on with a copy of its own; the last
-// member to leave a feed deletes it. The link's, under its lock.
-struct LinkFeed {
-    uint32_t id = 0; // the node's feed; 0: not the node's
-    MemberMirror mirror;
-    // The members: the first in place (nearly every URL has one
-    // subscription), any others in an array, each knowing its place. A value
-    // walks them from one array rather than from member to member: a feed
-    // with thousands of members would chase a pointer into each.
-    RemoteSubscription *first = nullptr;
-    std::unique_ptr<std::vector<RemoteSubscription *>> others;
-    bool Alone() const { return !others || others->empty(); }
-    template <class F> void ForEachMember(F f) const;
-};
-
 // A subscription through the node; the CadroDataItem its holder keeps.
 class RemoteSubscription : public CSimUnknown<CadroDataItem> {
 public:
-    static RemoteSubscription *Create(uint8_t link, const wchar_t *url, ICadroRealTimeReceiver *receiver, void *cookie);
+    static RemoteSubscription *Create(uint8_t link, ICadroRealTimeReceiver *receiver, void *cookie);
     void Delete();
 
     HRESULT STDMETHODCALLTYPE Write(const CadroValue *value) override;
     HRESULT STDMETHODCALLTYPE Read(uint32_t *flags, CadroValue *value, int32_t *errorFlag, FILETIME *time) override;
     void LastRelease() override;
 
-    // The URL, kept to subscribe again after a reconnection.
-    std::wstring Url() const;
+    // Under the link's lock: the URL (its feed's).
+    std::wstring Url() const { return feed->Url(); }
 
     // Under the link's lock: the member as the node last sent it (its
     // feed's).
@@ -110,31 +92,15 @@ public:
     }
 
 private:
-    RemoteSubscription(uint8_t link, ICadroRealTimeReceiver *r, void *c, const wchar_t *url, size_t length,
-                       bool narrow);
+    RemoteSubscription(uint8_t link, ICadroRealTimeReceiver *r, void *c);
     NodeLink &Link() const;
     ~RemoteSubscription() override;
-    static void *operator new(size_t size, size_t urlBytes);
-    static void operator delete(void *p);
-    // The URL is kept behind the object, in the same block: a byte a
-    // character when it is ASCII (URLs nearly always are), else two.
-    uint32_t m_urlLength;
     std::atomic<uint16_t> m_calling{0};
     std::atomic<bool> m_forgotten{false};
-    bool m_urlNarrow;
     uint8_t m_link; // NodeLink::At
     std::atomic<DWORD> m_callingThread{0};
     std::atomic<uint32_t> m_pins{1};
 };
-
-template <class F> void LinkFeed::ForEachMember(F f) const
-{
-    if (first)
-        f(first);
-    if (others)
-        for (RemoteSubscription *sub : *others)
-            f(sub);
-}
 
 class NodeLink final : public Backend {
 public:

@@ -75,11 +75,10 @@ void NodeLink::Join(uint32_t id, uint32_t feedId)
         return;
     }
     if (!feed) {
-        feed = new (std::nothrow) LinkFeed();
+        feed = LinkFeed::CopyOf(*current);
         if (!feed)
             return; // the subscription goes on in the feed it has
         feed->id = feedId;
-        feed->mirror.CopyFrom(current->mirror);
     }
     LinkFeed &joined = *feed;
     // Room first: short of memory, the subscription stays where it is.
@@ -149,11 +148,10 @@ void NodeLink::Unshare(LinkFeed &feed)
     // it still when memory is short).
     feed.id = 0;
     while (!feed.Alone()) {
-        auto *own = new (std::nothrow) LinkFeed();
+        LinkFeed *own = LinkFeed::CopyOf(feed);
         if (!own)
             return;
         RemoteSubscription *sub = feed.others->back();
-        own->mirror.CopyFrom(feed.mirror);
         RemoveMember(sub);
         AddMember(*own, sub);
     }

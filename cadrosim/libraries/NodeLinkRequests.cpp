@@ -51,11 +51,11 @@ HRESULT NodeLink::Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeRece
     if (!out || !receiver || !url)
         return E_POINTER;
     *out = nullptr;
-    RemoteSubscription *sub = RemoteSubscription::Create(m_index, url, receiver, cookie);
+    RemoteSubscription *sub = RemoteSubscription::Create(m_index, receiver, cookie);
     if (!sub)
         return E_OUTOFMEMORY;
     // Its own feed holds what the node tells it until it joins the node's.
-    auto *own = new (std::nothrow) LinkFeed();
+    LinkFeed *own = LinkFeed::Create(url);
     std::unique_lock<SlimMutex> l(m_lock);
     bool connected = WaitConnected(l, false);
     if (!own || !Register(sub)) {

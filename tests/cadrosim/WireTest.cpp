@@ -5,12 +5,14 @@
 #include "FlatMap.h"
 #include "HashSet64.h"
 #include "KnownMembers.h"
+#include "LinkFeed.h"
 #include "Network.h"
 
 #include <gtest/gtest.h>
 
 #include <algorithm>
 #include <cstring>
+#include <memory>
 #include <random>
 #include <unordered_map>
 #include <vector>
@@ -336,4 +338,40 @@ TEST(Wire, TheCatalogueNamesWhatPlainSpellingsReachAndNothingElse)
     // Four members, each under the host's name and under ".", once.
     EXPECT_EQ(catalogue.size(), 8u);
     EXPECT_TRUE(std::is_sorted(catalogue.begin(), catalogue.end()));
+}
+
+TEST(Wire, AFeedKeepsItsUrlAndACopyTakesItWithTheMembersState)
+{
+    // The URL lives in the feed's block, a byte a character when it is
+    // ASCII: it must come back whole either way, and in a copy (the copies
+    // that members take when the node drops a feed subscribe again by it).
+    for (std::wstring url : {std::wstring(L"\\\\HOST\\proc1\\Setpoints.temperature"),
+                             std::wstring(L"\\\\HOST\\Anlage\\Kessel\u00e4.Druck\u4e2d"),
+                             std::wstring(L"\\\\HOST\\p\\o.") + std::wstring(10000, L'x'), std::wstring()}) {
+        std::unique_ptr<LinkFeed> feed(LinkFeed::Create(url.c_str()));
+        ASSERT_TRUE(feed);
+        EXPECT_EQ(feed->Url(), url);
+        CadroValue value = {};
+        value.type = kCadroNumber;
+        value.number = 42.5;
+        feed->id = 7;
+        feed->mirror.Remember(kCadroHasValue | kCadroHasQuality | kCadroHasTime, value, 1, 11, 22);
+
+        std::unique_ptr<LinkFeed> copy(LinkFeed::CopyOf(*feed));
+        ASSERT_TRUE(copy);
+        EXPECT_EQ(copy->Url(), url);
+        EXPECT_EQ(copy->id, 0u);
+        EXPECT_EQ(copy->first, nullptr);
+        EXPECT_TRUE(copy->Alone());
+        uint32_t flags = 0;
+        CadroValue recalled = {};
+        int32_t error = 0;
+        FILETIME time = {};
+        ASSERT_EQ(copy->mirror.Recall(&flags, &recalled, &error, &time), S_OK);
+        EXPECT_EQ(recalled.type, kCadroNumber);
+        EXPECT_EQ(recalled.number, 42.5);
+        EXPECT_NE(error, 0);
+        EXPECT_EQ(time.dwLowDateTime, 11u);
+        EXPECT_EQ(time.dwHighDateTime, 22u);
+    }
 }

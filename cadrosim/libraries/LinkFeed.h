@@ -1,0 +1,66 @@
+#pragma once
+// The member as the node last sent it, its URL, and the subscriptions that
+// take its frames. Every subscription is in one: the node's subscription
+// that this process's subscriptions to one URL share (the node's feed, by
+// its id), or one of its own until the node says which feed it joined (id
+// 0). When the node drops a feed, each member goes on with a copy of its
+// own; the last member to leave a feed deletes it. The link's, under its
+// lock.
+//
+// The URL is the feed's rather than each subscription's: a plant's items
+// follow one member many times over, and it is kept only to subscribe again
+// after a reconnection. It follows the feed in the same block, a byte a
+// character when it is ASCII (URLs nearly always are), else two.
+#include "MemberMirror.h"
+
+#include <cstdint>
+#include <memory>
+#include <string>
+#include <vector>
+
+namespace cadrosim {
+
+class RemoteSubscription;
+
+class LinkFeed {
+public:
+    // A feed of url without members; null when memory is short.
+    static LinkFeed *Create(const wchar_t *url);
+    // A feed of other's URL and member state, without members or id.
+    static LinkFeed *CopyOf(const LinkFeed &other);
+    static void operator delete(void *block) { ::operator delete(block); }
+    LinkFeed(const LinkFeed &) = delete;
+    LinkFeed &operator=(const LinkFeed &) = delete;
+
+    std::wstring Url() const;
+    bool Alone() const { return !others || others->empty(); }
+    template <class F> void ForEachMember(F f) const;
+
+    uint32_t id = 0; // the node's feed; 0: not the node's
+    MemberMirror mirror;
+    // The members: the first in place (nearly every URL has one
+    // subscription), any others in an array, each knowing its place. A value
+    // walks them from one array rather than from member to member: a feed
+    // with thousands of members would chase a pointer into each.
+    RemoteSubscription *first = nullptr;
+    std::unique_ptr<std::vector<RemoteSubscription *>> others;
+
+private:
+    LinkFeed(uint32_t urlLength, bool narrow) : m_urlLength(urlLength), m_urlNarrow(narrow) {}
+    static LinkFeed *Make(size_t length, bool narrow);
+    char *Stored() const { return reinterpret_cast<char *>(const_cast<LinkFeed *>(this) + 1); }
+
+    uint32_t m_urlLength;
+    bool m_urlNarrow;
+};
+
+template <class F> void LinkFeed::ForEachMember(F f) const
+{
+    if (first)
+        f(first);
+    if (others)
+        for (RemoteSubscription *sub : *others)
+            f(sub);
+}
+
+} // namespace cadrosim
