@@ -5,10 +5,12 @@
 #include "OpcErrors.h"
 #include "Variant.h"
 
+#include <algorithm>
 #include <vector>
 
 struct Delivery {
-    static constexpr size_t kKeptRows = 4096; // never given back below this
+    static constexpr size_t kKeptRows = 4096;      // never given back below this
+    static constexpr unsigned kShrinkCheck = 1000; // scans between two looks
     std::vector<OPCHANDLE> clients;
     std::vector<VARIANT> values;
     std::vector<WORD> qualities;
@@ -49,14 +51,19 @@ struct Delivery {
         errors.swap(other.errors);
     }
     DWORD Count() const { return static_cast<DWORD>(clients.size()); }
-    // Makes n rows for reuse; the values must be empty. Rows kept far
-    // beyond what is asked for (a large group's, gone since) are given back.
+    // Makes n rows for reuse; the values must be empty. Rows that no call
+    // has needed for kShrinkCheck calls (a large group's, gone since) are
+    // given back: a large group scanned in turn with small ones keeps them.
     void Resize(size_t n)
     {
-        if (n < values.capacity() / 4 && values.capacity() > kKeptRows) {
-            Delivery fitted(n);
-            Swap(fitted);
-            return;
+        m_peak = std::max(m_peak, n);
+        if (++m_calls == kShrinkCheck) {
+            if (m_peak < values.capacity() / 4 && values.capacity() > kKeptRows) {
+                Delivery fitted(m_peak);
+                Swap(fitted);
+            }
+            m_calls = 0;
+            m_peak = n;
         }
         size_t old = values.size();
         clients.resize(n);
@@ -85,4 +92,8 @@ struct Delivery {
                 return S_FALSE;
         return S_OK;
     }
+
+private:
+    size_t m_peak = 0;    // the most rows asked for since the last look
+    unsigned m_calls = 0; // calls since then
 };
