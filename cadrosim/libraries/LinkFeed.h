@@ -10,7 +10,9 @@
 // The URL is the feed's rather than each subscription's: a plant's items
 // follow one member many times over, and it is kept only to subscribe again
 // after a reconnection. It follows the feed in the same block, a byte a
-// character when it is ASCII (URLs nearly always are), else two.
+// character when it is ASCII (URLs nearly always are), else two. Members
+// that the node put in one feed name one member, whatever their spelling:
+// they subscribe again by the feed's.
 #include "MemberMirror.h"
 
 #include <cstdint>
