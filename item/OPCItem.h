@@ -81,7 +81,7 @@ private:
     // What the network writes at every update and the scan reads at every
     // period comes first, next to the lock, so that both touch few cache
     // lines of items that are not in the cache any more (an update touches
-    // the first 40 bytes, the event in the lock's padding included).
+    // the first 32 bytes, the event in the lock's padding included).
     // The fields are ordered so that no padding is left between them (the
     // values are 10 bytes on 2-byte boundaries).
     CManualResetEvent m_valueArrived; // created unsignalled; sleeps on m_lock

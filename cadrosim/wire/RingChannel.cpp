@@ -182,17 +182,24 @@ void RingChannel::Sleep(HANDLE event)
         m_peerGone = true;
 }
 
+bool RingChannel::Span(uint64_t ahead, uint64_t behind, uint64_t &bytes)
+{
+    bytes = ahead - behind;
+    if (bytes <= kRingBytes)
+        return true;
+    Close();
+    return false;
+}
+
 bool RingChannel::Read(std::string &buffer)
 {
     for (;;) {
         if (m_closed.load(std::memory_order_relaxed) || m_pipe->Closed())
             return false;
         uint64_t written = m_in.written.load(std::memory_order_acquire);
-        uint64_t ready = written - m_taken;
-        if (ready > kRingBytes) {
-            Close(); // a position no writer of ours gives
+        uint64_t ready;
+        if (!Span(written, m_taken, ready))
             return false;
-        }
         if (ready) {
             // A read takes at most what a pipe's would: a burst (100,000
             // subscriptions) would otherwise grow the reader's buffer to
@@ -226,11 +233,9 @@ bool RingChannel::Write(const std::string &bytes)
         if (Ended())
             return false;
         uint64_t taken = m_out.taken.load(std::memory_order_acquire);
-        uint64_t used = m_written - taken;
-        if (used > kRingBytes) {
-            Close(); // a position no reader of ours gives
+        uint64_t used;
+        if (!Span(m_written, taken, used))
             return false;
-        }
         size_t room = static_cast<size_t>(kRingBytes - used);
         if (room) {
             size_t n = std::min(room, bytes.size() - done);

@@ -79,6 +79,10 @@ private:
     // Sleeps until woken through event, the connection ends, or a while
     // passes.
     void Sleep(HANDLE event);
+    // The bytes from behind to ahead, two positions of a ring; false (and
+    // the channel closed) when they claim more than a ring holds, which no
+    // side of ours ever writes.
+    bool Span(uint64_t ahead, uint64_t behind, uint64_t &bytes);
     // Closed here, or by the peer, or the peer gone.
     bool Ended() const;
 
