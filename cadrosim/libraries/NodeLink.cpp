@@ -227,13 +227,13 @@ void NodeLink::Run(unsigned generation)
                 m_state = State::Connected;
                 m_mayStartNode = true;
                 // Every subscription again, under the same identifiers.
-                for (RemoteSubscription *sub : m_slots)
-                    if (sub)
-                        Send(wire::Kind::Subscribe, [&](wire::Out &out) {
-                            out.U32(0);
-                            out.U32(sub->id);
-                            out.Text(sub->Url());
-                        });
+                m_subs.ForEach([&](RemoteSubscription *sub) {
+                    Send(wire::Kind::Subscribe, [&](wire::Out &out) {
+                        out.U32(0);
+                        out.U32(sub->id);
+                        out.Text(sub->Url());
+                    });
+                });
             } else if (mayStart == m_mayStartNode) {
                 m_state = State::Down;
                 m_lastFailure = GetTickCount();
@@ -279,9 +279,10 @@ void NodeLink::Disconnected()
         DropFeeds(); // the node's feeds are the connection's
         // Told once, however often a connection fails before the node is
         // back.
-        for (RemoteSubscription *sub : m_slots)
-            if (sub && sub->Connected())
+        m_subs.ForEach([&](RemoteSubscription *sub) {
+            if (sub->Connected())
                 ids.push_back(sub->id);
+        });
     }
     m_changed.notify_all();
     for (uint32_t id : ids)

@@ -15,6 +15,7 @@
 #include "LinkFeed.h"
 #include "MemberMirror.h"
 #include "Network.h"
+#include "SlotTable.h"
 #include "Unknown.h"
 
 #include <memory>
@@ -27,10 +28,17 @@ namespace cadrosim {
 class NodeLink;
 class RemoteSubscription;
 
-// A subscription through the node; the CadroDataItem its holder keeps.
+// A subscription through the node; the CadroDataItem its holder keeps. It
+// lives in its link's table (SlotTable.h), which the link's Subscribe makes
+// it in.
 class RemoteSubscription : public CSimUnknown<CadroDataItem> {
 public:
-    static RemoteSubscription *Create(uint8_t link, ICadroRealTimeReceiver *receiver, void *cookie);
+    // In storage from the link's table: receiver already has a reference
+    // for it, and the link a use.
+    RemoteSubscription(uint8_t link, ICadroRealTimeReceiver *r, void *c) : receiver(r), cookie(c), m_link(link) {}
+    ~RemoteSubscription() override = default;
+    // Ends it: its place goes back to the link, its receiver's reference
+    // and the link's use with it.
     void Delete();
 
     HRESULT STDMETHODCALLTYPE Write(const CadroValue *value) override;
@@ -69,9 +77,11 @@ public:
     template <class Call> void Deliver(Call call, std::atomic<int> &waiters, SlimMutex &lock, SlimCondition &returned)
     {
         m_calling.fetch_add(1);
-        m_callingThread.store(GetCurrentThreadId(), std::memory_order_relaxed);
-        if (!m_forgotten.load())
-            call(*this);
+        {
+            Calling here(this);
+            if (!m_forgotten.load())
+                call(*this);
+        }
         m_calling.fetch_sub(1);
         if (waiters.load() != 0) {
             // Under the lock, so that a holder between its check and its
@@ -81,26 +91,40 @@ public:
             returned.notify_all();
         }
     }
-    // Under the lock: no calls from now on. Returned() tells when a call
-    // already under way is over (one of this thread's own, further up its
-    // stack, does not count).
+    // Under the lock: no calls from now on. Returned() tells when the calls
+    // under way on other threads are over (this thread's own, further up
+    // its stack, do not count).
     void Forgotten() { m_forgotten.store(true); }
     bool IsForgotten() const { return m_forgotten.load(); }
-    bool Returned() const
-    {
-        return m_calling.load() == 0 || m_callingThread.load(std::memory_order_relaxed) == GetCurrentThreadId();
-    }
+    bool Returned() const { return m_calling.load() == Calling::OnThisThread(this); }
 
 private:
-    RemoteSubscription(uint8_t link, ICadroRealTimeReceiver *r, void *c);
+    // The calls under way on a thread, innermost first, each on its
+    // caller's stack: a thread may call a holder that lets go of another
+    // subscription, or of the one it is being called for.
+    class Calling {
+    public:
+        explicit Calling(const RemoteSubscription *sub) : m_sub(sub), m_outer(t_innermost) { t_innermost = this; }
+        ~Calling() { t_innermost = m_outer; }
+        Calling(const Calling &) = delete;
+        Calling &operator=(const Calling &) = delete;
+        static unsigned OnThisThread(const RemoteSubscription *sub);
+
+    private:
+        static thread_local Calling *t_innermost;
+        const RemoteSubscription *m_sub;
+        Calling *m_outer;
+    };
+
     NodeLink &Link() const;
-    ~RemoteSubscription() override;
     std::atomic<uint16_t> m_calling{0};
     std::atomic<bool> m_forgotten{false};
     uint8_t m_link; // NodeLink::At
-    std::atomic<DWORD> m_callingThread{0};
     std::atomic<uint32_t> m_pins{1};
 };
+// A place in the table a subscription: its holder, the holder's cookie and
+// its feed, and small counts.
+static_assert(sizeof(void *) != 8 || sizeof(RemoteSubscription) == 56, "a subscription is 56 bytes");
 
 class NodeLink final : public Backend {
 public:
@@ -119,6 +143,8 @@ public:
 
     HRESULT Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeReceiver *receiver, CadroDataItem **out) override;
     void Unsubscribe(RemoteSubscription *sub);
+    // Without the lock: sub, unpinned by all, goes (RemoteSubscription::Delete).
+    void Destroy(RemoteSubscription *sub);
     HRESULT Write(RemoteSubscription *sub, const CadroValue *value);
     HRESULT Read(RemoteSubscription *sub, uint32_t *flags, CadroValue *value, int32_t *errorFlag, FILETIME *time);
     bool Browse(const std::wstring &url, std::vector<BrowseEntry> &out) override;
@@ -216,10 +242,11 @@ private:
     bool WaitConnected(std::unique_lock<SlimMutex> &l, bool forAnswer);
     bool OnLinkThread() const { return GetCurrentThreadId() == m_linkThreadId; }
 
-    // Under m_lock.
-    uint32_t Register(RemoteSubscription *sub);
-    void Unregister(RemoteSubscription *sub);
-    RemoteSubscription *Lookup(uint32_t id) const;
+    // Under m_lock: a new subscription in the table (null when it is full
+    // or memory is short), the table's of id, one out of the table.
+    RemoteSubscription *NewSubscription(ICadroRealTimeReceiver *receiver, void *cookie);
+    RemoteSubscription *Lookup(uint32_t id) const { return m_subs.Find(id); }
+    void Unregister(RemoteSubscription *sub) { m_subs.Leave(sub->id); }
     template <class Fill> bool Send(wire::Kind kind, Fill fill);
     // Sends a request and waits for its reply (its fields after the request
     // number); false when the node did not answer.
@@ -241,9 +268,7 @@ private:
     DWORD m_lastFailure = 0; // when an attempt to connect last failed
     std::shared_ptr<Channel> m_channel;
     FrameQueue m_queue;
-    std::vector<RemoteSubscription *> m_slots;
-    std::vector<uint16_t> m_generations;
-    std::vector<uint32_t> m_freeSlots;
+    SlotTable<RemoteSubscription, wire::kSubscriptionSlotBits> m_subs;
     std::vector<LinkFeed *> m_feeds; // by the node's slot of the feed
     uint32_t m_nextRequest = 0;
     std::unordered_map<uint32_t, Pending *> m_pending;

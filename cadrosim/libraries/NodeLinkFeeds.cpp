@@ -7,41 +7,30 @@
 namespace cadrosim {
 using namespace link; // the link's own limits and waits
 
-uint32_t NodeLink::Register(RemoteSubscription *sub)
+RemoteSubscription *NodeLink::NewSubscription(ICadroRealTimeReceiver *receiver, void *cookie)
 {
-    uint32_t slot;
-    if (!m_freeSlots.empty()) {
-        slot = m_freeSlots.back();
-        m_freeSlots.pop_back();
-    } else {
-        // The last slot is left out: an id of all ones is none to the node.
-        if (m_slots.size() + 1 >= kSlotMask)
-            return 0;
-        slot = static_cast<uint32_t>(m_slots.size());
-        m_slots.push_back(nullptr);
-        m_generations.push_back(0);
-    }
-    m_slots[slot] = sub;
-    // The generation tells a new subscription from an older one of the
-    // same slot whose values may still be on their way.
-    sub->id = (static_cast<uint32_t>(m_generations[slot] & 0x3ff) << kSlotBits) | (slot + 1);
-    return sub->id;
-}
-
-void NodeLink::Unregister(RemoteSubscription *sub)
-{
-    uint32_t slot = (sub->id & kSlotMask) - 1;
-    m_slots[slot] = nullptr;
-    ++m_generations[slot];
-    m_freeSlots.push_back(slot);
-}
-
-RemoteSubscription *NodeLink::Lookup(uint32_t id) const
-{
-    uint32_t slot = (id & kSlotMask) - 1;
-    if (slot >= m_slots.size() || !m_slots[slot] || m_slots[slot]->id != id)
+    uint32_t id;
+    void *place = m_subs.Take(id);
+    if (!place)
         return nullptr;
-    return m_slots[slot];
+    auto *sub = new (place) RemoteSubscription(m_index, receiver, cookie);
+    sub->id = id;
+    return sub;
+}
+
+void NodeLink::Destroy(RemoteSubscription *sub)
+{
+    const uint32_t id = sub->id;
+    ICadroRealTimeReceiver *receiver = sub->receiver;
+    sub->~RemoteSubscription();
+    {
+        std::lock_guard<SlimMutex> l(m_lock);
+        m_subs.Give(id);
+    }
+    // Outside the lock: the receiver's last reference may end its owner,
+    // which may call the library again.
+    receiver->Release();
+    ReleaseUse();
 }
 
 LinkFeed *NodeLink::FeedOf(uint32_t feedId) const

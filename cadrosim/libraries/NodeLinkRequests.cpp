@@ -51,20 +51,24 @@ HRESULT NodeLink::Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeRece
     if (!out || !receiver || !url)
         return E_POINTER;
     *out = nullptr;
-    RemoteSubscription *sub = RemoteSubscription::Create(m_index, receiver, cookie);
-    if (!sub)
-        return E_OUTOFMEMORY;
     // Its own feed holds what the node tells it until it joins the node's.
-    LinkFeed *own = LinkFeed::Create(url);
+    std::unique_ptr<LinkFeed> own(LinkFeed::Create(url));
+    if (!own)
+        return E_OUTOFMEMORY;
+    // The subscription's reference and use, taken before the lock: a first
+    // use starts the link.
+    receiver->AddRef();
+    AddUse();
     std::unique_lock<SlimMutex> l(m_lock);
     bool connected = WaitConnected(l, false);
-    if (!own || !Register(sub)) {
+    RemoteSubscription *sub = NewSubscription(receiver, cookie);
+    if (!sub) {
         l.unlock();
-        delete own;
-        sub->Delete();
+        receiver->Release();
+        ReleaseUse();
         return E_OUTOFMEMORY;
     }
-    AddMember(*own, sub);
+    AddMember(*own.release(), sub);
     if (!connected) {
         // The node is away: the subscription waits for it, as one on a
         // disconnected machine does.

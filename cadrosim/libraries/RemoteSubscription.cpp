@@ -1,34 +1,24 @@
 // A subscription through the node: what its holder calls, passed to its link.
 #include "NodeLinkParts.h"
 
-#include <new>
-
 namespace cadrosim {
 using namespace link; // the link's own limits and waits
 
 // ---- RemoteSubscription ------------------------------------------------------
 
-RemoteSubscription *RemoteSubscription::Create(uint8_t link, ICadroRealTimeReceiver *receiver, void *cookie)
-{
-    return new (std::nothrow) RemoteSubscription(link, receiver, cookie);
-}
+thread_local RemoteSubscription::Calling *RemoteSubscription::Calling::t_innermost = nullptr;
 
-RemoteSubscription::RemoteSubscription(uint8_t link, ICadroRealTimeReceiver *r, void *c)
-    : receiver(r), cookie(c), m_link(link)
+unsigned RemoteSubscription::Calling::OnThisThread(const RemoteSubscription *sub)
 {
-    receiver->AddRef();
-    Link().AddUse();
+    unsigned count = 0;
+    for (const Calling *c = t_innermost; c; c = c->m_outer)
+        count += c->m_sub == sub;
+    return count;
 }
 
 NodeLink &RemoteSubscription::Link() const
 {
     return NodeLink::At(m_link);
-}
-
-RemoteSubscription::~RemoteSubscription()
-{
-    receiver->Release();
-    Link().ReleaseUse();
 }
 
 HRESULT RemoteSubscription::Recall(uint32_t *flags, CadroValue *value, int32_t *errorFlag, FILETIME *time) const
@@ -38,7 +28,7 @@ HRESULT RemoteSubscription::Recall(uint32_t *flags, CadroValue *value, int32_t *
 
 void RemoteSubscription::Delete()
 {
-    delete this;
+    Link().Destroy(this);
 }
 
 HRESULT STDMETHODCALLTYPE RemoteSubscription::Write(const CadroValue *value)

@@ -7,6 +7,7 @@
 #include "KnownMembers.h"
 #include "LinkFeed.h"
 #include "Network.h"
+#include "SlotTable.h"
 
 #include <gtest/gtest.h>
 
@@ -374,4 +375,71 @@ TEST(Wire, AFeedKeepsItsUrlAndACopyTakesItWithTheMembersState)
         EXPECT_EQ(time.dwLowDateTime, 11u);
         EXPECT_EQ(time.dwHighDateTime, 22u);
     }
+}
+
+TEST(Wire, ASlotTableFindsWhatIsInItAndTellsAReusedSlotFromItsPredecessor)
+{
+    struct Thing {
+        uint64_t value;
+    };
+    // The fewest bits of slot that leave a generation of at most 15 bits:
+    // ids 1 .. kMask - 1 (all ones is none).
+    constexpr uint32_t kBits = 17, kMask = (1u << kBits) - 1;
+    SlotTable<Thing, kBits> table;
+    std::vector<uint32_t> ids;
+    for (;;) {
+        uint32_t id = 0;
+        void *place = table.Take(id);
+        if (!place)
+            break;
+        new (place) Thing{ids.size()};
+        ids.push_back(id);
+    }
+    ASSERT_EQ(ids.size(), kMask - 1);
+    EXPECT_EQ(ids.front() & kMask, 1u);
+    EXPECT_EQ(ids.back() & kMask, kMask - 1);
+    for (uint32_t id : ids)
+        ASSERT_EQ(table.Find(id)->value, (id & kMask) - 1);
+    EXPECT_EQ(table.Find(0), nullptr);
+    EXPECT_EQ(table.Find(kMask), nullptr);
+    EXPECT_EQ(table.Find(ids[3] ^ (1u << kBits)), nullptr) << "another generation of the slot";
+
+    // Out of the table: no longer found, not listed, its place still taken.
+    table.Leave(ids[3]);
+    EXPECT_EQ(table.Find(ids[3]), nullptr);
+    size_t listed = 0;
+    table.ForEach([&](Thing *thing) {
+        EXPECT_NE(thing->value, 3u);
+        ++listed;
+    });
+    EXPECT_EQ(listed, kMask - 2);
+    uint32_t none = 0;
+    EXPECT_EQ(table.Take(none), nullptr);
+
+    // Given back, the slot serves again under the next generation; a
+    // value for the old id finds nothing.
+    table.Give(ids[3]);
+    uint32_t again = 0;
+    void *place = table.Take(again);
+    ASSERT_NE(place, nullptr);
+    new (place) Thing{99};
+    EXPECT_EQ(again & kMask, ids[3] & kMask);
+    EXPECT_NE(again, ids[3]);
+    EXPECT_EQ(table.Find(ids[3]), nullptr);
+    EXPECT_EQ(table.Find(again)->value, 99u);
+    ids[3] = again;
+
+    // Every place back: the blocks go, and the slots start over in a new
+    // generation, so that no id given before is found.
+    for (uint32_t id : ids) {
+        table.Leave(id);
+        table.Give(id);
+    }
+    EXPECT_EQ(table.Live(), 0u);
+    uint32_t fresh = 0;
+    ASSERT_NE(table.Take(fresh), nullptr);
+    EXPECT_EQ(fresh & kMask, 1u);
+    for (uint32_t id : ids)
+        EXPECT_EQ(table.Find(id), nullptr);
+    EXPECT_NE(table.Find(fresh), nullptr);
 }
