@@ -24,6 +24,11 @@ struct ReceivedStream {
 
 class TestAdviseSink : public IAdviseSink {
 public:
+    TestAdviseSink() = default;
+    TestAdviseSink(const TestAdviseSink &) = delete;
+    TestAdviseSink &operator=(const TestAdviseSink &) = delete;
+    // Its stubs go with it (see TestSink).
+    ~TestAdviseSink() { CoDisconnectObject(static_cast<IAdviseSink *>(this), 0); }
     STDMETHODIMP QueryInterface(REFIID riid, void **ppv) override
     {
         if (IsEqualIID(riid, IID_IUnknown) || IsEqualIID(riid, IID_IAdviseSink)) {

@@ -27,6 +27,14 @@ struct Callback {
 
 class TestSink : public IOPCDataCallback {
 public:
+    TestSink() = default;
+    TestSink(const TestSink &) = delete;
+    TestSink &operator=(const TestSink &) = delete;
+    // A sink lives in its test, often on the stack, while a server may not
+    // have let go of it yet (it releases sinks on a thread of its own): its
+    // stubs go now, so that a late release finds nothing rather than a
+    // destroyed object.
+    ~TestSink() { CoDisconnectObject(static_cast<IOPCDataCallback *>(this), 0); }
     STDMETHODIMP QueryInterface(REFIID riid, void **ppv) override;
     STDMETHODIMP_(ULONG) AddRef() override { return ++m_refs; }
     STDMETHODIMP_(ULONG) Release() override { return --m_refs; } // lives in the test
