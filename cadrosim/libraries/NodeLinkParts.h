@@ -8,8 +8,6 @@ namespace cadrosim {
 namespace link {
 inline const HRESULT kUnknownUrl = HRESULT_FROM_WIN32(ERROR_NOT_FOUND);
 inline const HRESULT kNotConnected = HRESULT_FROM_WIN32(ERROR_NOT_CONNECTED);
-inline constexpr uint32_t kSlotBits = wire::kSubscriptionSlotBits;
-inline constexpr uint32_t kSlotMask = wire::kSubscriptionSlotMask;
 // How long a request waits for a node that is being started, and for an
 // answer: generous, since a node may be busy with a large listing.
 inline constexpr DWORD kStartWaitMs = 15000;
