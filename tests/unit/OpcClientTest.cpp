@@ -144,9 +144,9 @@ TEST(OpcClient, ArgumentsAndHowValuesAreShown)
 
 TEST(OpcClient, OnlyAServerThatStoppedOrVanishedIsAskedAgain)
 {
-    for (HRESULT transient :
-         {CO_E_SERVER_STOPPING, HRESULT_FROM_WIN32(RPC_S_SERVER_UNAVAILABLE), HRESULT_FROM_WIN32(RPC_S_CALL_FAILED),
-          HRESULT_FROM_WIN32(RPC_S_CALL_FAILED_DNE), RPC_E_DISCONNECTED, E_NOINTERFACE})
+    for (HRESULT transient : {CO_E_SERVER_STOPPING, HRESULT_FROM_WIN32(RPC_S_SERVER_UNAVAILABLE),
+                              HRESULT_FROM_WIN32(RPC_S_CALL_FAILED), HRESULT_FROM_WIN32(RPC_S_CALL_FAILED_DNE),
+                              RPC_E_DISCONNECTED, E_NOINTERFACE, HRESULT_FROM_WIN32(ERROR_NOACCESS)})
         EXPECT_TRUE(Connection::IsTransient(transient)) << std::hex << transient;
     for (HRESULT final : {S_OK, REGDB_E_CLASSNOTREG, E_ACCESSDENIED, E_OUTOFMEMORY, CO_E_SERVER_EXEC_FAILURE, E_FAIL})
         EXPECT_FALSE(Connection::IsTransient(final)) << std::hex << final;

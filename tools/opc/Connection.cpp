@@ -112,6 +112,9 @@ bool Connection::IsTransient(HRESULT hr)
     case HRESULT_FROM_WIN32(RPC_S_CALL_FAILED_DNE):
     case RPC_E_DISCONNECTED:
     case E_NOINTERFACE: // the process that was starting for it went away
+    // Wine's COM runtime in a server started beside another now and then
+    // faults while it serves the client's first call; the server serves on.
+    case HRESULT_FROM_WIN32(ERROR_NOACCESS):
         return true;
     default:
         return false;
