@@ -80,18 +80,28 @@ bool ReadTextFile(const std::wstring &path, std::wstring &text)
     return true;
 }
 
-Subscription::Subscription(std::shared_ptr<Member> m, ICadroRealTimeReceiver *r, void *c)
-    : member(std::move(m)), receiver(r), cookie(c)
+Subscription::Subscription(std::shared_ptr<Member> m, ICadroRealTimeReceiver *r, BatchReceiver *batch, void *c)
+    : member(std::move(m)), cookie(c),
+      m_target(batch ? reinterpret_cast<uintptr_t>(batch) | kBatched : reinterpret_cast<uintptr_t>(r))
 {
-    receiver->AddRef();
+    static_assert(sizeof(Subscription) <= 56, "a subscription fills a 64-byte block of the heap");
+    static_assert(alignof(BatchReceiver) > kBatched, "a batch interface's address leaves the tag bit free");
+    r->AddRef();
     Engine::Instance().AddUse();
 }
 
 Subscription::~Subscription()
 {
-    if (receiver)
+    if (ICadroRealTimeReceiver *receiver = TakeReceiver())
         receiver->Release();
     Engine::Instance().ReleaseUse();
+}
+
+ICadroRealTimeReceiver *Subscription::TakeReceiver()
+{
+    ICadroRealTimeReceiver *receiver = Receiver();
+    m_target = 0;
+    return receiver;
 }
 
 HRESULT STDMETHODCALLTYPE Subscription::Write(const CadroValue *value)
@@ -296,10 +306,9 @@ HRESULT Engine::Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeReceiv
             receiver->StatusChange(cookie, status, 0, 0);
         return kUnknownUrl;
     }
-    auto *sub = new (std::nothrow) Subscription(member, receiver, cookie);
+    auto *sub = new (std::nothrow) Subscription(member, receiver, batch, cookie);
     if (!sub)
         return E_OUTOFMEMORY;
-    sub->batch = batch;
     Shard &shard = *member->shard;
     {
         std::lock_guard<SlimMutex> l(shard.lock);
@@ -327,8 +336,7 @@ void Engine::Unsubscribe(Subscription *sub)
     case Shard::Disposal::AfterQueue: {
         // Nothing calls it any more: its receiver is let go now, only the
         // memory waits for the queue.
-        ICadroRealTimeReceiver *receiver = sub->receiver;
-        sub->receiver = nullptr;
+        ICadroRealTimeReceiver *receiver = sub->TakeReceiver();
         l.unlock();
         receiver->Release();
         return;

@@ -44,14 +44,19 @@ struct DataEntry {
 class BatchReceiver {
 public:
     virtual void OnDataBatch(const DataEntry *entries, size_t count) = 0;
+    // The receiver whose batches these are.
+    virtual ICadroRealTimeReceiver *Receiver() = 0;
 
 protected:
     ~BatchReceiver() = default;
 };
 
-// One subscription; it is the CadroDataItem the subscriber holds.
+// One subscription; it is the CadroDataItem the subscriber holds. A node
+// holds one for each member that a library subscribed to: it is kept to
+// 56 bytes, a 64-byte block of the heap.
 struct Subscription : CSimUnknown<CadroDataItem> {
-    Subscription(std::shared_ptr<Member> member, ICadroRealTimeReceiver *receiver, void *cookie);
+    // batch: the receiver's batch interface, when it has one.
+    Subscription(std::shared_ptr<Member> member, ICadroRealTimeReceiver *receiver, BatchReceiver *batch, void *cookie);
     ~Subscription() override;
 
     HRESULT STDMETHODCALLTYPE Write(const CadroValue *value) override;
@@ -66,9 +71,27 @@ struct Subscription : CSimUnknown<CadroDataItem> {
     uint32_t queued = 0; // events of it in the shard's queue
     uint32_t slot = 0;   // its place in the member's subscriptions
     std::shared_ptr<Member> member;
-    ICadroRealTimeReceiver *receiver;
-    BatchReceiver *batch = nullptr; // the receiver's, when it takes batches
     void *cookie;
+
+    // Whom it calls (null once it has let go of its receiver), and the
+    // receiver's batch interface when it takes batches.
+    ICadroRealTimeReceiver *Receiver() const
+    {
+        BatchReceiver *batch = Batch();
+        return batch ? batch->Receiver() : reinterpret_cast<ICadroRealTimeReceiver *>(m_target);
+    }
+    BatchReceiver *Batch() const
+    {
+        return (m_target & kBatched) ? reinterpret_cast<BatchReceiver *>(m_target & ~kBatched) : nullptr;
+    }
+    // Lets go of the receiver: the caller releases it.
+    ICadroRealTimeReceiver *TakeReceiver();
+
+private:
+    // The receiver, or its batch interface (which names it) with kBatched
+    // set: one pointer either way.
+    static constexpr uintptr_t kBatched = 1;
+    uintptr_t m_target;
 };
 
 // Open: the whole answer to a subscription on a connected machine (contacted,

@@ -347,13 +347,14 @@ void Shard::DeliverTick()
         if (sub->dead)
             continue;
         const Computed &c = m_values[index];
-        if (!sub->batch) {
-            sub->receiver->OnData(sub->cookie, kFlags, &c.value, c.error, c.low, c.high);
+        BatchReceiver *subBatch = sub->Batch();
+        if (!subBatch) {
+            sub->Receiver()->OnData(sub->cookie, kFlags, &c.value, c.error, c.low, c.high);
             continue;
         }
-        if (sub->batch != batch) {
+        if (subBatch != batch) {
             flush();
-            batch = sub->batch;
+            batch = subBatch;
         }
         m_entries.push_back({sub->cookie, &c.value, c.error, c.low, c.high});
     }
@@ -373,10 +374,10 @@ void Shard::Dispatch(std::unique_lock<SlimMutex> &l, Event e)
                  {kCadroStatusConnecting, kCadroStatusContacted, kCadroStatusSubscribing, kCadroStatusSubscribed}) {
                 if (sub->dead)
                     return;
-                sub->receiver->StatusChange(sub->cookie, status, 0, 0);
+                sub->Receiver()->StatusChange(sub->cookie, status, 0, 0);
             }
             if (!sub->dead)
-                sub->receiver->OnAttributes(sub->cookie, &a);
+                sub->Receiver()->OnAttributes(sub->cookie, &a);
         });
         if (sub->dead)
             return;
@@ -387,12 +388,12 @@ void Shard::Dispatch(std::unique_lock<SlimMutex> &l, Event e)
     case EventKind::Status:
         if (e.status == kCadroStatusDisconnected)
             sub->active = false;
-        Deliver(l, [&] { sub->receiver->StatusChange(sub->cookie, e.status, 0, 0); });
+        Deliver(l, [&] { sub->Receiver()->StatusChange(sub->cookie, e.status, 0, 0); });
         return;
     case EventKind::Attributes: {
         CadroAttributes a;
         Attributes(m, a);
-        Deliver(l, [&] { sub->receiver->OnAttributes(sub->cookie, &a); });
+        Deliver(l, [&] { sub->Receiver()->OnAttributes(sub->cookie, &a); });
         return;
     }
     case EventKind::Activate:
@@ -409,8 +410,8 @@ void Shard::Dispatch(std::unique_lock<SlimMutex> &l, Event e)
         Split(m.time, low, high);
         Deliver(l, [&] {
             if (!sub->dead)
-                sub->receiver->OnData(sub->cookie, kCadroHasValue | kCadroHasQuality | kCadroHasTime, &value, error,
-                                      low, high);
+                sub->Receiver()->OnData(sub->cookie, kCadroHasValue | kCadroHasQuality | kCadroHasTime, &value, error,
+                                        low, high);
         });
         ClearCadroValue(value);
         return;

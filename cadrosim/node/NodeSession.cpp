@@ -149,12 +149,18 @@ void NodeSession::ReleaseAll()
     std::vector<CadroDataItem *> items;
     {
         std::lock_guard<SlimMutex> l(m_feedsLock);
-        for (uint32_t slot = 0; slot < m_slots; ++slot)
-            if (CadroDataItem *item = FeedAt(slot).item)
-                items.push_back(item);
-        m_pages.clear();
-        m_slots = 0;
-        m_freeFeeds.clear();
+        std::vector<uint32_t> feeds;
+        m_feeds.ForEach([&](Feed *feed) {
+            if (feed->item)
+                items.push_back(feed->item);
+            feeds.push_back(feed->id);
+        });
+        // The table's blocks go with its last feed.
+        for (uint32_t id : feeds) {
+            m_feeds.Leave(id);
+            m_feeds.Give(id);
+        }
+        m_moreMembers.clear();
         m_longData.clear();
         m_feedOfUrl.Clear();
         m_memberships.Clear();
@@ -304,25 +310,18 @@ void NodeSession::Subscribe(wire::In &in)
         });
 }
 
-NodeSession::Feed *NodeSession::FeedOf(uint32_t feedId)
-{
-    uint32_t slot = wire::FeedSlot(feedId); // beyond every slot for id 0
-    if (slot >= m_slots)
-        return nullptr;
-    Feed &feed = FeedAt(slot);
-    return feed.id == feedId ? &feed : nullptr;
-}
-
 NodeSession::Feed *NodeSession::SharedFeed(uint64_t hash, uint32_t check)
 {
-    uint32_t handle = m_feedOfUrl.Find(hash);
-    Feed *feed = handle ? &FeedAt(handle - 1) : nullptr;
-    return feed && feed->id && feed->check == check ? feed : nullptr;
+    // Every feed the index holds is in the table: a feed leaves the index
+    // before it leaves the table.
+    uint32_t id = m_feedOfUrl.Find(hash);
+    Feed *feed = id ? FeedOf(id) : nullptr;
+    return feed && feed->check == check ? feed : nullptr;
 }
 
 void NodeSession::Unshare(Feed &feed)
 {
-    m_feedOfUrl.Erase(wire::FeedSlot(feed.id) + 1, feed.hash);
+    m_feedOfUrl.Erase(feed.id, feed.hash);
 }
 
 void NodeSession::StoreData(Feed &feed, std::string_view fields)
@@ -361,65 +360,65 @@ void NodeSession::ClearData(Feed &feed)
     feed.dataSize = 0;
 }
 
-void NodeSession::FeedMembers::Add(uint32_t id)
+uint32_t &NodeSession::MemberAt(Feed &feed, uint32_t index)
 {
-    if (m_count == 0) {
-        m_first = id;
-        m_count = 1;
-        return;
-    }
-    if (!m_more)
-        m_more = std::make_unique<std::vector<uint32_t>>();
-    m_more->push_back(id); // an empty array left behind by a failure is harmless
-    ++m_count;
+    return index == 0 ? feed.members.first : m_moreMembers.find(feed.id)->second[index - 1];
 }
 
-void NodeSession::FeedMembers::RemoveLast()
+void NodeSession::AddMember(Feed &feed, uint32_t id)
 {
-    if (m_count == 0)
+    if (feed.members.count == 0) {
+        feed.members = {id, 1};
         return;
-    if (--m_count == 0)
+    }
+    m_moreMembers[feed.id].push_back(id); // an empty array left behind by a failure is harmless
+    ++feed.members.count;
+}
+
+void NodeSession::RemoveLastMember(Feed &feed)
+{
+    if (feed.members.count == 0)
         return;
-    m_more->pop_back();
-    if (m_more->empty())
-        m_more.reset();
+    if (--feed.members.count == 0)
+        return;
+    auto more = m_moreMembers.find(feed.id);
+    more->second.pop_back();
+    if (more->second.empty())
+        m_moreMembers.erase(more);
+}
+
+template <class Each> void NodeSession::ForEachMember(const Feed &feed, Each each)
+{
+    if (feed.members.count == 0)
+        return;
+    each(feed.members.first);
+    if (feed.members.count > 1)
+        for (uint32_t id : m_moreMembers.find(feed.id)->second)
+            each(id);
 }
 
 NodeSession::Feed *NodeSession::NewFeed(uint64_t hash, uint32_t check)
 {
-    uint32_t slot;
     try {
         // Room first, so that nothing below can fail half-way.
         m_feedOfUrl.Reserve(1);
-        if (!m_freeFeeds.empty()) {
-            slot = m_freeFeeds.back();
-            m_freeFeeds.pop_back();
-        } else {
-            if (m_slots >= wire::kFeedSlotMask)
-                return nullptr;
-            // The free list can then take every slot without growing.
-            if (m_freeFeeds.capacity() <= m_slots)
-                m_freeFeeds.reserve(2 * (m_slots + 1));
-            if (m_slots % kPageSize == 0) {
-                m_pages.reserve(m_pages.size() + 1);
-                m_pages.push_back(std::make_unique<Feed[]>(kPageSize));
-            }
-            slot = m_slots++;
-        }
     } catch (const std::bad_alloc &) {
         return nullptr;
     }
-    Feed &feed = FeedAt(slot);
-    // The generation tells the feed from an earlier one of the slot whose
-    // engine subscription may still be calling.
-    feed.generation++;
-    feed.id = (static_cast<uint32_t>(feed.generation & 0x7ff) << wire::kFeedSlotBits) | (slot + 1);
-    feed.hash = hash;
-    feed.check = check;
+    // The slot's generation in the id tells the feed from an earlier one of
+    // the slot whose engine subscription may still be calling.
+    uint32_t id;
+    void *place = m_feeds.Take(id);
+    if (!place)
+        return nullptr;
+    Feed *feed = new (place) Feed();
+    feed->id = id;
+    feed->hash = hash;
+    feed->check = check;
     // Another live feed of a URL with the same hash keeps its place (room
     // was made above).
-    m_feedOfUrl.Insert(slot + 1, hash);
-    return &feed;
+    m_feedOfUrl.Insert(id, hash);
+    return feed;
 }
 
 bool NodeSession::Join(Feed &feed, uint32_t id)
@@ -430,11 +429,11 @@ bool NodeSession::Join(Feed &feed, uint32_t id)
         membership = m_memberships.PlaceSlotOf(id);
         if (!membership)
             return false;
-        feed.members.Add(id);
+        AddMember(feed, id);
     } catch (const std::bad_alloc &) {
         return false;
     }
-    *membership = {feed.id, feed.members.Size() - 1};
+    *membership = {feed.id, feed.members.count - 1};
     // A newcomer hears what a new subscription would: the statuses since
     // "connecting", and once subscribed, the attributes and the value.
     for (uint8_t i = 0; i < feed.statusCount; ++i)
@@ -465,15 +464,15 @@ CadroDataItem *NodeSession::Leave(uint32_t id)
         return nullptr;
     Membership membership = std::exchange(*found, Membership());
     Feed *feed = FeedOf(membership.feed);
-    FeedMembers &members = feed->members;
-    if (membership.index + 1 < members.Size()) {
-        uint32_t last = members[members.Size() - 1];
-        members[membership.index] = last;
+    uint32_t count = feed->members.count;
+    if (membership.index + 1 < count) {
+        uint32_t last = MemberAt(*feed, count - 1);
+        MemberAt(*feed, membership.index) = last;
         if (Membership *moved = m_memberships.AtSlotOf(last))
             moved->index = membership.index;
     }
-    members.RemoveLast();
-    if (members.Size() > 0)
+    RemoveLastMember(*feed);
+    if (feed->members.count > 0)
         return nullptr;
     CadroDataItem *item = feed->item;
     feed->item = nullptr;
@@ -483,18 +482,18 @@ CadroDataItem *NodeSession::Leave(uint32_t id)
 
 void NodeSession::DropFeed(Feed &feed)
 {
-    feed.members.ForEach([&](uint32_t member) {
+    ForEachMember(feed, [&](uint32_t member) {
         Membership *membership = m_memberships.AtSlotOf(member);
         if (membership && membership->feed == feed.id)
             *membership = Membership();
     });
+    m_moreMembers.erase(feed.id);
     Unshare(feed);
     ClearData(feed);
-    uint32_t slot = wire::FeedSlot(feed.id);
-    uint16_t generation = feed.generation;
-    feed = Feed();
-    feed.generation = generation;
-    m_freeFeeds.push_back(slot); // within its capacity (NewFeed)
+    uint32_t id = feed.id;
+    m_feeds.Leave(id);
+    feed.~Feed();
+    m_feeds.Give(id);
 }
 
 void NodeSession::Unsubscribe(uint32_t id)
@@ -528,9 +527,9 @@ uint32_t NodeSession::Occupant(uint32_t id)
 {
     Membership *membership = m_memberships.AtSlotOf(id);
     Feed *feed = membership ? FeedOf(membership->feed) : nullptr;
-    if (!feed || membership->index >= feed->members.Size())
+    if (!feed || membership->index >= feed->members.count)
         return 0;
-    return feed->members[membership->index];
+    return MemberAt(*feed, membership->index);
 }
 
 CadroAttributes NodeSession::AttributesOf(const Feed &feed)
@@ -613,9 +612,8 @@ template <class FeedIdOf, class FieldsOf> void NodeSession::TakeData(size_t coun
     auto each = [&](auto take) {
         for (size_t i = 0; i < count; ++i) {
             if (i + kPrefetchAhead < count) {
-                uint32_t slot = wire::FeedSlot(feedIdOf(i + kPrefetchAhead));
-                if (slot < m_slots)
-                    PrefetchObject(&FeedAt(slot));
+                if (const void *ahead = m_feeds.Where(feedIdOf(i + kPrefetchAhead)))
+                    PrefetchObject(ahead);
             }
             if (Feed *feed = FeedOf(feedIdOf(i)))
                 fieldsOf(i, [&](std::string_view fields) {

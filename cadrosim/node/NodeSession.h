@@ -13,6 +13,7 @@
 #include "FlatMap.h"
 #include "FrameQueue.h"
 #include "Memberships.h"
+#include "SlotTable.h"
 
 #include <memory>
 #include <string>
@@ -49,6 +50,7 @@ public:
     // A tick's values: the table held alone for the batch (no feed lock
     // for each), and the queue's lock once.
     void OnDataBatch(const DataEntry *entries, size_t count) override;
+    ICadroRealTimeReceiver *Receiver() override { return this; }
 
 private:
     NodeSession(Engine &engine, std::shared_ptr<Channel> channel, bool fromNode, HANDLE ended);
@@ -58,31 +60,15 @@ private:
     // was read and is still to be handled.
     std::shared_ptr<Channel> Greet(std::string &buffer);
     bool Handle(wire::Kind kind, wire::In &in);
-    // The library's ids that share a feed: nearly always one, kept in place.
-    class FeedMembers {
-    public:
-        uint32_t Size() const { return m_count; }
-        uint32_t &operator[](uint32_t i) { return i == 0 ? m_first : (*m_more)[i - 1]; }
-        // Throws std::bad_alloc when a second member finds no memory, the
-        // members unchanged.
-        void Add(uint32_t id);
-        void RemoveLast();
-        template <class Each> void ForEach(Each each) const
-        {
-            if (m_count)
-                each(m_first);
-            if (m_more)
-                for (uint32_t id : *m_more)
-                    each(id);
-        }
-
-    private:
-        uint32_t m_first = 0;
-        uint32_t m_count = 0;
-        std::unique_ptr<std::vector<uint32_t>> m_more;
+    // The library's ids that share a feed: nearly always one, kept in the
+    // feed; any others in the session's table of more members (a URL that
+    // one library subscribed twice), so that a feed carries no pointer.
+    struct FeedMembers {
+        uint32_t first = 0;
+        uint32_t count = 0;
     };
-    // A feed lives in a page of the session's table, not in a heap block of
-    // its own (a block's header and the pointer to it cost a fifth of it).
+    // A feed lives in the session's slot table, not in a heap block of its
+    // own (a block's header and the pointer to it cost a fifth of it).
     // What a value reads and writes first, in the feed's first cache line.
     struct Feed {
         enum Flag : uint8_t {
@@ -91,35 +77,33 @@ private:
             kHeld = 4,     // a value not sent yet: the library is behind
             kLongData = 8, // the last Data fields are in the session's table of long ones
         };
-        uint32_t id = 0;         // with its slot's generation: the engine's cookie; 0 while free
-        uint16_t generation = 0; // of the slot: kept while it is free
-        uint8_t statusCount = 0; // statuses since the last "connecting"
-        uint8_t flags = 0;
+        uint32_t id;             // with its slot's generation: the engine's cookie
+        uint32_t check;          // the URL's second hash (see hash)
+        uint8_t statusCount : 3; // statuses since the last "connecting"
+        uint8_t flags : 5;
         uint8_t statuses[6];
         // The attributes: the mask's and the access's low bytes (the network
         // sets no other bits) and the data type.
-        uint8_t attributeMask = 0;
-        uint8_t access = 0;
-        uint16_t dataType = 0;
+        uint8_t attributeMask;
+        uint8_t access;
         // The last Data fields, in place when a number's or a boolean's (a
         // text's are kept in the session's table of long ones, by the
         // feed's slot: they are rare, and each feed would otherwise carry a
         // pointer); 0 bytes when there are none or they are long.
-        uint8_t dataSize = 0;
+        uint8_t dataSize;
+        uint16_t dataType;
         char data[wire::PackedFields::kMostBytes];
-        // The URL's two hashes, 96 bits: URLs that agree on both are taken
-        // as one (the URL itself is not kept: it would double the feed).
-        uint32_t check = 0;
-        uint64_t hash = 0;
-        CadroDataItem *item = nullptr;
+        // With check, the URL's hashes, 96 bits: URLs that agree on both are
+        // taken as one (the URL itself is not kept: it would double the feed).
+        uint64_t hash;
+        CadroDataItem *item;
         FeedMembers members;
 
         bool Has(Flag flag) const { return (flags & flag) != 0; }
         void Set(Flag flag, bool on) { flags = on ? (flags | flag) : (flags & ~flag); }
         bool HasData() const { return dataSize != 0 || Has(kLongData); }
     };
-    static constexpr uint32_t kPageBits = 10;
-    static constexpr uint32_t kPageSize = 1u << kPageBits;
+    static_assert(sizeof(Feed) <= 72, "a feed is a node's memory for each subscription");
 
     void Subscribe(wire::In &in);
     void Unsubscribe(uint32_t id);
@@ -131,8 +115,13 @@ private:
     uint32_t Occupant(uint32_t id);
     static CadroAttributes AttributesOf(const Feed &feed);
     // Under m_feedsLock.
-    Feed *FeedOf(uint32_t feedId);
-    Feed &FeedAt(uint32_t slot) { return m_pages[slot >> kPageBits][slot & (kPageSize - 1)]; }
+    Feed *FeedOf(uint32_t feedId) { return m_feeds.Find(feedId); }
+    // The feed's members, under m_feedsLock. AddMember throws
+    // std::bad_alloc, the members unchanged, when memory is short.
+    uint32_t &MemberAt(Feed &feed, uint32_t index);
+    void AddMember(Feed &feed, uint32_t id);
+    void RemoveLastMember(Feed &feed);
+    template <class Each> void ForEachMember(const Feed &feed, Each each);
     void StoreData(Feed &feed, std::string_view fields);
     std::string_view DataOf(const Feed &feed) const;
     void ClearData(Feed &feed);
@@ -171,18 +160,18 @@ private:
     std::atomic<bool> m_ended{false};
     std::atomic<bool> m_finishing{false};
     SlimMutex m_feedsLock;
-    std::vector<std::unique_ptr<Feed[]>> m_pages; // the feeds, by slot
-    uint32_t m_slots = 0;                         // slots made so far
-    std::vector<uint32_t> m_freeFeeds;
-    std::unordered_map<uint32_t, std::string> m_longData; // by slot: LastData::isLong
-    std::vector<uint32_t> m_held;                         // feeds with a value held back
+    // The feeds by id; the generation leaves an id's top bit clear.
+    SlotTable<Feed, wire::kFeedSlotBits, 31 - wire::kFeedSlotBits> m_feeds;
+    std::unordered_map<uint32_t, std::vector<uint32_t>> m_moreMembers; // by feed id: members after the first
+    std::unordered_map<uint32_t, std::string> m_longData;              // by slot: LastData::isLong
+    std::vector<uint32_t> m_held;                                      // feeds with a value held back
     std::atomic<bool> m_holding{false};
-    // Shared feeds (slot + 1) by the URL's hash, which the index reads from
+    // Shared feeds (their ids) by the URL's hash, which the index reads from
     // the feed; a URL whose hash another one has takes a feed that is not
     // found here (it is not shared).
     struct UrlHashOf {
         NodeSession *session;
-        uint64_t operator()(uint32_t handle) const { return session->FeedAt(handle - 1).hash; }
+        uint64_t operator()(uint32_t feedId) const { return session->m_feeds.Find(feedId)->hash; }
     };
     FlatIndex<UrlHashOf> m_feedOfUrl{UrlHashOf{this}};
     Memberships m_memberships;

@@ -241,15 +241,21 @@ TEST_F(NodeSessionTest, ANewcomerIsToldTheFeedsLastValueWhateverItsLength)
     SendSubscribe(*channel, 3, url);
     EXPECT_TRUE(waitFor(3, L"ab")) << "the short text, in place";
 
-    // Every member leaves: the feed's place is freed, and another URL's feed
-    // takes it.
-    wire::Out leave;
-    for (uint32_t id = 1; id <= 3; ++id) {
+    auto unsubscribe = [&](uint32_t id) {
+        wire::Out leave;
         leave.Begin(wire::Kind::Unsubscribe);
         leave.U32(id);
         leave.End();
-    }
-    channel->Send(leave.View());
+        channel->Send(leave.View());
+    };
+    // Every member leaves, the first first (the last takes its place): the
+    // feed's place is freed only when the last has gone, and another URL's
+    // feed takes it.
+    unsubscribe(1);
+    ASSERT_EQ(engine.Execute(L"publish " + url + L" cd"), L"ok\n");
+    EXPECT_TRUE(waitFor(3, L"cd")) << "the feed goes on for the others";
+    unsubscribe(3);
+    unsubscribe(2);
     ASSERT_EQ(engine.Execute(L"publish " + url + L" \"" + longText + L"\""), L"ok\n");
     SendSubscribe(*channel, 4, L"\\\\.\\p\\t.other");
     SendSubscribe(*channel, 5, L"\\\\.\\p\\t.other");

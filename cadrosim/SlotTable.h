@@ -1,10 +1,11 @@
 #pragma once
-// Where a link keeps its subscriptions: in blocks of places, found by the
-// slot of their id. A plant's server holds a subscription for every item, a
-// hundred thousand and more. Each in a heap block of its own cost the block's
-// header and rounding, and the table by id ten bytes more a slot (twenty
-// while its arrays grew). Here a place is the object's own size, and its
-// slot's generation and state (two bytes) lie in the same block.
+// Where a library's link keeps its subscriptions and a node's session its
+// feeds: in blocks of places, found by the slot of their id. A plant's server
+// holds a subscription for every item, a hundred thousand and more. Each in
+// a heap block of its own cost the block's header and rounding, and a table
+// by id ten bytes more a slot (twenty while its arrays grew). Here a place
+// is the object's own size, and its slot's generation and state (two bytes)
+// lie in the same block; the free places make a list through themselves.
 //
 // A place is taken by Take and given back by Give, after its object is
 // destroyed; Leave in between only takes the object out of the table (Find
@@ -19,7 +20,9 @@
 
 namespace cadrosim {
 
-template <class T, uint32_t kSlotBits> class SlotTable {
+// An id is the slot + 1 in its low kSlotBits, under kGenerationBits of the
+// slot's generation.
+template <class T, uint32_t kSlotBits, uint32_t kGenerationBits = 32 - kSlotBits> class SlotTable {
 public:
     SlotTable() = default;
     SlotTable(const SlotTable &) = delete;
@@ -75,6 +78,14 @@ public:
             Release();
     }
 
+    // Where the object of id would be, to fetch ahead; null beyond every
+    // slot taken so far.
+    const void *Where(uint32_t id) const
+    {
+        uint32_t slot = (id & kSlotMask) - 1;
+        return slot < m_next ? Place(slot) : nullptr;
+    }
+
     // f(object) for every object in the table.
     template <class F> void ForEach(F f) const
     {
@@ -87,7 +98,8 @@ public:
 
 private:
     static constexpr uint32_t kSlotMask = (1u << kSlotBits) - 1;
-    static constexpr uint16_t kGenerationMask = static_cast<uint16_t>((1u << (32 - kSlotBits)) - 1);
+    static_assert(kSlotBits + kGenerationBits <= 32, "an id has 32 bits");
+    static constexpr uint16_t kGenerationMask = static_cast<uint16_t>((1u << kGenerationBits) - 1);
     static constexpr uint16_t kIn = 0x8000;
     static_assert(kGenerationMask < kIn, "the generation leaves the state's top bit free");
     static constexpr uint32_t kPerBlock = 1024;
