@@ -10,7 +10,7 @@ namespace cadrosim {
 
 LinkFeed *LinkFeed::Make(size_t length, bool narrow)
 {
-    if (length > UINT32_MAX / 4)
+    if (length > INT32_MAX / sizeof(wchar_t))
         return nullptr;
     void *block = ::operator new(sizeof(LinkFeed) + (narrow ? length : length * sizeof(wchar_t)), std::nothrow);
     return block ? ::new (block) LinkFeed(static_cast<uint32_t>(length), narrow) : nullptr;

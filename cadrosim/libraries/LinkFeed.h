@@ -39,6 +39,15 @@ public:
     template <class F> void ForEachMember(F f) const;
 
     uint32_t id = 0; // the node's feed; 0: not the node's
+
+private:
+    // The URL's length in characters, and whether they are stored a byte
+    // each: beside the id, where the feed has room for them (a feed is 48
+    // bytes before its URL).
+    uint32_t m_urlLength : 31;
+    uint32_t m_urlNarrow : 1;
+
+public:
     MemberMirror mirror;
     // The members: the first in place (nearly every URL has one
     // subscription), any others in an array, each knowing its place. A value
@@ -51,10 +60,8 @@ private:
     LinkFeed(uint32_t urlLength, bool narrow) : m_urlLength(urlLength), m_urlNarrow(narrow) {}
     static LinkFeed *Make(size_t length, bool narrow);
     char *Stored() const { return reinterpret_cast<char *>(const_cast<LinkFeed *>(this) + 1); }
-
-    uint32_t m_urlLength;
-    bool m_urlNarrow;
 };
+static_assert(sizeof(void *) != 8 || sizeof(LinkFeed) == 48, "a feed is 48 bytes before its URL");
 
 template <class F> void LinkFeed::ForEachMember(F f) const
 {
