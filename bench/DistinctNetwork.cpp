@@ -5,6 +5,7 @@
 
 #include <tlhelp32.h>
 
+#include <algorithm>
 #include <string>
 
 namespace {
@@ -62,8 +63,13 @@ DistinctNetwork::~DistinctNetwork()
 
 std::vector<std::wstring> DistinctNetwork::Changing(DWORD n) const
 {
+    return DistinctChangingIds(0, std::min(n, m_members));
+}
+
+std::vector<std::wstring> DistinctChangingIds(DWORD first, DWORD n)
+{
     std::vector<std::wstring> ids;
-    for (DWORD i = 0; i < n && i < m_members; ++i)
+    for (DWORD i = first; i < first + n; ++i)
         ids.push_back(Id(i, L"c"));
     return ids;
 }

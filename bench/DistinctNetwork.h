@@ -28,6 +28,10 @@ private:
     bool m_loaded = false;
 };
 
+// The ids of the counting members first .. first + n - 1 of a distinct
+// network, for a process that did not load it (a benchmark's client).
+std::vector<std::wstring> DistinctChangingIds(DWORD first, DWORD n);
+
 // A process of the given image name, opened to read its times and memory.
 HANDLE OpenProcessNamed(const wchar_t *image);
 // A file in this program's folder, and writing one.

@@ -19,9 +19,12 @@
 //        subscription_bench -i         only the in-process figures
 //        subscription_bench N [N ...]  only the comparison through COM, for
 //                                      these item counts in turn
-//        subscription_bench --distinct [N]
+//        subscription_bench --distinct [N] [--clients K]
+//                                      K clients at once (processes of
+//                                      this program), N / K items each
 #include "BaselineProcess.h"
 #include "CadroSim.h"
+#include "ChildProcess.h"
 #include "ClassFactory.h"
 #include "ComPtr.h"
 #include "DataChangeSink.h"
@@ -42,6 +45,7 @@
 #include <cstdio>
 #include <ocidl.h>
 #include <string>
+#include <thread>
 #include <vector>
 
 namespace {
@@ -309,7 +313,161 @@ void PrintPlantWindow(const char *what, const PlantWindow &w)
            what, w.itemsPerSecond, w.serverUs, w.nodeUs, w.medianMs, w.p99Ms);
 }
 
-void Distinct(DWORD members)
+// Several clients at once: each a process of its own (this program, with
+// --plant-client) with an equal share of the members in a group of its own,
+// all counted in the same windows, which named events open and close.
+std::wstring ClientEvent(const std::wstring &prefix, const wchar_t *what, int n)
+{
+    return prefix + L"_" + what + std::to_wstring(n);
+}
+
+constexpr int kPlantWindows = 3;
+constexpr DWORD kPlantWindowMs = 2000;
+
+// A client's side: prints, for each window, "window W ITEMS" and the ages of
+// its sampled values in ms.
+int PlantClient(DWORD first, DWORD count, int index, const std::wstring &prefix)
+{
+    ComPtr<IOPCServer> server;
+    HRESULT hr = CoCreateInstance(kServer, nullptr, CLSCTX_LOCAL_SERVER, IID_IOPCServer,
+                                  reinterpret_cast<void **>(server.Out()));
+    if (FAILED(hr)) {
+        printf("error 0x%08lX CoCreateInstance\n", static_cast<unsigned long>(hr));
+        return 1;
+    }
+    ComPtr<CountingSink> sink = CountingSink::Create();
+    Group group = MakeGroupOf(server.Get(), 10, DistinctChangingIds(first, count), sink.Get());
+    Sleep(2000); // first values, and the scans settled
+    UniqueHandle ready(OpenEventW(EVENT_MODIFY_STATE, FALSE, ClientEvent(prefix, L"ready", index).c_str()));
+    SetEvent(ready.Get());
+    for (int window = 1; window <= kPlantWindows; ++window) {
+        UniqueHandle start(OpenEventW(SYNCHRONIZE, FALSE, ClientEvent(prefix, L"start", window).c_str()));
+        UniqueHandle end(OpenEventW(SYNCHRONIZE, FALSE, ClientEvent(prefix, L"end", window).c_str()));
+        if (WaitForSingleObject(start.Get(), 120000) != WAIT_OBJECT_0)
+            break;
+        sink->TakeLatencies();
+        sink->sampleLatency = true;
+        unsigned long long before = sink->items;
+        WaitForSingleObject(end.Get(), 120000);
+        unsigned long long items = sink->items - before;
+        sink->sampleLatency = false;
+        printf("window %d %llu", window, items);
+        for (double ms : sink->TakeLatencies())
+            printf(" %.2f", ms);
+        printf("\n");
+    }
+    RemoveGroupOf(server.Get(), group);
+    return 0;
+}
+
+// What the clients printed for one window: items per client, and every
+// sampled age.
+struct ClientReports {
+    std::vector<unsigned long long> items;
+    std::vector<double> ms;
+};
+
+void ReadClientReport(const std::string &output, std::vector<ClientReports> &windows)
+{
+    size_t at = 0;
+    while (at < output.size()) {
+        size_t end = output.find('\n', at);
+        std::string line = output.substr(at, end == std::string::npos ? std::string::npos : end - at);
+        at = end == std::string::npos ? output.size() : end + 1;
+        int window = 0, used = 0;
+        unsigned long long items = 0;
+        if (sscanf(line.c_str(), "window %d %llu%n", &window, &items, &used) != 2 || window < 1 ||
+            window > kPlantWindows)
+            continue;
+        ClientReports &w = windows[window - 1];
+        w.items.push_back(items);
+        const char *p = line.c_str() + used;
+        char *next = nullptr;
+        for (double ms = strtod(p, &next); next != p; p = next, ms = strtod(p, &next))
+            w.ms.push_back(ms);
+    }
+}
+
+void SeveralClients(DWORD members, int clients)
+{
+    UniqueHandle serverProcess(OpenProcessNamed(L"Local.exe"));
+    UniqueHandle node(OpenProcessNamed(L"cadronode.exe"));
+    const std::wstring prefix = L"subscription_bench_" + std::to_wstring(GetCurrentProcessId());
+    std::vector<UniqueHandle> ready, starts, ends;
+    for (int i = 0; i < clients; ++i)
+        ready.emplace_back(CreateEventW(nullptr, TRUE, FALSE, ClientEvent(prefix, L"ready", i).c_str()));
+    for (int w = 1; w <= kPlantWindows; ++w) {
+        starts.emplace_back(CreateEventW(nullptr, TRUE, FALSE, ClientEvent(prefix, L"start", w).c_str()));
+        ends.emplace_back(CreateEventW(nullptr, TRUE, FALSE, ClientEvent(prefix, L"end", w).c_str()));
+    }
+    std::vector<std::string> outputs(clients);
+    std::vector<std::thread> runners;
+    const DWORD share = members / clients;
+    for (int i = 0; i < clients; ++i) {
+        std::wstring line = L"\"" + BesideThisProgram(L"subscription_bench.exe") + L"\" --plant-client " +
+                            std::to_wstring(i * share) + L" " + std::to_wstring(share) + L" " + std::to_wstring(i) +
+                            L" " + prefix;
+        runners.emplace_back([&outputs, i, line] { RunAndCapture(line, outputs[i], 300000); });
+    }
+    bool allReady = true;
+    for (UniqueHandle &r : ready)
+        allReady = allReady && WaitForSingleObject(r.Get(), 120000) == WAIT_OBJECT_0;
+    std::vector<double> seconds(kPlantWindows), serverCpu(kPlantWindows), nodeCpu(kPlantWindows);
+    for (int w = 0; w < kPlantWindows; ++w) {
+        double serverBefore = ProcessCpuSeconds(serverProcess.Get());
+        double nodeBefore = node ? ProcessCpuSeconds(node.Get()) : 0;
+        auto start = Clock::now();
+        SetEvent(starts[w].Get());
+        if (allReady)
+            Sleep(kPlantWindowMs);
+        SetEvent(ends[w].Get());
+        seconds[w] = std::chrono::duration<double>(Clock::now() - start).count();
+        serverCpu[w] = ProcessCpuSeconds(serverProcess.Get()) - serverBefore;
+        nodeCpu[w] = node ? ProcessCpuSeconds(node.Get()) - nodeBefore : 0;
+    }
+    for (std::thread &runner : runners)
+        runner.join();
+    if (!allReady) {
+        printf("  not every client got ready within 2 minutes:\n");
+        for (const std::string &output : outputs)
+            printf("    %s\n", output.substr(0, output.find('\n')).c_str());
+        return;
+    }
+    std::vector<ClientReports> windows(kPlantWindows);
+    for (const std::string &output : outputs)
+        ReadClientReport(output, windows);
+    PlantWindow best;
+    best.serverUs = best.nodeUs = best.medianMs = best.p99Ms = 1e9;
+    for (int w = 0; w < kPlantWindows; ++w) {
+        ClientReports &r = windows[w];
+        unsigned long long items = 0, fewest = ~0ull, most = 0;
+        for (unsigned long long n : r.items) {
+            items += n;
+            fewest = std::min(fewest, n);
+            most = std::max(most, n);
+        }
+        PlantWindow pw;
+        pw.itemsPerSecond = items / seconds[w];
+        pw.serverUs = items ? serverCpu[w] * 1e6 / items : 0;
+        pw.nodeUs = items ? nodeCpu[w] * 1e6 / items : 0;
+        std::sort(r.ms.begin(), r.ms.end());
+        if (!r.ms.empty()) {
+            pw.medianMs = r.ms[r.ms.size() / 2];
+            pw.p99Ms = r.ms[r.ms.size() * 99 / 100];
+        }
+        PrintPlantWindow(("window " + std::to_string(w + 1)).c_str(), pw);
+        printf("  %-20s %zu of %d clients reported, each %.0f to %.0f items/s\n", "", r.items.size(), clients,
+               r.items.empty() ? 0.0 : fewest / seconds[w], most / seconds[w]);
+        best.itemsPerSecond = std::max(best.itemsPerSecond, pw.itemsPerSecond);
+        best.serverUs = std::min(best.serverUs, pw.serverUs);
+        best.nodeUs = std::min(best.nodeUs, pw.nodeUs);
+        best.medianMs = std::min(best.medianMs, pw.medianMs);
+        best.p99Ms = std::min(best.p99Ms, pw.p99Ms);
+    }
+    PrintPlantWindow("best of the three", best);
+}
+
+void Distinct(DWORD members, int clients)
 {
     if (CountServerProcesses() != 0) {
         printf("a server process is running already: it serves another network; stop it first\n");
@@ -326,9 +484,16 @@ void Distinct(DWORD members)
         printf("the server is not registered: run ./test.sh or scripts/setup.sh first\n");
         return;
     }
+    if (clients > 1) {
+        printf("%lu items on distinct members counting every 10 ms, %d clients at once, each a process with an active "
+               "10 ms group of %lu of them, through COM:\n",
+               static_cast<unsigned long>(members), clients, static_cast<unsigned long>(members / clients));
+        SeveralClients(members, clients); // server held: its process stays while the clients start
+        return;
+    }
     UniqueHandle serverProcess(OpenProcessNamed(L"Local.exe"));
     UniqueHandle node(OpenProcessNamed(L"cadronode.exe"));
-    const DWORD kWindowMs = 2000;
+    const DWORD kWindowMs = kPlantWindowMs;
     printf("%lu items on distinct members counting every 10 ms, one active 10 ms group, through COM:\n",
            static_cast<unsigned long>(members));
     PlantWindow best;
@@ -337,7 +502,7 @@ void Distinct(DWORD members)
         ComPtr<CountingSink> sink = CountingSink::Create();
         Group group = MakeGroupOf(server.Get(), 10, network.Changing(members), sink.Get());
         Sleep(2000); // first values, and the scans settled
-        for (int window = 1; window <= 3; ++window) {
+        for (int window = 1; window <= kPlantWindows; ++window) {
             PlantWindow w = MeasurePlantWindow(sink.Get(), serverProcess.Get(), node.Get(), kWindowMs);
             PrintPlantWindow(("window " + std::to_string(window)).c_str(), w);
             best.itemsPerSecond = std::max(best.itemsPerSecond, w.itemsPerSecond);
@@ -369,10 +534,28 @@ int wmain(int argc, wchar_t **argv)
 {
     if (argc > 1 && wcscmp(argv[1], L"--distinct") == 0) {
         // The network node's, which the server reaches too.
+        DWORD members = 10000;
+        int clients = 1;
+        for (int i = 2; i < argc; ++i) {
+            if (wcscmp(argv[i], L"--clients") == 0 && i + 1 < argc)
+                clients = _wtoi(argv[++i]);
+            else
+                members = wcstoul(argv[i], nullptr, 10);
+        }
+        if (clients < 1 || clients > 32 || members < static_cast<DWORD>(clients)) {
+            fprintf(stderr, "usage: subscription_bench --distinct [N] [--clients K] (1 <= K <= 32, K <= N)\n");
+            return 1;
+        }
         CoInitializeEx(nullptr, COINIT_MULTITHREADED);
-        Distinct(argc > 2 ? wcstoul(argv[2], nullptr, 10) : 10000);
+        Distinct(members, clients);
         CoUninitialize();
         return 0;
+    }
+    if (argc == 6 && wcscmp(argv[1], L"--plant-client") == 0) {
+        CoInitializeEx(nullptr, COINIT_MULTITHREADED);
+        int code = PlantClient(wcstoul(argv[2], nullptr, 10), wcstoul(argv[3], nullptr, 10), _wtoi(argv[4]), argv[5]);
+        CoUninitialize();
+        return code;
     }
     CadroSim_UseEmbeddedNetwork(); // the network of the objects made in this process
     CoInitializeEx(nullptr, COINIT_MULTITHREADED);
