@@ -161,7 +161,6 @@ void NodeSession::ReleaseAll()
             m_feeds.Give(id);
         }
         m_moreMembers.clear();
-        m_longData.clear();
         m_feedOfUrl.Clear();
         m_memberships.Clear();
     }
@@ -293,15 +292,22 @@ void NodeSession::Subscribe(wire::In &in)
         hr = m_engine.Subscribe(url.c_str(), CookieOf(fresh), this, &item, m_fromNode, this);
         std::unique_lock<SlimMutex> l(m_feedsLock);
         Feed *feed = FeedOf(fresh);
+        bool held = false;
         if (feed && SUCCEEDED(hr)) {
             feed->item = item;
             item = nullptr;
+            held = feed->Has(Feed::kHeld);
         } else if (feed) {
             DropFeed(*feed);
         }
         l.unlock();
         if (item)
             item->Release();
+        // A first value held back before the feed had its subscription to
+        // read it from: it goes out now, unless the library is still behind
+        // (then it goes when the queue has been written).
+        if (held)
+            SendHeld();
     }
     if (request)
         Reply([&](wire::Out &out) {
@@ -324,40 +330,21 @@ void NodeSession::Unshare(Feed &feed)
     m_feedOfUrl.Erase(feed.id, feed.hash);
 }
 
-void NodeSession::StoreData(Feed &feed, std::string_view fields)
+template <class Use> bool NodeSession::WithCurrentData(const Feed &feed, Use use)
 {
-    if (fields.size() <= sizeof feed.data) {
-        memcpy(feed.data, fields.data(), fields.size());
-        feed.dataSize = static_cast<uint8_t>(fields.size());
-        if (feed.Has(Feed::kLongData))
-            m_longData.erase(wire::FeedSlot(feed.id));
-        feed.Set(Feed::kLongData, false);
-        return;
-    }
-    feed.dataSize = 0;
-    try {
-        m_longData[wire::FeedSlot(feed.id)].assign(fields);
-        feed.Set(Feed::kLongData, true);
-    } catch (const std::bad_alloc &) {
-        // No memory for the text: a newcomer gets no value until the next.
-        ClearData(feed);
-    }
-}
-
-std::string_view NodeSession::DataOf(const Feed &feed) const
-{
-    if (!feed.Has(Feed::kLongData))
-        return {feed.data, feed.dataSize};
-    auto found = m_longData.find(wire::FeedSlot(feed.id));
-    return found != m_longData.end() ? std::string_view(found->second) : std::string_view();
-}
-
-void NodeSession::ClearData(Feed &feed)
-{
-    if (feed.Has(Feed::kLongData))
-        m_longData.erase(wire::FeedSlot(feed.id));
-    feed.Set(Feed::kLongData, false);
-    feed.dataSize = 0;
+    if (!feed.item || !feed.Has(Feed::kHasData))
+        return false;
+    // Under m_feedsLock, so that no value of the feed is queued between
+    // this read and the caller's use of it: what follows is as new or newer.
+    uint32_t flags = 0;
+    CadroValue value = {};
+    int32_t error = 0;
+    FILETIME time = {};
+    bool has = SUCCEEDED(feed.item->Read(&flags, &value, &error, &time)) && (flags & kCadroHasValue);
+    if (has)
+        WithFields(flags, value, error, time.dwLowDateTime, time.dwHighDateTime, use);
+    ClearCadroValue(value);
+    return has;
 }
 
 uint32_t &NodeSession::MemberAt(Feed &feed, uint32_t index)
@@ -447,8 +434,7 @@ bool NodeSession::Join(Feed &feed, uint32_t id)
                 out.U32(id);
                 out.Attributes(AttributesOf(feed));
             });
-        if (feed.HasData())
-            m_queue.PushId(wire::Kind::Data, DataOf(feed), id);
+        WithCurrentData(feed, [&](std::string_view fields) { m_queue.PushId(wire::Kind::Data, fields, id); });
     }
     m_queue.Push(wire::Kind::Joined, [&](wire::Out &out) {
         out.U32(id);
@@ -489,7 +475,6 @@ void NodeSession::DropFeed(Feed &feed)
     });
     m_moreMembers.erase(feed.id);
     Unshare(feed);
-    ClearData(feed);
     uint32_t id = feed.id;
     m_feeds.Leave(id);
     feed.~Feed();
@@ -617,7 +602,7 @@ template <class FeedIdOf, class FieldsOf> void NodeSession::TakeData(size_t coun
             }
             if (Feed *feed = FeedOf(feedIdOf(i)))
                 fieldsOf(i, [&](std::string_view fields) {
-                    StoreData(*feed, fields);
+                    feed->Set(Feed::kHasData, true);
                     take(*feed, fields);
                 });
         }
@@ -646,15 +631,20 @@ template <class Push> void NodeSession::PushHeld(Push &push)
 {
     if (m_held.empty())
         return;
+    size_t waiting = 0; // feeds not yet given their subscription stay held
     for (uint32_t id : m_held) {
         Feed *feed = FeedOf(id); // gone meanwhile: nothing to send
-        if (feed && feed->Has(Feed::kHeld) && feed->HasData())
-            push(wire::Kind::FeedData, DataOf(*feed), feed->id);
-        if (feed)
-            feed->Set(Feed::kHeld, false);
+        if (!feed || !feed->Has(Feed::kHeld))
+            continue;
+        if (!feed->item) {
+            m_held[waiting++] = id;
+            continue;
+        }
+        WithCurrentData(*feed, [&](std::string_view fields) { push(wire::Kind::FeedData, fields, feed->id); });
+        feed->Set(Feed::kHeld, false);
     }
-    m_held.clear();
-    m_holding = false;
+    m_held.resize(waiting);
+    m_holding = waiting != 0;
 }
 
 void NodeSession::SendHeld()
@@ -694,7 +684,7 @@ HRESULT STDMETHODCALLTYPE NodeSession::StatusChange(void *cookie, uint32_t statu
         // being connected to, and is given no value until it is back.
         feed->statuses[0] = kCadroStatusConnecting;
         feed->statusCount = 1;
-        ClearData(*feed);
+        feed->Set(Feed::kHasData, false);
     } else if (feed->statusCount < sizeof feed->statuses) {
         feed->statuses[feed->statusCount++] = static_cast<uint8_t>(status);
     }

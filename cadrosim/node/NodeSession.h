@@ -74,8 +74,8 @@ private:
         enum Flag : uint8_t {
             kHasAttributes = 1,
             kDead = 2,     // its member has gone: a newcomer makes a new feed
-            kHeld = 4,     // a value not sent yet: the library is behind
-            kLongData = 8, // the last Data fields are in the session's table of long ones
+            kHeld = 4,    // a value not sent yet: the library is behind
+            kHasData = 8, // a value came since the last "connecting"
         };
         uint32_t id;             // with its slot's generation: the engine's cookie
         uint32_t check;          // the URL's second hash (see hash)
@@ -86,13 +86,7 @@ private:
         // sets no other bits) and the data type.
         uint8_t attributeMask;
         uint8_t access;
-        // The last Data fields, in place when a number's or a boolean's (a
-        // text's are kept in the session's table of long ones, by the
-        // feed's slot: they are rare, and each feed would otherwise carry a
-        // pointer); 0 bytes when there are none or they are long.
-        uint8_t dataSize;
         uint16_t dataType;
-        char data[wire::PackedFields::kMostBytes];
         // With check, the URL's hashes, 96 bits: URLs that agree on both are
         // taken as one (the URL itself is not kept: it would double the feed).
         uint64_t hash;
@@ -101,9 +95,8 @@ private:
 
         bool Has(Flag flag) const { return (flags & flag) != 0; }
         void Set(Flag flag, bool on) { flags = on ? (flags | flag) : (flags & ~flag); }
-        bool HasData() const { return dataSize != 0 || Has(kLongData); }
     };
-    static_assert(sizeof(Feed) <= 72, "a feed is a node's memory for each subscription");
+    static_assert(sizeof(Feed) <= 48, "a feed is a node's memory for each subscription");
 
     void Subscribe(wire::In &in);
     void Unsubscribe(uint32_t id);
@@ -122,9 +115,11 @@ private:
     void AddMember(Feed &feed, uint32_t id);
     void RemoveLastMember(Feed &feed);
     template <class Each> void ForEachMember(const Feed &feed, Each each);
-    void StoreData(Feed &feed, std::string_view fields);
-    std::string_view DataOf(const Feed &feed) const;
-    void ClearData(Feed &feed);
+    // The member's value as its engine subscription has it now, the Data
+    // fields given to use(fields): the feed keeps no copy of its last value
+    // (a newcomer and a library that is behind are given the member's,
+    // which is that one or newer). False when there is none.
+    template <class Use> bool WithCurrentData(const Feed &feed, Use use);
     // Under m_feedsLock: each value (fieldsOf(i, use) calls use(fields))
     // stored in its feed and queued, or held in the feed while the library
     // is behind. feedIdOf(i) names the feeds to ask for ahead.
@@ -163,7 +158,6 @@ private:
     // The feeds by id; the generation leaves an id's top bit clear.
     SlotTable<Feed, wire::kFeedSlotBits, 31 - wire::kFeedSlotBits> m_feeds;
     std::unordered_map<uint32_t, std::vector<uint32_t>> m_moreMembers; // by feed id: members after the first
-    std::unordered_map<uint32_t, std::string> m_longData;              // by slot: LastData::isLong
     std::vector<uint32_t> m_held;                                      // feeds with a value held back
     std::atomic<bool> m_holding{false};
     // Shared feeds (their ids) by the URL's hash, which the index reads from

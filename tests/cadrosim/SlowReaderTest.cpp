@@ -209,11 +209,9 @@ TEST_F(NodeSessionTest, ALibraryThatStopsReadingGetsEachMembersNewestValueAndCos
     EXPECT_EQ(behind, 0u) << "members whose value at the release never arrived";
 }
 
-// A feed keeps a short value in place and a text that does not fit beside
-// the session's table: a newcomer to the feed is told whichever it holds
-// last, a text that became short again is never taken for the long one it
-// replaced, and a feed made again in a freed place starts with nothing of
-// the last one's.
+// A newcomer to a running feed is told the member's last value, a long text
+// or a short one, whichever came last; a feed made again in a freed place
+// starts with nothing of the last one's.
 TEST_F(NodeSessionTest, ANewcomerIsToldTheFeedsLastValueWhateverItsLength)
 {
     ASSERT_NO_FATAL_FAILURE(
@@ -235,11 +233,11 @@ TEST_F(NodeSessionTest, ANewcomerIsToldTheFeedsLastValueWhateverItsLength)
     ASSERT_EQ(engine.Execute(L"publish " + url + L" \"" + longText + L"\""), L"ok\n");
     ASSERT_TRUE(waitFor(1, longText));
     SendSubscribe(*channel, 2, url);
-    EXPECT_TRUE(waitFor(2, longText)) << "the long text, from the session's table";
+    EXPECT_TRUE(waitFor(2, longText)) << "the long text";
     ASSERT_EQ(engine.Execute(L"publish " + url + L" ab"), L"ok\n");
     ASSERT_TRUE(waitFor(1, L"ab"));
     SendSubscribe(*channel, 3, url);
-    EXPECT_TRUE(waitFor(3, L"ab")) << "the short text, in place";
+    EXPECT_TRUE(waitFor(3, L"ab")) << "the short text after the long one";
 
     auto unsubscribe = [&](uint32_t id) {
         wire::Out leave;
