@@ -253,10 +253,9 @@ void NodeLink::Run(unsigned generation)
 void NodeLink::Serve(Channel &channel)
 {
     std::string buffer;
-    size_t consumed = 0;
     bool fine = true;
     while (fine && channel.Read(buffer)) {
-        fine = wire::TakeFrames(buffer, consumed, [&](wire::Kind kind, wire::In in) { Dispatch(kind, in); });
+        fine = wire::TakeFrames(buffer, [&](wire::Kind kind, wire::In in) { Dispatch(kind, in); });
         DeliverData();
     }
     DeliverData();

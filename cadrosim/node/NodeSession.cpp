@@ -114,7 +114,6 @@ std::shared_ptr<Channel> NodeSession::Greet(std::string &buffer)
 void NodeSession::ReadLoop()
 {
     std::string buffer;
-    size_t consumed = 0;
     std::shared_ptr<Channel> stream = Greet(buffer);
     bool fine = stream != nullptr;
     if (fine) {
@@ -124,7 +123,7 @@ void NodeSession::ReadLoop()
             Finish();
     }
     while (fine) {
-        fine = wire::TakeFrames(buffer, consumed, [&](wire::Kind kind, wire::In in) {
+        fine = wire::TakeFrames(buffer, [&](wire::Kind kind, wire::In in) {
             if (fine)
                 fine = Handle(kind, in);
         });

@@ -73,7 +73,7 @@ private:
     struct Feed {
         enum Flag : uint8_t {
             kHasAttributes = 1,
-            kDead = 2,     // its member has gone: a newcomer makes a new feed
+            kDead = 2,    // its member has gone: a newcomer makes a new feed
             kHeld = 4,    // a value not sent yet: the library is behind
             kHasData = 8, // a value came since the last "connecting"
         };

@@ -100,7 +100,6 @@ std::shared_ptr<Channel> RingChannel::AskForRings(std::shared_ptr<PipeChannel> p
     if (!pipe->Write(question))
         return nullptr;
     std::string buffer;
-    size_t consumed = 0;
     bool answered = false, fine = true;
     std::wstring name;
     const DWORD begin = GetTickCount();
@@ -108,7 +107,7 @@ std::shared_ptr<Channel> RingChannel::AskForRings(std::shared_ptr<PipeChannel> p
         DWORD spent = GetTickCount() - begin;
         if (spent >= timeoutMs || !pipe->Read(buffer, timeoutMs - spent))
             return nullptr;
-        bool framed = wire::TakeFrames(buffer, consumed, [&](wire::Kind kind, wire::In in) {
+        bool framed = wire::TakeFrames(buffer, [&](wire::Kind kind, wire::In in) {
             fine = fine && !answered && kind == wire::Kind::Rings;
             answered = true;
             name = in.Text();

@@ -259,12 +259,17 @@ private:
     bool m_ok = true;
 };
 
+// A reading buffer larger than this (grown by a frame larger than a read)
+// is given back once it is empty.
+inline constexpr size_t kKeptBufferBytes = 1u << 20;
+
 // Splits whole frames off the front of buffer: calls handle(kind, fields)
 // for each and keeps an incomplete one for the next read. False when a frame
 // is impossible (a length too large): the peer speaks something else.
-template <class Handle> bool TakeFrames(std::string &buffer, size_t &consumed, Handle handle)
+template <class Handle> bool TakeFrames(std::string &buffer, Handle handle)
 {
     constexpr uint32_t kLargestFrame = 1u << 30;
+    size_t consumed = 0;
     while (buffer.size() - consumed >= 5) {
         uint32_t length;
         memcpy(&length, buffer.data() + consumed, 4);
@@ -276,13 +281,14 @@ template <class Handle> bool TakeFrames(std::string &buffer, size_t &consumed, H
         consumed += 4 + length;
         handle(static_cast<Kind>(frame[0]), In(frame + 1, length - 1));
     }
-    if (consumed == buffer.size()) {
-        buffer.clear();
-        consumed = 0;
-    } else if (consumed > (1u << 20)) {
+    // What is left is one frame's beginning: it moves to the front at once
+    // (a few bytes, or once the start of a large frame), so that the buffer
+    // holds no more than that and one read. Only a large frame grows it
+    // beyond the bound, and then it goes once the frame has been taken.
+    if (consumed == buffer.size() && buffer.capacity() > kKeptBufferBytes)
+        std::string().swap(buffer);
+    else
         buffer.erase(0, consumed);
-        consumed = 0;
-    }
     return true;
 }
 

@@ -77,8 +77,7 @@ template <class Take> auto NewestById(std::string bytes, Take take)
     using Taken = decltype(take(std::declval<const CadroValue &>()));
     std::map<uint32_t, Taken> byId;
     std::map<uint32_t, std::vector<uint32_t>> joined; // by feed
-    size_t consumed = 0;
-    wire::TakeFrames(bytes, consumed, [&](wire::Kind kind, wire::In in) {
+    wire::TakeFrames(bytes, [&](wire::Kind kind, wire::In in) {
         if (kind == wire::Kind::Joined) {
             uint32_t id = in.U32();
             joined[in.U32()].push_back(id);
