@@ -278,6 +278,17 @@ void CompareThroughCom(const std::vector<DWORD> &counts)
 // the node, and how old the values were on arrival.
 struct PlantWindow {
     double itemsPerSecond = 0, serverUs = 0, nodeUs = 0, medianMs = 0, p99Ms = 0;
+
+    // The best of windows: start from this, and keep each window's.
+    static PlantWindow NoneYet() { return {0, 1e9, 1e9, 1e9, 1e9}; }
+    void Keep(const PlantWindow &w)
+    {
+        itemsPerSecond = std::max(itemsPerSecond, w.itemsPerSecond);
+        serverUs = std::min(serverUs, w.serverUs);
+        nodeUs = std::min(nodeUs, w.nodeUs);
+        medianMs = std::min(medianMs, w.medianMs);
+        p99Ms = std::min(p99Ms, w.p99Ms);
+    }
 };
 
 PlantWindow MeasurePlantWindow(CountingSink *sink, HANDLE server, HANDLE node, DWORD windowMs)
@@ -388,6 +399,36 @@ void ReadClientReport(const std::string &output, std::vector<ClientReports> &win
     }
 }
 
+// Each window's figures over all clients, and the best of them.
+void PrintClientWindows(std::vector<ClientReports> &windows, const std::vector<double> &seconds,
+                        const std::vector<double> &serverCpu, const std::vector<double> &nodeCpu, int clients)
+{
+    PlantWindow best = PlantWindow::NoneYet();
+    for (int w = 0; w < kPlantWindows; ++w) {
+        ClientReports &r = windows[w];
+        unsigned long long items = 0, fewest = ~0ull, most = 0;
+        for (unsigned long long n : r.items) {
+            items += n;
+            fewest = std::min(fewest, n);
+            most = std::max(most, n);
+        }
+        PlantWindow pw;
+        pw.itemsPerSecond = items / seconds[w];
+        pw.serverUs = items ? serverCpu[w] * 1e6 / items : 0;
+        pw.nodeUs = items ? nodeCpu[w] * 1e6 / items : 0;
+        std::sort(r.ms.begin(), r.ms.end());
+        if (!r.ms.empty()) {
+            pw.medianMs = r.ms[r.ms.size() / 2];
+            pw.p99Ms = r.ms[r.ms.size() * 99 / 100];
+        }
+        PrintPlantWindow(("window " + std::to_string(w + 1)).c_str(), pw);
+        printf("  %-20s %zu of %d clients reported, each %.0f to %.0f items/s\n", "", r.items.size(), clients,
+               r.items.empty() ? 0.0 : fewest / seconds[w], most / seconds[w]);
+        best.Keep(pw);
+    }
+    PrintPlantWindow("best of the three", best);
+}
+
 void SeveralClients(DWORD members, int clients)
 {
     UniqueHandle serverProcess(OpenProcessNamed(L"Local.exe"));
@@ -436,35 +477,7 @@ void SeveralClients(DWORD members, int clients)
     std::vector<ClientReports> windows(kPlantWindows);
     for (const std::string &output : outputs)
         ReadClientReport(output, windows);
-    PlantWindow best;
-    best.serverUs = best.nodeUs = best.medianMs = best.p99Ms = 1e9;
-    for (int w = 0; w < kPlantWindows; ++w) {
-        ClientReports &r = windows[w];
-        unsigned long long items = 0, fewest = ~0ull, most = 0;
-        for (unsigned long long n : r.items) {
-            items += n;
-            fewest = std::min(fewest, n);
-            most = std::max(most, n);
-        }
-        PlantWindow pw;
-        pw.itemsPerSecond = items / seconds[w];
-        pw.serverUs = items ? serverCpu[w] * 1e6 / items : 0;
-        pw.nodeUs = items ? nodeCpu[w] * 1e6 / items : 0;
-        std::sort(r.ms.begin(), r.ms.end());
-        if (!r.ms.empty()) {
-            pw.medianMs = r.ms[r.ms.size() / 2];
-            pw.p99Ms = r.ms[r.ms.size() * 99 / 100];
-        }
-        PrintPlantWindow(("window " + std::to_string(w + 1)).c_str(), pw);
-        printf("  %-20s %zu of %d clients reported, each %.0f to %.0f items/s\n", "", r.items.size(), clients,
-               r.items.empty() ? 0.0 : fewest / seconds[w], most / seconds[w]);
-        best.itemsPerSecond = std::max(best.itemsPerSecond, pw.itemsPerSecond);
-        best.serverUs = std::min(best.serverUs, pw.serverUs);
-        best.nodeUs = std::min(best.nodeUs, pw.nodeUs);
-        best.medianMs = std::min(best.medianMs, pw.medianMs);
-        best.p99Ms = std::min(best.p99Ms, pw.p99Ms);
-    }
-    PrintPlantWindow("best of the three", best);
+    PrintClientWindows(windows, seconds, serverCpu, nodeCpu, clients);
 }
 
 void Distinct(DWORD members, int clients)
@@ -496,8 +509,7 @@ void Distinct(DWORD members, int clients)
     const DWORD kWindowMs = kPlantWindowMs;
     printf("%lu items on distinct members counting every 10 ms, one active 10 ms group, through COM:\n",
            static_cast<unsigned long>(members));
-    PlantWindow best;
-    best.serverUs = best.nodeUs = best.medianMs = best.p99Ms = 1e9;
+    PlantWindow best = PlantWindow::NoneYet();
     {
         ComPtr<CountingSink> sink = CountingSink::Create();
         Group group = MakeGroupOf(server.Get(), 10, network.Changing(members), sink.Get());
@@ -505,11 +517,7 @@ void Distinct(DWORD members, int clients)
         for (int window = 1; window <= kPlantWindows; ++window) {
             PlantWindow w = MeasurePlantWindow(sink.Get(), serverProcess.Get(), node.Get(), kWindowMs);
             PrintPlantWindow(("window " + std::to_string(window)).c_str(), w);
-            best.itemsPerSecond = std::max(best.itemsPerSecond, w.itemsPerSecond);
-            best.serverUs = std::min(best.serverUs, w.serverUs);
-            best.nodeUs = std::min(best.nodeUs, w.nodeUs);
-            best.medianMs = std::min(best.medianMs, w.medianMs);
-            best.p99Ms = std::min(best.p99Ms, w.p99Ms);
+            best.Keep(w);
         }
         RemoveGroupOf(server.Get(), group);
     }
