@@ -16,6 +16,16 @@ std::wstring Id(DWORD i, const wchar_t *kind)
     return L"\\\\.\\plant\\U" + std::to_wstring(i % kObjects) + L"." + kind + std::to_wstring(i / kObjects);
 }
 
+// The ids of members first .. first + n - 1 of a kind ("c" counting, "k"
+// constant).
+std::vector<std::wstring> Ids(DWORD first, DWORD n, const wchar_t *kind)
+{
+    std::vector<std::wstring> ids;
+    for (DWORD i = first; i < first + n; ++i)
+        ids.push_back(Id(i, kind));
+    return ids;
+}
+
 std::string Description(DWORD members)
 {
     std::string text = "machine $HOST\nprocess plant\n";
@@ -66,20 +76,14 @@ std::vector<std::wstring> DistinctNetwork::Changing(DWORD n) const
     return DistinctChangingIds(0, std::min(n, m_members));
 }
 
-std::vector<std::wstring> DistinctChangingIds(DWORD first, DWORD n)
-{
-    std::vector<std::wstring> ids;
-    for (DWORD i = first; i < first + n; ++i)
-        ids.push_back(Id(i, L"c"));
-    return ids;
-}
-
 std::vector<std::wstring> DistinctNetwork::Constant(DWORD n) const
 {
-    std::vector<std::wstring> ids;
-    for (DWORD i = 0; i < n && i < m_members; ++i)
-        ids.push_back(Id(i, L"k"));
-    return ids;
+    return Ids(0, std::min(n, m_members), L"k");
+}
+
+std::vector<std::wstring> DistinctChangingIds(DWORD first, DWORD n)
+{
+    return Ids(first, n, L"c");
 }
 
 HANDLE OpenProcessNamed(const wchar_t *image)

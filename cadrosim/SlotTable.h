@@ -96,6 +96,14 @@ public:
 
     size_t Live() const { return m_live; }
 
+    // Every place back at once, the objects already destroyed (or trivially
+    // destructible): the blocks go.
+    void Clear()
+    {
+        m_live = 0;
+        Release();
+    }
+
 private:
     static constexpr uint32_t kSlotMask = (1u << kSlotBits) - 1;
     static_assert(kSlotBits + kGenerationBits <= 32, "an id has 32 bits");

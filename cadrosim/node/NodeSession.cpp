@@ -9,6 +9,7 @@
 #include <cstring>
 #include <new>
 #include <shared_mutex>
+#include <type_traits>
 #include <utility>
 #include <vector>
 
@@ -148,17 +149,12 @@ void NodeSession::ReleaseAll()
     std::vector<CadroDataItem *> items;
     {
         std::lock_guard<SlimMutex> l(m_feedsLock);
-        std::vector<uint32_t> feeds;
         m_feeds.ForEach([&](Feed *feed) {
             if (feed->item)
                 items.push_back(feed->item);
-            feeds.push_back(feed->id);
         });
-        // The table's blocks go with its last feed.
-        for (uint32_t id : feeds) {
-            m_feeds.Leave(id);
-            m_feeds.Give(id);
-        }
+        static_assert(std::is_trivially_destructible_v<Feed>, "the table forgets its feeds without destroying them");
+        m_feeds.Clear();
         m_moreMembers.clear();
         m_feedOfUrl.Clear();
         m_memberships.Clear();

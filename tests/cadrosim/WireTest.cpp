@@ -438,4 +438,15 @@ TEST(Wire, ASlotTableFindsWhatIsInItAndTellsAReusedSlotFromItsPredecessor)
     for (uint32_t id : ids)
         EXPECT_EQ(table.Find(id), nullptr);
     EXPECT_NE(table.Find(fresh), nullptr);
+
+    // Cleared at once (a node session's end): nothing is found, and the
+    // next place starts over in yet another generation.
+    table.Clear();
+    EXPECT_EQ(table.Live(), 0u);
+    EXPECT_EQ(table.Find(fresh), nullptr);
+    uint32_t afterClear = 0;
+    ASSERT_NE(table.Take(afterClear), nullptr);
+    EXPECT_EQ(afterClear & kMask, 1u);
+    EXPECT_NE(afterClear, fresh);
+    EXPECT_EQ(table.Live(), 1u);
 }
