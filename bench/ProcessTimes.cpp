@@ -77,3 +77,9 @@ double ProcessWorkingSetMiB(HANDLE process)
     ProcessEntry entry;
     return FindProcessEntry(process, entry) ? entry.workingSetSize / (1024.0 * 1024.0) : 0;
 }
+
+unsigned long ProcessThreadCount(HANDLE process)
+{
+    ProcessEntry entry;
+    return FindProcessEntry(process, entry) ? entry.numberOfThreads : 0;
+}

@@ -9,3 +9,5 @@
 double ProcessCpuSeconds(HANDLE process);
 // Working set of a process in MiB, from the same list; 0 when not found.
 double ProcessWorkingSetMiB(HANDLE process);
+// Its threads, from the same list; 0 when not found.
+unsigned long ProcessThreadCount(HANDLE process);

@@ -29,6 +29,7 @@
 #include "DistinctNetwork.h"
 #include "Handle.h"
 #include "ItemDefinitions.h"
+#include "ProcessTimes.h"
 #include "ServerProcesses.h"
 #include "opcda.h"
 
@@ -276,6 +277,19 @@ void ReadFigures(IOPCServer *server, const Floor &floor)
     }
 }
 
+// The working set once the process has no more threads than it had before:
+// the adds read the address space ahead with the thread pool's threads,
+// which the pool lets go after some seconds idle (five under Wine, where
+// each costs a megabyte of working set), and which are no item's memory.
+// Waits ten seconds at most.
+double SettledWorkingSetKB(HANDLE process, unsigned long threads)
+{
+    for (int wait = 0; wait < 40 && ProcessThreadCount(process) > threads; ++wait)
+        Sleep(250);
+    Sleep(250);
+    return WorkingSetKB(process);
+}
+
 void MemoryFigures(IOPCServer *server)
 {
     UniqueHandle process(OpenProcessNamed(L"Local.exe"));
@@ -345,6 +359,7 @@ void DistinctFigures(IOPCServer *server, const DistinctNetwork &network, const F
         // Memory first: the address space is still to be read.
         Sleep(500);
         double before = WorkingSetKB(process.Get()), nodeBefore = WorkingSetKB(node.Get());
+        unsigned long threadsBefore = ProcessThreadCount(process.Get());
         std::vector<std::unique_ptr<Group>> all;
         auto start = Clock::now();
         for (DWORD g = 0; g < groups; ++g) {
@@ -354,11 +369,16 @@ void DistinctFigures(IOPCServer *server, const DistinctNetwork &network, const F
         double addMs = Ms(start);
         Sleep(1000);
         double after = WorkingSetKB(process.Get()), nodeAfter = WorkingSetKB(node.Get());
+        unsigned long threadsAfter = ProcessThreadCount(process.Get());
         const double items = static_cast<double>(members) * groups;
         printf("  memory per item at %.0f items in %lu groups: %.3f KB in the server, %.3f KB in the node (added in "
                "%.0f ms)\n",
                items, static_cast<unsigned long>(groups), (after - before) / items, (nodeAfter - nodeBefore) / items,
                addMs);
+        double settled = SettledWorkingSetKB(process.Get(), threadsBefore);
+        printf("  the same once the threads that the adds started have left (%lu -> %lu -> %lu threads): %.3f KB in "
+               "the server\n",
+               threadsBefore, threadsAfter, ProcessThreadCount(process.Get()), (settled - before) / items);
         start = Clock::now();
         all.clear();
         printf("  RemoveGroup of the %lu groups while their items change: %.1f ms\n",
