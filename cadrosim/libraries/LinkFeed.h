@@ -16,13 +16,9 @@
 #include "MemberMirror.h"
 
 #include <cstdint>
-#include <memory>
 #include <string>
-#include <vector>
 
 namespace cadrosim {
-
-class RemoteSubscription;
 
 class LinkFeed {
 public:
@@ -35,41 +31,33 @@ public:
     LinkFeed &operator=(const LinkFeed &) = delete;
 
     std::wstring Url() const;
-    bool Alone() const { return !others || others->empty(); }
-    template <class F> void ForEachMember(F f) const;
+    bool Alone() const { return members <= 1; }
 
     uint32_t id = 0; // the node's feed; 0: not the node's
 
 private:
     // The URL's length in characters, and whether they are stored a byte
-    // each: beside the id, where the feed has room for them (a feed is 48
+    // each: beside the id, where the feed has room for them (a feed is 40
     // bytes before its URL).
     uint32_t m_urlLength : 31;
     uint32_t m_urlNarrow : 1;
 
 public:
     MemberMirror mirror;
-    // The members: the first in place (nearly every URL has one
-    // subscription), any others in an array, each knowing its place. A value
-    // walks them from one array rather than from member to member: a feed
-    // with thousands of members would chase a pointer into each.
-    RemoteSubscription *first = nullptr;
-    std::unique_ptr<std::vector<RemoteSubscription *>> others;
+    // The members: a list through the subscriptions themselves, by their
+    // ids in the link's table (RemoteSubscription::next and prev), newest
+    // first. An array of them cost a plant's member whose items are in ten
+    // groups a heap block for the array and one for its header, and every
+    // array that it outgrew stayed behind as a hole in the heap: together
+    // some 35 bytes an item, and a join that could fail for want of memory.
+    uint32_t head = 0; // 0: none
+    uint32_t members = 0;
 
 private:
     LinkFeed(uint32_t urlLength, bool narrow) : m_urlLength(urlLength), m_urlNarrow(narrow) {}
     static LinkFeed *Make(size_t length, bool narrow);
     char *Stored() const { return reinterpret_cast<char *>(const_cast<LinkFeed *>(this) + 1); }
 };
-static_assert(sizeof(void *) != 8 || sizeof(LinkFeed) == 48, "a feed is 48 bytes before its URL");
-
-template <class F> void LinkFeed::ForEachMember(F f) const
-{
-    if (first)
-        f(first);
-    if (others)
-        for (RemoteSubscription *sub : *others)
-            f(sub);
-}
+static_assert(sizeof(void *) != 8 || sizeof(LinkFeed) == 40, "a feed is 40 bytes before its URL");
 
 } // namespace cadrosim

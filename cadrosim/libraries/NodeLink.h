@@ -53,14 +53,18 @@ public:
     HRESULT Recall(uint32_t *flags, CadroValue *value, int32_t *errorFlag, FILETIME *time) const;
     bool Connected() const { return feed->mirror.Connected(); }
 
+    // First, where the reference count leaves room in the object's first
+    // eight bytes.
+    uint32_t id = 0;
     ICadroRealTimeReceiver *receiver;
     void *cookie;
-    uint32_t id = 0;
-    // Under the link's lock: its feed and its place there (0: the first,
-    // i + 1: others[i]). A subscription in the table always has a feed (it
-    // gets its own with its id, and leaves the last one as it is forgotten).
-    uint32_t place = 0;
+    // Under the link's lock: its feed, and the ids of the members before
+    // and after it there (0: none). A subscription in the table always has
+    // a feed (it gets its own with its id, and leaves the last one as it is
+    // forgotten).
     LinkFeed *feed = nullptr;
+    uint32_t prev = 0;
+    uint32_t next = 0;
 
     // The link's handles on the object: one for its place in the table
     // (until its holder lets go), one for each status or attributes call
@@ -204,11 +208,11 @@ private:
     // Under m_lock: a subscription joins the node's feed; a member enters a
     // feed or leaves it (the last to leave deletes it).
     void Join(uint32_t id, uint32_t feedId);
-    // Room for one more member (false when memory is short), which
-    // AddMember then takes: a feed without members has room for one.
-    static bool MakeRoom(LinkFeed &feed);
-    static void AddMember(LinkFeed &feed, RemoteSubscription *sub);
+    void AddMember(LinkFeed &feed, RemoteSubscription *sub);
     void RemoveMember(RemoteSubscription *sub);
+    // f(RemoteSubscription *) for each member of the feed; f changes no
+    // feed's members.
+    template <class F> void ForEachMember(const LinkFeed &feed, F f) const;
     LinkFeed *FeedOf(uint32_t feedId) const;
     // The node has dropped the feed: its members go on with what it last
     // had, each in a feed of its own.
@@ -294,5 +298,18 @@ private:
     DWORD m_linkThreadId = 0;
     std::thread m_thread;
 };
+
+template <class F> void NodeLink::ForEachMember(const LinkFeed &feed, F f) const
+{
+    // Every member is in the table: a subscription leaves its feed before
+    // it leaves the table.
+    for (uint32_t id = feed.head; id != 0;) {
+        RemoteSubscription *sub = Lookup(id);
+        if (!sub)
+            return;
+        id = sub->next;
+        f(sub);
+    }
+}
 
 } // namespace cadrosim

@@ -73,7 +73,7 @@ size_t NodeLink::GatherCalls(size_t from)
             // A feed's value: remembered once, for all its members.
             if (LinkFeed *feed = FeedOf(id)) {
                 feed->mirror.Remember(f.flags, f.value, f.error, f.low, f.high);
-                feed->ForEachMember([&](RemoteSubscription *sub) { m_batch.subs.emplace_back(sub, index); });
+                ForEachMember(*feed, [&](RemoteSubscription *sub) { m_batch.subs.emplace_back(sub, index); });
             }
         } else if (RemoteSubscription *sub = Lookup(id)) {
             sub->feed->mirror.Remember(f.flags, f.value, f.error, f.low, f.high);

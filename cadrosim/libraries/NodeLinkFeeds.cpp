@@ -56,7 +56,7 @@ void NodeLink::Join(uint32_t id, uint32_t feedId)
         feed = nullptr;
     }
     LinkFeed *current = sub->feed;
-    if (!feed && current->id == 0 && current->first == sub && current->Alone()) {
+    if (!feed && current->id == 0 && current->Alone()) {
         // Its own feed becomes the node's: what the node told the newcomer
         // is the feed's state now. (Nearly every URL goes this way.)
         current->id = feedId;
@@ -69,42 +69,18 @@ void NodeLink::Join(uint32_t id, uint32_t feedId)
             return; // the subscription goes on in the feed it has
         feed->id = feedId;
     }
-    LinkFeed &joined = *feed;
-    // Room first: short of memory, the subscription stays where it is.
-    if (!MakeRoom(joined))
-        return;
     RemoveMember(sub);
-    AddMember(joined, sub);
-}
-
-bool NodeLink::MakeRoom(LinkFeed &feed)
-{
-    if (!feed.first)
-        return true;
-    try {
-        if (!feed.others)
-            feed.others = std::make_unique<std::vector<RemoteSubscription *>>();
-        // Doubled when full: room for just one more each time would copy the
-        // whole array at every join, and thousands of items may follow one
-        // member.
-        std::vector<RemoteSubscription *> &others = *feed.others;
-        if (others.size() == others.capacity())
-            others.reserve(std::max<size_t>(4, others.capacity() * 2));
-    } catch (const std::bad_alloc &) {
-        return false;
-    }
-    return true;
+    AddMember(*feed, sub);
 }
 
 void NodeLink::AddMember(LinkFeed &feed, RemoteSubscription *sub)
 {
-    if (feed.first) {
-        feed.others->push_back(sub);
-        sub->place = static_cast<uint32_t>(feed.others->size());
-    } else {
-        feed.first = sub;
-        sub->place = 0;
-    }
+    if (RemoteSubscription *head = Lookup(feed.head))
+        head->prev = sub->id;
+    sub->prev = 0;
+    sub->next = feed.head;
+    feed.head = sub->id;
+    ++feed.members;
     sub->feed = &feed;
 }
 
@@ -114,17 +90,14 @@ void NodeLink::RemoveMember(RemoteSubscription *sub)
     if (!feed)
         return;
     sub->feed = nullptr;
-    // The last of the others takes the place that comes free.
-    RemoteSubscription *last = feed->Alone() ? nullptr : feed->others->back();
-    if (last)
-        feed->others->pop_back();
-    if (sub->place == 0)
-        feed->first = last;
-    else if (last != sub)
-        (*feed->others)[sub->place - 1] = last;
-    if (last && last != sub)
-        last->place = sub->place;
-    if (feed->first)
+    if (RemoteSubscription *before = Lookup(sub->prev))
+        before->next = sub->next;
+    else
+        feed->head = sub->next;
+    if (RemoteSubscription *after = Lookup(sub->next))
+        after->prev = sub->prev;
+    sub->prev = sub->next = 0;
+    if (--feed->members != 0)
         return;
     if (feed->id != 0)
         m_feeds[wire::FeedSlot(feed->id)] = nullptr;
@@ -133,14 +106,14 @@ void NodeLink::RemoveMember(RemoteSubscription *sub)
 
 void NodeLink::Unshare(LinkFeed &feed)
 {
-    // The first member keeps the feed, the others take copies (they share
+    // One member keeps the feed, the others take copies (they share
     // it still when memory is short).
     feed.id = 0;
     while (!feed.Alone()) {
         LinkFeed *own = LinkFeed::CopyOf(feed);
         if (!own)
             return;
-        RemoteSubscription *sub = feed.others->back();
+        RemoteSubscription *sub = Lookup(feed.head);
         RemoveMember(sub);
         AddMember(*own, sub);
     }

@@ -88,7 +88,7 @@ template <class Call, class Note> void NodeLink::CallFeed(uint32_t feedId, Call 
         if (!feed)
             return;
         note(*feed);
-        feed->ForEachMember([&](RemoteSubscription *sub) {
+        ForEachMember(*feed, [&](RemoteSubscription *sub) {
             sub->Pin();
             members.push_back(sub);
         });

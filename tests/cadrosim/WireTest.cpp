@@ -358,7 +358,8 @@ TEST(Wire, AFeedKeepsItsUrlAndACopyTakesItWithTheMembersState)
         ASSERT_TRUE(copy);
         EXPECT_EQ(copy->Url(), url);
         EXPECT_EQ(copy->id, 0u);
-        EXPECT_EQ(copy->first, nullptr);
+        EXPECT_EQ(copy->head, 0u);
+        EXPECT_EQ(copy->members, 0u);
         EXPECT_TRUE(copy->Alone());
         uint32_t flags = 0;
         CadroValue recalled = {};

@@ -9,6 +9,12 @@
 // one after another as a server's AddItems does, and prints how many
 // subscriptions were made and how many had their first value in time:
 // "subscribed N failed F", then "first values K".
+//
+// With --shared it subscribes to one member count times (the library puts
+// them in one feed), lets go of the first, the middle and the last of them
+// and of two of their neighbours, writes a new value through one that is kept and subscribes once more:
+// "shared kept K/N released-with-value R newcomer yes|no", K the kept ones
+// that had the new value, R the released ones that had it nonetheless.
 #include "CadroSim.h"
 #include "Unknown.h"
 
@@ -89,6 +95,102 @@ private:
     HANDLE m_done;
 };
 
+// The newest number each subscription (its cookie is its index) was given;
+// NaN before the first.
+class Latest : public CSimUnknown<ICadroRealTimeReceiver> {
+public:
+    explicit Latest(size_t count) : m_values(count)
+    {
+        for (auto &v : m_values)
+            v.store(NAN);
+    }
+    HRESULT STDMETHODCALLTYPE OnData(void *cookie, uint32_t flags, const CadroValue *value, int32_t, uint32_t,
+                                     uint32_t) override
+    {
+        size_t i = reinterpret_cast<size_t>(cookie);
+        if ((flags & kCadroHasValue) && value->type == kCadroNumber && i < m_values.size())
+            m_values[i].store(value->number);
+        return S_OK;
+    }
+    HRESULT STDMETHODCALLTYPE OnAttributes(void *, const CadroAttributes *) override { return S_OK; }
+    HRESULT STDMETHODCALLTYPE StatusChange(void *, uint32_t, uint32_t, uint32_t) override { return S_OK; }
+    double Of(size_t i) const { return m_values[i].load(); }
+
+private:
+    std::vector<std::atomic<double>> m_values;
+};
+
+// Whether done() holds within 30 seconds.
+template <class Done> bool WaitUntil(Done done)
+{
+    for (int i = 0; i < 3000; ++i) {
+        if (done())
+            return true;
+        Sleep(10);
+    }
+    return done();
+}
+
+int SubscribeShared(const std::wstring &url, size_t count)
+{
+    if (count < 6)
+        return 2;
+    auto *receiver = new Latest(count + 1);
+    CadroRealTime *realTime = nullptr;
+    if (!CadroSim_NewRealTime(receiver, &realTime)) {
+        receiver->Release();
+        return 1;
+    }
+    SubscribeOptions options = {13, 7, 0, 0, 0};
+    std::vector<CadroDataItem *> items(count + 1, nullptr);
+    for (size_t i = 0; i < count; ++i)
+        realTime->Subscribe(url.c_str(), reinterpret_cast<void *>(i), &options, &items[i]);
+    WaitUntil([&] {
+        for (size_t i = 0; i < count; ++i)
+            if (std::isnan(receiver->Of(i)))
+                return false;
+        return true;
+    });
+    // The list's two ends and its middle, then the neighbours that their
+    // going left linked to new ones.
+    const size_t released[] = {0, count / 2, count - 1, count / 2 - 1, count - 2};
+    for (size_t i : released) {
+        if (items[i])
+            items[i]->Release();
+        items[i] = nullptr;
+    }
+    const double next = 4242.5;
+    CadroValue value = {};
+    value.type = kCadroNumber;
+    value.number = next;
+    if (items[1])
+        items[1]->Write(&value);
+    size_t kept = 0, keptWithValue = 0;
+    WaitUntil([&] {
+        kept = keptWithValue = 0;
+        for (size_t i = 0; i < count; ++i)
+            if (items[i]) {
+                ++kept;
+                keptWithValue += receiver->Of(i) == next;
+            }
+        return kept == keptWithValue;
+    });
+    Sleep(200); // time for a wrong delivery to arrive
+    size_t releasedWithValue = 0;
+    for (size_t i : released)
+        releasedWithValue += receiver->Of(i) == next;
+    realTime->Subscribe(url.c_str(), reinterpret_cast<void *>(count), &options, &items[count]);
+    bool newcomer = WaitUntil([&] { return receiver->Of(count) == next; });
+    printf("shared kept %lu/%lu released-with-value %lu newcomer %s\n", static_cast<unsigned long>(keptWithValue),
+           static_cast<unsigned long>(kept), static_cast<unsigned long>(releasedWithValue), newcomer ? "yes" : "no");
+    for (CadroDataItem *item : items)
+        if (item)
+            item->Release();
+    realTime->Release();
+    receiver->Release();
+    return 0;
+}
+
 int SubscribeMany(const std::wstring &object, size_t count, DWORD seconds)
 {
     HANDLE done = CreateEventW(nullptr, TRUE, FALSE, nullptr);
@@ -123,6 +225,8 @@ int SubscribeMany(const std::wstring &object, size_t count, DWORD seconds)
 
 int wmain(int argc, wchar_t **argv)
 {
+    if (argc == 4 && wcscmp(argv[1], L"--shared") == 0)
+        return SubscribeShared(argv[2], wcstoul(argv[3], nullptr, 10));
     if (argc == 5 && wcscmp(argv[1], L"--many") == 0)
         return SubscribeMany(argv[2], wcstoul(argv[3], nullptr, 10), wcstoul(argv[4], nullptr, 10));
     HANDLE ready = nullptr;
@@ -133,7 +237,8 @@ int wmain(int argc, wchar_t **argv)
     }
     if (argc != 3 && argc != 4) {
         fwprintf(stderr, L"usage: node_client [--ready <event name>] <member url> <seconds> [<last value>]\n"
-                         L"       node_client --many <object url> <count> <seconds>\n");
+                         L"       node_client --many <object url> <count> <seconds>\n"
+                         L"       node_client --shared <member url> <count>\n");
         return 2;
     }
     HANDLE done = CreateEventW(nullptr, TRUE, FALSE, nullptr);

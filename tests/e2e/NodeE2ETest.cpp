@@ -443,6 +443,13 @@ TEST(NodeE2E, MembersNothingListedAreSubscribedAtOnceAndUnknownOnesStillFail)
     EXPECT_TRUE(Has(out, "first values 10000")) << out;
     EXPECT_TRUE(Has(out, "wrong values 0")) << out;
 
+    // Nine subscriptions of one process to one member share the library's
+    // feed: with the oldest, the middle and the newest let go, then two of
+    // their neighbours, a value written reaches exactly the four others,
+    // and a tenth joins with it.
+    RunAndCapture(L"\"" + BinPath(L"node_client.exe") + L"\" --shared \\\\.\\bulk\\o.m5 9", out, 120000);
+    EXPECT_TRUE(Has(out, "shared kept 4/4 released-with-value 0 newcomer yes")) << out;
+
     // What the node does not have is refused at once, as before, however
     // close its name is to members it has: a process's name is exact.
     for (const wchar_t *url : {L"\\\\.\\bulk\\o.m10000", L"\\\\.\\BULK\\o.m1", L"\\\\.\\bulk\\o.m1.x"}) {
