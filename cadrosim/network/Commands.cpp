@@ -188,7 +188,7 @@ std::wstring Engine::AddMemberCommand(const std::vector<std::wstring> &args)
 {
     if (args.size() < 2)
         return Error(L"usage: add-member <object url> <name> [key=value...]");
-    auto member = std::make_shared<Member>();
+    auto member = MemberPtr::Make();
     std::wstring error;
     if (!ParseMemberSpec(args, 1, *member, error))
         return Error(error);
@@ -206,7 +206,7 @@ std::wstring Engine::RemoveMemberCommand(const std::vector<std::wstring> &args)
 {
     if (args.size() != 1)
         return Error(L"usage: remove-member <url>");
-    std::shared_ptr<Member> member;
+    MemberPtr member;
     {
         std::lock_guard<SlimMutex> l(m_networkLock);
         member = m_network->RemoveMember(args[0]);
@@ -230,7 +230,7 @@ std::wstring Engine::SetConnected(const std::vector<std::wstring> &args, bool co
 {
     if (args.size() != 1)
         return Error(L"usage: disconnect|reconnect <machine>");
-    std::vector<std::shared_ptr<Member>> members;
+    std::vector<MemberPtr> members;
     {
         std::lock_guard<SlimMutex> l(m_networkLock);
         Machine *machine = m_network->FindMachine(args[0]);
@@ -239,7 +239,7 @@ std::wstring Engine::SetConnected(const std::vector<std::wstring> &args, bool co
         if (machine->connected == connected)
             return L"ok\n";
         machine->connected = connected;
-        m_network->ForEachMember([&](Machine &m, std::shared_ptr<Member> &member) {
+        m_network->ForEachMember([&](Machine &m, MemberPtr &member) {
             if (&m == machine)
                 members.push_back(member);
         });
@@ -276,7 +276,7 @@ std::wstring Engine::ListSubscriptions()
     std::wostringstream out;
     out << L"ok\n";
     std::lock_guard<SlimMutex> l(m_networkLock);
-    m_network->ForEachMember([&](Machine &machine, std::shared_ptr<Member> &member) {
+    m_network->ForEachMember([&](Machine &machine, MemberPtr &member) {
         std::lock_guard<SlimMutex> sl(member->shard->lock);
         if (member->subscriptions.empty())
             return;

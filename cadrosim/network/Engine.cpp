@@ -1,5 +1,6 @@
 #include "Engine.h"
 
+#include "FixedPool.h"
 #include "NetworkFile.h"
 #include "NodeLink.h"
 
@@ -80,11 +81,34 @@ bool ReadTextFile(const std::wstring &path, std::wstring &text)
     return true;
 }
 
-Subscription::Subscription(std::shared_ptr<Member> m, ICadroRealTimeReceiver *r, BatchReceiver *batch, void *c)
+namespace {
+FixedPool<Subscription, 1024> &SubscriptionPool()
+{
+    static FixedPool<Subscription, 1024> pool;
+    return pool;
+}
+} // namespace
+
+void *Subscription::operator new(size_t size, const std::nothrow_t &) noexcept
+{
+    return size == sizeof(Subscription) ? SubscriptionPool().Allocate() : nullptr;
+}
+
+void Subscription::operator delete(void *place) noexcept
+{
+    SubscriptionPool().Free(place);
+}
+
+void Subscription::operator delete(void *place, const std::nothrow_t &) noexcept
+{
+    SubscriptionPool().Free(place);
+}
+
+Subscription::Subscription(MemberPtr m, ICadroRealTimeReceiver *r, BatchReceiver *batch, void *c)
     : member(std::move(m)), cookie(c),
       m_target(batch ? reinterpret_cast<uintptr_t>(batch) | kBatched : reinterpret_cast<uintptr_t>(r))
 {
-    static_assert(sizeof(Subscription) <= 56, "a subscription fills a 64-byte block of the heap");
+    static_assert(sizeof(void *) != 8 || sizeof(Subscription) == 48, "a subscription is 48 bytes");
     static_assert(alignof(BatchReceiver) > kBatched, "a batch interface's address leaves the tag bit free");
     r->AddRef();
     Engine::Instance().AddUse();
@@ -200,7 +224,7 @@ bool Engine::Load(const std::wstring &description, std::wstring &error)
 
 void Engine::AssignShards()
 {
-    m_network->ForEachMember([this](Machine &machine, std::shared_ptr<Member> &member) {
+    m_network->ForEachMember([this](Machine &machine, MemberPtr &member) {
         member->machine = &machine;
         if (!member->shard)
             member->shard = m_shards[NextShard()].get();
@@ -280,7 +304,7 @@ void Engine::Catalogue(std::vector<uint64_t> &out)
     m_network->Catalogue(out);
 }
 
-std::shared_ptr<Member> Engine::FindMember(const std::wstring &url, Machine **machine)
+MemberPtr Engine::FindMember(const std::wstring &url, Machine **machine)
 {
     std::lock_guard<SlimMutex> l(m_networkLock);
     auto member = m_network->FindMember(url);
@@ -298,7 +322,7 @@ HRESULT Engine::Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeReceiv
     NodeLink *link = RemoteNodeOf(url);
     if (link && !hereOnly)
         return link->Subscribe(url, cookie, receiver, out);
-    std::shared_ptr<Member> member = link ? nullptr : FindMember(url);
+    MemberPtr member = link ? nullptr : FindMember(url);
     if (!member) {
         // The network answers at once: contacted, but no such data item.
         for (uint32_t status :

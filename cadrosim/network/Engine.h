@@ -13,6 +13,7 @@
 #include <functional>
 #include <memory>
 #include <mutex>
+#include <new>
 #include <queue>
 #include <random>
 #include <thread>
@@ -53,11 +54,14 @@ protected:
 
 // One subscription; it is the CadroDataItem the subscriber holds. A node
 // holds one for each member that a library subscribed to: it is kept to
-// 56 bytes, a 64-byte block of the heap.
+// 48 bytes, in a pool of its kind rather than a heap block of its own.
 struct Subscription : CSimUnknown<CadroDataItem> {
     // batch: the receiver's batch interface, when it has one.
-    Subscription(std::shared_ptr<Member> member, ICadroRealTimeReceiver *receiver, BatchReceiver *batch, void *cookie);
+    Subscription(MemberPtr member, ICadroRealTimeReceiver *receiver, BatchReceiver *batch, void *cookie);
     ~Subscription() override;
+    static void *operator new(size_t size, const std::nothrow_t &) noexcept;
+    static void operator delete(void *place) noexcept;
+    static void operator delete(void *place, const std::nothrow_t &) noexcept; // a constructor that threw
 
     HRESULT STDMETHODCALLTYPE Write(const CadroValue *value) override;
     HRESULT STDMETHODCALLTYPE Read(uint32_t *flags, CadroValue *value, int32_t *errorFlag, FILETIME *time) override;
@@ -70,7 +74,7 @@ struct Subscription : CSimUnknown<CadroDataItem> {
     bool active = false; // receives values
     uint32_t queued = 0; // events of it in the shard's queue
     uint32_t slot = 0;   // its place in the member's subscriptions
-    std::shared_ptr<Member> member;
+    MemberPtr member;
     void *cookie;
 
     // Whom it calls (null once it has let go of its receiver), and the
@@ -116,7 +120,7 @@ public:
     SlimMutex lock;
     // Under lock: queue an event / put a member on the heap.
     void Post(Subscription *sub, EventKind kind, uint32_t status = 0);
-    void Schedule(const std::shared_ptr<Member> &member);
+    void Schedule(const MemberPtr &member);
     // Under lock: a new subscription joins its member's list.
     static void Attach(Subscription *sub);
     // Under lock (held by l): ends the subscription's deliveries and says
@@ -139,7 +143,7 @@ private:
         Clock::time_point next; // its next slot, while on the heap
         size_t cursor = 0;      // members of the slot under way already ticked
         bool onHeap = false;
-        std::vector<std::shared_ptr<Member>> members; // each knows its place
+        std::vector<MemberPtr> members; // each knows its place
     };
     // A cadence's next slot.
     struct Due {
@@ -171,7 +175,7 @@ private:
     bool Tick(Member &m, const Moment &moment);
     // A member enters its period's cadence (which goes on the heap if it
     // was off), or leaves it.
-    void Join(std::shared_ptr<Member> member, Clock::time_point now);
+    void Join(MemberPtr member, Clock::time_point now);
     void Leave(Cadence &cadence, size_t place);
     // Whether anything is to be ticked at the moment.
     bool HasDue(const Moment &moment) const;
@@ -200,8 +204,8 @@ private:
     std::unordered_map<unsigned, uint32_t> m_cadenceOf; // by period
     std::priority_queue<Due, std::vector<Due>, std::greater<Due>> m_heap;
     // Members without a value yet: ticked at once, then in their cadence.
-    std::vector<std::shared_ptr<Member>> m_firsts;
-    std::vector<std::shared_ptr<Member>> m_ticking; // the firsts being ticked
+    std::vector<MemberPtr> m_firsts;
+    std::vector<MemberPtr> m_ticking; // the firsts being ticked
     std::vector<Subscription *> m_graveyard;
     // Of the tick under way: the values computed (indexes into m_values)
     // and who receives them; the shard's, kept between ticks.
@@ -284,7 +288,7 @@ private:
     void StartThreads();
     void StopThreads();
     void AssignShards();
-    std::shared_ptr<Member> FindMember(const std::wstring &url, Machine **machine = nullptr);
+    MemberPtr FindMember(const std::wstring &url, Machine **machine = nullptr);
     // The link to the node that serves the machine of url, when another
     // node serves it; else null.
     class NodeLink *RemoteNodeOf(const std::wstring &url);

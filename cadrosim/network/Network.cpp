@@ -178,7 +178,7 @@ bool Network::ParseUrl(const std::wstring &url, Path &path)
     return true;
 }
 
-Object *Network::FindMemberSlot(const std::wstring &url, std::shared_ptr<Member> &member)
+Object *Network::FindMemberSlot(const std::wstring &url, MemberPtr &member)
 {
     member.reset();
     Path path;
@@ -195,9 +195,9 @@ Object *Network::FindMemberSlot(const std::wstring &url, std::shared_ptr<Member>
     return object;
 }
 
-std::shared_ptr<Member> Network::FindMember(const std::wstring &url)
+MemberPtr Network::FindMember(const std::wstring &url)
 {
-    std::shared_ptr<Member> member;
+    MemberPtr member;
     FindMemberSlot(url, member);
     return member;
 }
@@ -285,7 +285,7 @@ Object *Network::EnsureObject(const std::wstring &objectUrl, std::wstring &error
     return object;
 }
 
-bool Network::AddMember(const std::wstring &objectUrl, std::shared_ptr<Member> member, std::wstring &error)
+bool Network::AddMember(const std::wstring &objectUrl, MemberPtr member, std::wstring &error)
 {
     Object *object = EnsureObject(objectUrl, error);
     if (!object)
@@ -306,9 +306,9 @@ bool Network::AddMember(const std::wstring &objectUrl, std::shared_ptr<Member> m
     return true;
 }
 
-std::shared_ptr<Member> Network::RemoveMember(const std::wstring &url)
+MemberPtr Network::RemoveMember(const std::wstring &url)
 {
-    std::shared_ptr<Member> removed;
+    MemberPtr removed;
     Object *object = FindMemberSlot(url, removed);
     if (!object)
         return nullptr;

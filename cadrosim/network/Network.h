@@ -53,7 +53,65 @@ struct Member {
     uint32_t access = 3; // bit 0 readable, bit 1 writable
     std::wstring name;   // as browsed, e.g. "cosine-Cosine wave"
     std::wstring idPart; // as in URLs, e.g. "cosine"; empty for "(implicit)"
+
+private:
+    friend class MemberPtr;
+    std::atomic<uint32_t> m_refs{0}; // MemberPtr's
 };
+
+// A counted reference to a member, as std::shared_ptr would be, in one
+// pointer rather than two: an engine subscription holds one (a node holds
+// a subscription for every member a library subscribed to), and the
+// network, a shard's cadence and a command hold others. The last reference
+// to go deletes the member.
+class MemberPtr {
+public:
+    MemberPtr() = default;
+    MemberPtr(std::nullptr_t) {}
+    MemberPtr(const MemberPtr &other) : m_member(other.m_member) { AddRef(); }
+    MemberPtr(MemberPtr &&other) noexcept : m_member(other.m_member) { other.m_member = nullptr; }
+    MemberPtr &operator=(MemberPtr other) noexcept
+    {
+        std::swap(m_member, other.m_member);
+        return *this;
+    }
+    ~MemberPtr() { reset(); }
+
+    // A new member, with this one reference; throws std::bad_alloc when
+    // memory is short, as std::make_shared does.
+    static MemberPtr Make();
+
+    void reset()
+    {
+        Member *member = m_member;
+        m_member = nullptr;
+        if (member && member->m_refs.fetch_sub(1, std::memory_order_acq_rel) == 1)
+            delete member;
+    }
+    Member *get() const { return m_member; }
+    Member *operator->() const { return m_member; }
+    Member &operator*() const { return *m_member; }
+    explicit operator bool() const { return m_member != nullptr; }
+    bool operator==(const MemberPtr &other) const { return m_member == other.m_member; }
+    bool operator!=(const MemberPtr &other) const { return m_member != other.m_member; }
+
+private:
+    void AddRef()
+    {
+        if (m_member)
+            m_member->m_refs.fetch_add(1, std::memory_order_relaxed);
+    }
+
+    Member *m_member = nullptr;
+};
+
+inline MemberPtr MemberPtr::Make()
+{
+    MemberPtr made;
+    made.m_member = new Member;
+    made.AddRef();
+    return made;
+}
 
 // Objects and members are listed in the order they were added and found
 // by name through an index, so that a lookup costs the same however many
@@ -61,9 +119,9 @@ struct Member {
 struct Object {
     std::wstring name;
     std::vector<std::unique_ptr<Object>> objects;
-    std::vector<std::shared_ptr<Member>> members;
+    std::vector<MemberPtr> members;
     std::unordered_map<std::wstring, Object *> objectIndex;
-    std::unordered_map<std::wstring, std::shared_ptr<Member>> memberIndex; // by part
+    std::unordered_map<std::wstring, MemberPtr> memberIndex; // by part
 };
 
 struct Process {
@@ -105,7 +163,7 @@ public:
     Machine *FindMachine(const std::wstring &name);
     // The member a URL names (an object's URL names its "(implicit)"
     // member); null when the network does not know it.
-    std::shared_ptr<Member> FindMember(const std::wstring &url);
+    MemberPtr FindMember(const std::wstring &url);
     // The children of a machine, process or object URL, or of "\" or "\\"
     // (the machines). False when the URL is unknown.
     bool List(const std::wstring &url, std::vector<BrowseEntry> &out);
@@ -122,9 +180,9 @@ public:
     Object *EnsureObject(const std::wstring &objectUrl, std::wstring &error);
     // Adds a member under an object URL (the object path is created when
     // missing); false when the URL names no process or the member exists.
-    bool AddMember(const std::wstring &objectUrl, std::shared_ptr<Member> member, std::wstring &error);
+    bool AddMember(const std::wstring &objectUrl, MemberPtr member, std::wstring &error);
     // Detaches the member from the tree and returns it.
-    std::shared_ptr<Member> RemoveMember(const std::wstring &url);
+    MemberPtr RemoveMember(const std::wstring &url);
 
     // Every member, for walks over the whole network.
     template <class F> void ForEachMember(F f)
@@ -156,7 +214,7 @@ private:
     bool ParseUrl(const std::wstring &url, Path &path);
     Object *FindObject(Process &process, const std::vector<std::wstring> &names, size_t count);
     // The object holding the member a URL names, and the member.
-    Object *FindMemberSlot(const std::wstring &url, std::shared_ptr<Member> &member);
+    Object *FindMemberSlot(const std::wstring &url, MemberPtr &member);
 
     std::wstring m_host;
     std::vector<std::unique_ptr<Machine>> m_machines;

@@ -318,7 +318,7 @@ bool ParseNetworkDescription(const std::wstring &text, const std::wstring &hostN
         } else if (keyword == L"member") {
             if (objectUrl.empty())
                 return fail(L"member before any object");
-            auto member = std::make_shared<Member>();
+            auto member = MemberPtr::Make();
             std::wstring what;
             if (!ParseMemberSpec(tokens, 1, *member, what))
                 return fail(what);

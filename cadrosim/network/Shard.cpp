@@ -71,7 +71,7 @@ void Shard::Attach(Subscription *sub)
     subs.push_back(sub);
 }
 
-void Shard::Schedule(const std::shared_ptr<Member> &member)
+void Shard::Schedule(const MemberPtr &member)
 {
     if (member->scheduled || member->source.kind == SourceKind::Const || member->source.period == 0)
         return;
@@ -93,7 +93,7 @@ void Shard::Schedule(const std::shared_ptr<Member> &member)
     m_wake.notify_one();
 }
 
-void Shard::Join(std::shared_ptr<Member> member, Clock::time_point now)
+void Shard::Join(MemberPtr member, Clock::time_point now)
 {
     const unsigned period = member->source.period;
     auto found = m_cadenceOf.find(period);
@@ -250,7 +250,7 @@ void Shard::TickDue(std::unique_lock<SlimMutex> &l, const Moment &moment, unsign
     m_targets.clear();
     // First values at once; their next ones come with their cadence.
     m_ticking.swap(m_firsts);
-    for (std::shared_ptr<Member> &member : m_ticking) {
+    for (MemberPtr &member : m_ticking) {
         if (Tick(*member, moment))
             Join(std::move(member), moment.now);
         else

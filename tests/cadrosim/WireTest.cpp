@@ -2,6 +2,7 @@
 // writes the other reads back, and a peer that sends garbage or half a frame
 // is never read past.
 #include "Wire.h"
+#include "FixedPool.h"
 #include "FlatMap.h"
 #include "HashSet64.h"
 #include "KnownMembers.h"
@@ -15,6 +16,8 @@
 #include <cstring>
 #include <memory>
 #include <random>
+#include <set>
+#include <thread>
 #include <unordered_map>
 #include <vector>
 
@@ -276,7 +279,7 @@ TEST(Wire, AListingNamesTheMembersItsUrlsReach)
     network.Machines().push_back(std::move(machine));
     const std::wstring objectUrl = L"\\\\.\\p\\o";
     for (const wchar_t *name : {L"num", L"(implicit)", L"dash-With a description"}) {
-        auto member = std::make_shared<Member>();
+        auto member = MemberPtr::Make();
         member->name = name;
         std::wstring text = name;
         member->idPart = text == L"(implicit)" ? L"" : text.substr(0, text.find(L'-'));
@@ -303,7 +306,7 @@ TEST(Wire, TheCatalogueNamesWhatPlainSpellingsReachAndNothingElse)
         network.Machines().push_back(std::move(machine));
     }
     auto add = [&](const std::wstring &objectUrl, const std::wstring &name) {
-        auto member = std::make_shared<Member>();
+        auto member = MemberPtr::Make();
         member->name = name;
         member->idPart = name == L"(implicit)" ? L"" : name.substr(0, name.find(L'-'));
         std::wstring error;
@@ -450,4 +453,75 @@ TEST(Wire, ASlotTableFindsWhatIsInItAndTellsAReusedSlotFromItsPredecessor)
     EXPECT_EQ(afterClear & kMask, 1u);
     EXPECT_NE(afterClear, fresh);
     EXPECT_EQ(table.Live(), 1u);
+}
+
+TEST(Wire, AFixedPoolGivesEachLiveObjectItsOwnPlaceAndLetsGoOfItsBlocksWhenEmpty)
+{
+    struct Thing {
+        uint64_t a, b, c;
+    };
+    FixedPool<Thing, 64> pool;
+    std::vector<Thing *> things;
+    for (int i = 0; i < 200; ++i) {
+        auto *thing = static_cast<Thing *>(pool.Allocate());
+        ASSERT_NE(thing, nullptr);
+        EXPECT_EQ(reinterpret_cast<uintptr_t>(thing) % alignof(Thing), 0u);
+        *thing = {uint64_t(i), uint64_t(i) * 3, uint64_t(i) * 7};
+        things.push_back(thing);
+    }
+    EXPECT_EQ(pool.Blocks(), 4u);
+    EXPECT_EQ(std::set<Thing *>(things.begin(), things.end()).size(), things.size());
+    // Freed in any order, the places serve again before a block is added,
+    // and what lives is never touched.
+    std::mt19937 random(7);
+    std::shuffle(things.begin(), things.end(), random);
+    for (int i = 0; i < 100; ++i)
+        pool.Free(things[i]);
+    things.erase(things.begin(), things.begin() + 100);
+    for (int i = 0; i < 100; ++i) {
+        auto *thing = static_cast<Thing *>(pool.Allocate());
+        *thing = {~0ull, ~0ull, ~0ull};
+        things.push_back(thing);
+    }
+    EXPECT_EQ(pool.Blocks(), 4u);
+    EXPECT_EQ(std::set<Thing *>(things.begin(), things.end()).size(), things.size());
+    for (size_t i = 0; i < 100; ++i)
+        EXPECT_EQ(things[i]->b, things[i]->a * 3);
+    // The last one freed takes the blocks with it.
+    for (Thing *thing : things)
+        pool.Free(thing);
+    EXPECT_EQ(pool.Live(), 0u);
+    EXPECT_EQ(pool.Blocks(), 0u);
+    pool.Free(nullptr);
+    EXPECT_EQ(pool.Live(), 0u);
+
+    // Threads that take and give places at once never share one.
+    std::vector<std::thread> threads;
+    std::atomic<int> shared{0};
+    for (int t = 0; t < 4; ++t)
+        threads.emplace_back([&, t] {
+            std::vector<Thing *> mine;
+            for (int round = 0; round < 2000; ++round) {
+                auto *thing = static_cast<Thing *>(pool.Allocate());
+                *thing = {uint64_t(t), uint64_t(round), 0};
+                mine.push_back(thing);
+                if (round % 3 == 2) {
+                    for (Thing *m : mine)
+                        if (m->a != uint64_t(t))
+                            ++shared;
+                    pool.Free(mine.front());
+                    mine.erase(mine.begin());
+                }
+            }
+            for (Thing *m : mine) {
+                if (m->a != uint64_t(t))
+                    ++shared;
+                pool.Free(m);
+            }
+        });
+    for (std::thread &thread : threads)
+        thread.join();
+    EXPECT_EQ(shared.load(), 0);
+    EXPECT_EQ(pool.Live(), 0u);
+    EXPECT_EQ(pool.Blocks(), 0u);
 }
