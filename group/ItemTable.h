@@ -47,10 +47,16 @@ public:
     }
 
 private:
+    // Packed to 12 bytes (a handle and a pointer on 4-byte boundaries,
+    // which the processor reads as fast): a plant's group has an entry for
+    // each of its tens of thousands of items.
+#pragma pack(push, 4)
     struct Entry {
         OPCHANDLE handle;
         COPCItem *item; // null: a hole left by a removal
     };
+#pragma pack(pop)
+    static_assert(sizeof(void *) != 8 || sizeof(Entry) == 12, "an entry is a handle and a pointer");
     // The index of the entry of handle, or where it would go.
     size_t Position(OPCHANDLE handle) const;
     void Compact();
