@@ -286,7 +286,8 @@ void NodeLink::Disconnected()
     m_changed.notify_all();
     for (uint32_t id : ids)
         CallSubscription(
-            id, [](RemoteSubscription &sub) { sub.receiver->StatusChange(sub.cookie, kCadroStatusDisconnected, 0, 0); },
+            id,
+            [](RemoteSubscription &sub) { sub.Receiver()->StatusChange(sub.cookie, kCadroStatusDisconnected, 0, 0); },
             [](RemoteSubscription &sub) { sub.feed->mirror.RememberStatus(kCadroStatusDisconnected); });
 }
 

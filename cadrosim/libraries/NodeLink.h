@@ -33,9 +33,13 @@ class RemoteSubscription;
 // it in.
 class RemoteSubscription : public CSimUnknown<CadroDataItem> {
 public:
-    // In storage from the link's table: receiver already has a reference
-    // for it, and the link a use.
-    RemoteSubscription(uint8_t link, ICadroRealTimeReceiver *r, void *c) : receiver(r), cookie(c), m_link(link) {}
+    // In storage from the link's table, its receiver in the link's place
+    // receiverPlace: the receiver already has a reference for it, and the
+    // link a use.
+    RemoteSubscription(uint8_t link, uint8_t receiverPlace, void *c)
+        : cookie(c), m_receiverPlace(receiverPlace), m_link(link)
+    {
+    }
     ~RemoteSubscription() override = default;
     // Ends it: its place goes back to the link, its receiver's reference
     // and the link's use with it.
@@ -56,7 +60,6 @@ public:
     // First, where the reference count leaves room in the object's first
     // eight bytes.
     uint32_t id = 0;
-    ICadroRealTimeReceiver *receiver;
     void *cookie;
     // Under the link's lock: its feed, and the ids of the members before
     // and after it there (0: none). A subscription in the table always has
@@ -83,7 +86,7 @@ public:
         m_calling.fetch_add(1);
         {
             Calling here(this);
-            if (!m_forgotten.load())
+            if (!IsForgotten())
                 call(*this);
         }
         m_calling.fetch_sub(1);
@@ -98,9 +101,13 @@ public:
     // Under the lock: no calls from now on. Returned() tells when the calls
     // under way on other threads are over (this thread's own, further up
     // its stack, do not count).
-    void Forgotten() { m_forgotten.store(true); }
-    bool IsForgotten() const { return m_forgotten.load(); }
-    bool Returned() const { return m_calling.load() == Calling::OnThisThread(this); }
+    void Forgotten() { m_calling.fetch_or(kForgotten); }
+    bool IsForgotten() const { return (m_calling.load() & kForgotten) != 0; }
+    bool Returned() const { return (m_calling.load() & ~kForgotten) == Calling::OnThisThread(this); }
+
+    // Whom it calls: the link keeps each receiver once (NodeLink::ReceiverAt).
+    uint8_t ReceiverPlace() const { return m_receiverPlace; }
+    ICadroRealTimeReceiver *Receiver() const;
 
 private:
     // The calls under way on a thread, innermost first, each on its
@@ -121,14 +128,18 @@ private:
     };
 
     NodeLink &Link() const;
+    // The calls under way, and kForgotten once the holder has let go: one
+    // word, so that a call either sees the holder gone or is counted before
+    // the holder looks.
+    static constexpr uint16_t kForgotten = 0x8000;
     std::atomic<uint16_t> m_calling{0};
-    std::atomic<bool> m_forgotten{false};
+    uint8_t m_receiverPlace;
     uint8_t m_link; // NodeLink::At
     std::atomic<uint32_t> m_pins{1};
 };
-// A place in the table a subscription: its holder, the holder's cookie and
-// its feed, and small counts.
-static_assert(sizeof(void *) != 8 || sizeof(RemoteSubscription) == 56, "a subscription is 56 bytes");
+// A place in the table a subscription: the holder's cookie, its feed and
+// neighbours there, its receiver's place, and small counts.
+static_assert(sizeof(void *) != 8 || sizeof(RemoteSubscription) == 48, "a subscription is 48 bytes");
 
 class NodeLink final : public Backend {
 public:
@@ -138,6 +149,8 @@ public:
     // use and kept for the process's life; null when too many are made.
     static NodeLink *ForAddress(const std::wstring &address);
     static NodeLink &At(uint8_t index);
+    // The receiver of a subscription's place (RemoteSubscription::Receiver).
+    ICadroRealTimeReceiver *ReceiverAt(uint8_t place) const { return m_receivers[place].receiver; }
     uint8_t Index() const { return m_index; }
     const std::wstring &Address() const { return m_address; }
 
@@ -249,6 +262,11 @@ private:
     // Under m_lock: a new subscription in the table (null when it is full
     // or memory is short), the table's of id, one out of the table.
     RemoteSubscription *NewSubscription(ICadroRealTimeReceiver *receiver, void *cookie);
+    // Under m_lock: the place of receiver for one more subscription (false
+    // when every place holds another receiver); one subscription fewer, and
+    // the receiver of the place.
+    bool TakeReceiverPlace(ICadroRealTimeReceiver *receiver, uint8_t &place);
+    ICadroRealTimeReceiver *GiveReceiverPlace(uint8_t place);
     RemoteSubscription *Lookup(uint32_t id) const { return m_subs.Find(id); }
     void Unregister(RemoteSubscription *sub) { m_subs.Leave(sub->id); }
     template <class Fill> bool Send(wire::Kind kind, Fill fill);
@@ -274,6 +292,18 @@ private:
     FrameQueue m_queue;
     SlotTable<RemoteSubscription, wire::kSubscriptionSlotBits> m_subs;
     std::vector<LinkFeed *> m_feeds; // by the node's slot of the feed
+    // The receivers of the subscriptions, each once, with the number of
+    // subscriptions that call it: a subscription keeps its receiver's place
+    // (a byte) rather than its address (eight), and a server has one
+    // receiver for all its items. The places do not move, and one is not
+    // reused while a subscription of it lives, so a subscription's receiver
+    // is read without the lock; they change under it.
+    struct ReceiverPlace {
+        ICadroRealTimeReceiver *receiver = nullptr;
+        uint32_t subscriptions = 0;
+    };
+    static constexpr size_t kMostReceivers = 256;
+    ReceiverPlace m_receivers[kMostReceivers];
     uint32_t m_nextRequest = 0;
     std::unordered_map<uint32_t, Pending *> m_pending;
     KnownMembers m_known; // under m_lock
@@ -298,6 +328,11 @@ private:
     DWORD m_linkThreadId = 0;
     std::thread m_thread;
 };
+
+inline ICadroRealTimeReceiver *RemoteSubscription::Receiver() const
+{
+    return Link().ReceiverAt(m_receiverPlace);
+}
 
 template <class F> void NodeLink::ForEachMember(const LinkFeed &feed, F f) const
 {

@@ -101,7 +101,7 @@ void NodeLink::MakeGatheredCalls()
         m_callingSub.store(sub);
         if (!sub->IsForgotten()) {
             const Batch::Fields &f = m_batch.fields[index];
-            sub->receiver->OnData(sub->cookie, f.flags, &f.value, f.error, f.low, f.high);
+            ReceiverAt(sub->ReceiverPlace())->OnData(sub->cookie, f.flags, &f.value, f.error, f.low, f.high);
         }
         if (m_callWaiters.load() != 0)
             WakeWaiters(nullptr);
@@ -134,7 +134,7 @@ void NodeLink::Dispatch(wire::Kind kind, wire::In &in)
         uint32_t id = in.U32();
         CadroAttributes a = in.Attributes();
         if (in.Ok())
-            CallSubscription(id, [&](RemoteSubscription &sub) { sub.receiver->OnAttributes(sub.cookie, &a); });
+            CallSubscription(id, [&](RemoteSubscription &sub) { sub.Receiver()->OnAttributes(sub.cookie, &a); });
         return;
     }
     case wire::Kind::Status: {
@@ -142,7 +142,7 @@ void NodeLink::Dispatch(wire::Kind kind, wire::In &in)
         uint32_t status = in.U32();
         if (in.Ok())
             CallSubscription(
-                id, [&](RemoteSubscription &sub) { sub.receiver->StatusChange(sub.cookie, status, 0, 0); },
+                id, [&](RemoteSubscription &sub) { sub.Receiver()->StatusChange(sub.cookie, status, 0, 0); },
                 [&](RemoteSubscription &sub) { sub.feed->mirror.RememberStatus(status); });
         return;
     }
@@ -159,7 +159,7 @@ void NodeLink::Dispatch(wire::Kind kind, wire::In &in)
         CadroAttributes a = in.Attributes();
         if (in.Ok())
             CallFeed(
-                feedId, [&](RemoteSubscription &sub) { sub.receiver->OnAttributes(sub.cookie, &a); },
+                feedId, [&](RemoteSubscription &sub) { sub.Receiver()->OnAttributes(sub.cookie, &a); },
                 [](LinkFeed &) {});
         return;
     }
@@ -168,7 +168,7 @@ void NodeLink::Dispatch(wire::Kind kind, wire::In &in)
         uint32_t status = in.U32();
         if (in.Ok())
             CallFeed(
-                feedId, [&](RemoteSubscription &sub) { sub.receiver->StatusChange(sub.cookie, status, 0, 0); },
+                feedId, [&](RemoteSubscription &sub) { sub.Receiver()->StatusChange(sub.cookie, status, 0, 0); },
                 [&](LinkFeed &feed) { feed.mirror.RememberStatus(status); });
         return;
     }

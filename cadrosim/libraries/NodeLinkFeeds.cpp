@@ -9,23 +9,58 @@ using namespace link; // the link's own limits and waits
 
 RemoteSubscription *NodeLink::NewSubscription(ICadroRealTimeReceiver *receiver, void *cookie)
 {
+    uint8_t receiverPlace;
+    if (!TakeReceiverPlace(receiver, receiverPlace))
+        return nullptr;
     uint32_t id;
     void *place = m_subs.Take(id);
-    if (!place)
+    if (!place) {
+        GiveReceiverPlace(receiverPlace);
         return nullptr;
-    auto *sub = new (place) RemoteSubscription(m_index, receiver, cookie);
+    }
+    auto *sub = new (place) RemoteSubscription(m_index, receiverPlace, cookie);
     sub->id = id;
     return sub;
+}
+
+bool NodeLink::TakeReceiverPlace(ICadroRealTimeReceiver *receiver, uint8_t &place)
+{
+    size_t free = kMostReceivers;
+    for (size_t i = 0; i < kMostReceivers; ++i) {
+        if (m_receivers[i].receiver == receiver) {
+            free = i;
+            break;
+        }
+        if (!m_receivers[i].receiver && free == kMostReceivers)
+            free = i;
+    }
+    if (free == kMostReceivers)
+        return false;
+    m_receivers[free].receiver = receiver;
+    ++m_receivers[free].subscriptions;
+    place = static_cast<uint8_t>(free);
+    return true;
+}
+
+ICadroRealTimeReceiver *NodeLink::GiveReceiverPlace(uint8_t place)
+{
+    ReceiverPlace &p = m_receivers[place];
+    ICadroRealTimeReceiver *receiver = p.receiver;
+    if (--p.subscriptions == 0)
+        p.receiver = nullptr;
+    return receiver;
 }
 
 void NodeLink::Destroy(RemoteSubscription *sub)
 {
     const uint32_t id = sub->id;
-    ICadroRealTimeReceiver *receiver = sub->receiver;
+    const uint8_t receiverPlace = sub->ReceiverPlace();
     sub->~RemoteSubscription();
+    ICadroRealTimeReceiver *receiver;
     {
         std::lock_guard<SlimMutex> l(m_lock);
         m_subs.Give(id);
+        receiver = GiveReceiverPlace(receiverPlace);
     }
     // Outside the lock: the receiver's last reference may end its owner,
     // which may call the library again.

@@ -76,7 +76,7 @@ HRESULT NodeLink::Subscribe(const wchar_t *url, void *cookie, ICadroRealTimeRece
         l.unlock();
         *out = sub;
         CallSubscription(
-            id, [](RemoteSubscription &s) { s.receiver->StatusChange(s.cookie, kCadroStatusConnecting, 0, 0); });
+            id, [](RemoteSubscription &s) { s.Receiver()->StatusChange(s.cookie, kCadroStatusConnecting, 0, 0); });
         return S_OK;
     }
     bool known = OnLinkThread() || m_known.Listed(wire::UrlHash(url));

@@ -15,6 +15,12 @@
 // and of two of their neighbours, writes a new value through one that is kept and subscribes once more:
 // "shared kept K/N released-with-value R newcomer yes|no", K the kept ones
 // that had the new value, R the released ones that had it nonetheless.
+//
+// With --receivers it subscribes to one member once for each of 257
+// receivers (a session each), when the library keeps 256 receivers at most:
+// "receivers subscribed S refused F valued V again yes|no", V the receivers
+// that got their own value, and whether the last one could subscribe once
+// the first had let go.
 #include "CadroSim.h"
 #include "Unknown.h"
 
@@ -191,6 +197,49 @@ int SubscribeShared(const std::wstring &url, size_t count)
     return 0;
 }
 
+int SubscribeReceivers(const std::wstring &url)
+{
+    const size_t count = 257;
+    struct Session {
+        Latest *receiver = nullptr;
+        CadroRealTime *realTime = nullptr;
+        CadroDataItem *item = nullptr;
+    };
+    std::vector<Session> sessions(count);
+    SubscribeOptions options = {13, 7, 0, 0, 0};
+    size_t subscribed = 0, refused = 0;
+    for (Session &s : sessions) {
+        s.receiver = new Latest(1);
+        if (!CadroSim_NewRealTime(s.receiver, &s.realTime))
+            return 1;
+        if (SUCCEEDED(s.realTime->Subscribe(url.c_str(), nullptr, &options, &s.item)))
+            ++subscribed;
+        else
+            ++refused;
+    }
+    size_t valued = 0;
+    WaitUntil([&] {
+        valued = 0;
+        for (Session &s : sessions)
+            valued += s.item && !std::isnan(s.receiver->Of(0));
+        return valued == subscribed;
+    });
+    sessions.front().item->Release();
+    sessions.front().item = nullptr;
+    Session &last = sessions.back();
+    bool again = !last.item && SUCCEEDED(last.realTime->Subscribe(url.c_str(), nullptr, &options, &last.item)) &&
+                 WaitUntil([&] { return !std::isnan(last.receiver->Of(0)); });
+    printf("receivers subscribed %lu refused %lu valued %lu again %s\n", static_cast<unsigned long>(subscribed),
+           static_cast<unsigned long>(refused), static_cast<unsigned long>(valued), again ? "yes" : "no");
+    for (Session &s : sessions) {
+        if (s.item)
+            s.item->Release();
+        s.realTime->Release();
+        s.receiver->Release();
+    }
+    return 0;
+}
+
 int SubscribeMany(const std::wstring &object, size_t count, DWORD seconds)
 {
     HANDLE done = CreateEventW(nullptr, TRUE, FALSE, nullptr);
@@ -225,6 +274,8 @@ int SubscribeMany(const std::wstring &object, size_t count, DWORD seconds)
 
 int wmain(int argc, wchar_t **argv)
 {
+    if (argc == 3 && wcscmp(argv[1], L"--receivers") == 0)
+        return SubscribeReceivers(argv[2]);
     if (argc == 4 && wcscmp(argv[1], L"--shared") == 0)
         return SubscribeShared(argv[2], wcstoul(argv[3], nullptr, 10));
     if (argc == 5 && wcscmp(argv[1], L"--many") == 0)
@@ -238,7 +289,8 @@ int wmain(int argc, wchar_t **argv)
     if (argc != 3 && argc != 4) {
         fwprintf(stderr, L"usage: node_client [--ready <event name>] <member url> <seconds> [<last value>]\n"
                          L"       node_client --many <object url> <count> <seconds>\n"
-                         L"       node_client --shared <member url> <count>\n");
+                         L"       node_client --shared <member url> <count>\n"
+                         L"       node_client --receivers <member url>\n");
         return 2;
     }
     HANDLE done = CreateEventW(nullptr, TRUE, FALSE, nullptr);
