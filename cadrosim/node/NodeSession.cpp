@@ -344,37 +344,46 @@ template <class Use> bool NodeSession::WithCurrentData(const Feed &feed, Use use
 
 uint32_t &NodeSession::MemberAt(Feed &feed, uint32_t index)
 {
-    return index == 0 ? feed.members.first : m_moreMembers.find(feed.id)->second[index - 1];
+    return index == 0 ? feed.first : m_moreMembers.find(feed.id)->second[index - 1];
+}
+
+uint32_t NodeSession::MemberCount(const Feed &feed)
+{
+    if (feed.first == 0)
+        return 0;
+    return feed.Has(Feed::kMore) ? 1 + static_cast<uint32_t>(m_moreMembers.find(feed.id)->second.size()) : 1;
 }
 
 void NodeSession::AddMember(Feed &feed, uint32_t id)
 {
-    if (feed.members.count == 0) {
-        feed.members = {id, 1};
+    if (feed.first == 0) {
+        feed.first = id;
         return;
     }
     m_moreMembers[feed.id].push_back(id); // an empty array left behind by a failure is harmless
-    ++feed.members.count;
+    feed.Set(Feed::kMore, true);
 }
 
 void NodeSession::RemoveLastMember(Feed &feed)
 {
-    if (feed.members.count == 0)
+    if (!feed.Has(Feed::kMore)) {
+        feed.first = 0;
         return;
-    if (--feed.members.count == 0)
-        return;
+    }
     auto more = m_moreMembers.find(feed.id);
     more->second.pop_back();
-    if (more->second.empty())
+    if (more->second.empty()) {
         m_moreMembers.erase(more);
+        feed.Set(Feed::kMore, false);
+    }
 }
 
 template <class Each> void NodeSession::ForEachMember(const Feed &feed, Each each)
 {
-    if (feed.members.count == 0)
+    if (feed.first == 0)
         return;
-    each(feed.members.first);
-    if (feed.members.count > 1)
+    each(feed.first);
+    if (feed.Has(Feed::kMore))
         for (uint32_t id : m_moreMembers.find(feed.id)->second)
             each(id);
 }
@@ -415,7 +424,7 @@ bool NodeSession::Join(Feed &feed, uint32_t id)
     } catch (const std::bad_alloc &) {
         return false;
     }
-    *membership = {feed.id, feed.members.count - 1};
+    *membership = {feed.id, MemberCount(feed) - 1};
     // A newcomer hears what a new subscription would: the statuses since
     // "connecting", and once subscribed, the attributes and the value.
     for (uint8_t i = 0; i < feed.statusCount; ++i)
@@ -445,7 +454,7 @@ CadroDataItem *NodeSession::Leave(uint32_t id)
         return nullptr;
     Membership membership = std::exchange(*found, Membership());
     Feed *feed = FeedOf(membership.feed);
-    uint32_t count = feed->members.count;
+    uint32_t count = MemberCount(*feed);
     if (membership.index + 1 < count) {
         uint32_t last = MemberAt(*feed, count - 1);
         MemberAt(*feed, membership.index) = last;
@@ -453,7 +462,7 @@ CadroDataItem *NodeSession::Leave(uint32_t id)
             moved->index = membership.index;
     }
     RemoveLastMember(*feed);
-    if (feed->members.count > 0)
+    if (feed->first != 0)
         return nullptr;
     CadroDataItem *item = feed->item;
     feed->item = nullptr;
@@ -507,7 +516,7 @@ uint32_t NodeSession::Occupant(uint32_t id)
 {
     Membership *membership = m_memberships.AtSlotOf(id);
     Feed *feed = membership ? FeedOf(membership->feed) : nullptr;
-    if (!feed || membership->index >= feed->members.count)
+    if (!feed || membership->index >= MemberCount(*feed))
         return 0;
     return MemberAt(*feed, membership->index);
 }

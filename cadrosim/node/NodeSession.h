@@ -60,13 +60,6 @@ private:
     // was read and is still to be handled.
     std::shared_ptr<Channel> Greet(std::string &buffer);
     bool Handle(wire::Kind kind, wire::In &in);
-    // The library's ids that share a feed: nearly always one, kept in the
-    // feed; any others in the session's table of more members (a URL that
-    // one library subscribed twice), so that a feed carries no pointer.
-    struct FeedMembers {
-        uint32_t first = 0;
-        uint32_t count = 0;
-    };
     // A feed lives in the session's slot table, not in a heap block of its
     // own (a block's header and the pointer to it cost a fifth of it).
     // What a value reads and writes first, in the feed's first cache line.
@@ -76,6 +69,7 @@ private:
             kDead = 2,    // its member has gone: a newcomer makes a new feed
             kHeld = 4,    // a value not sent yet: the library is behind
             kHasData = 8, // a value came since the last "connecting"
+            kMore = 16,   // members after the first, in m_moreMembers
         };
         uint32_t id;             // with its slot's generation: the engine's cookie
         uint32_t check;          // the URL's second hash (see hash)
@@ -87,16 +81,21 @@ private:
         uint8_t attributeMask;
         uint8_t access;
         uint16_t dataType;
+        // The library's ids that share the feed: nearly always one, kept
+        // here (0: none; a library's ids are never 0); any others in the
+        // session's table of more members (a URL that one library
+        // subscribed twice), so that a feed carries no pointer or count
+        // for them.
+        uint32_t first;
         // With check, the URL's hashes, 96 bits: URLs that agree on both are
         // taken as one (the URL itself is not kept: it would double the feed).
         uint64_t hash;
         CadroDataItem *item;
-        FeedMembers members;
 
         bool Has(Flag flag) const { return (flags & flag) != 0; }
         void Set(Flag flag, bool on) { flags = on ? (flags | flag) : (flags & ~flag); }
     };
-    static_assert(sizeof(Feed) <= 48, "a feed is a node's memory for each subscription");
+    static_assert(sizeof(Feed) <= 40, "a feed is a node's memory for each subscription");
 
     void Subscribe(wire::In &in);
     void Unsubscribe(uint32_t id);
@@ -112,6 +111,7 @@ private:
     // The feed's members, under m_feedsLock. AddMember throws
     // std::bad_alloc, the members unchanged, when memory is short.
     uint32_t &MemberAt(Feed &feed, uint32_t index);
+    uint32_t MemberCount(const Feed &feed);
     void AddMember(Feed &feed, uint32_t id);
     void RemoveLastMember(Feed &feed);
     template <class Each> void ForEachMember(const Feed &feed, Each each);
