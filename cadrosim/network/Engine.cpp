@@ -101,7 +101,7 @@ void Subscription::operator delete(void *place) noexcept
 
 void Subscription::operator delete(void *place, const std::nothrow_t &) noexcept
 {
-    SubscriptionPool().Free(place);
+    operator delete(place);
 }
 
 Subscription::Subscription(MemberPtr m, ICadroRealTimeReceiver *r, BatchReceiver *batch, void *c)
