@@ -133,8 +133,14 @@ void FrameQueue::WriteLoop()
             Drain(l);
             return;
         }
+        const auto gather = m_lastWrite + kGatherTime;
+        while (!m_stopping && std::chrono::steady_clock::now() < gather)
+            m_ready.wait_until(l, gather);
+        if (m_stopping || m_writing || !m_channel || m_out.Empty())
+            continue; // stopping, or a flush took the frames meanwhile
         m_writing = true;
         Drain(l);
+        m_lastWrite = std::chrono::steady_clock::now();
         DrainedWith(l);
     }
 }
