@@ -4,6 +4,7 @@
 #include "Wire.h"
 #include "FixedPool.h"
 #include "FlatMap.h"
+#include "FrameQueue.h"
 #include "HashSet64.h"
 #include "KnownMembers.h"
 #include "LinkFeed.h"
@@ -13,8 +14,10 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <chrono>
 #include <cstring>
 #include <memory>
+#include <mutex>
 #include <random>
 #include <set>
 #include <thread>
@@ -524,4 +527,94 @@ TEST(Wire, AFixedPoolGivesEachLiveObjectItsOwnPlaceAndLetsGoOfItsBlocksWhenEmpty
     EXPECT_EQ(shared.load(), 0);
     EXPECT_EQ(pool.Live(), 0u);
     EXPECT_EQ(pool.Blocks(), 0u);
+}
+
+namespace {
+// A pipe that keeps what is written to it, in the order written.
+class KeptChannel : public Channel {
+public:
+    bool Read(std::string &) override { return false; }
+    bool Write(const std::string &bytes) override
+    {
+        std::lock_guard<std::mutex> l(m_lock);
+        m_bytes += bytes;
+        return true;
+    }
+    void Close() override {}
+    // The frames' numbers, in the order their frames were written.
+    std::vector<uint32_t> Numbers()
+    {
+        std::lock_guard<std::mutex> l(m_lock);
+        std::string buffer = m_bytes;
+        std::vector<uint32_t> numbers;
+        wire::TakeFrames(buffer, [&](wire::Kind, wire::In in) { numbers.push_back(in.U32()); });
+        return numbers;
+    }
+
+private:
+    std::mutex m_lock;
+    std::string m_bytes;
+};
+
+std::vector<uint32_t> Count(uint32_t from, uint32_t to)
+{
+    std::vector<uint32_t> numbers;
+    for (uint32_t i = from; i < to; ++i)
+        numbers.push_back(i);
+    return numbers;
+}
+} // namespace
+
+// The writer holds frames of a burst back briefly so that they travel
+// together: a lone frame must still go without anything behind it, a flush
+// must not wait for the writer's pause, and a stop in the middle of the
+// pause must write what is queued and return.
+TEST(Wire, AQueuesWriterHoldsNothingBackForGoodAndAStopInItsPauseWritesEverything)
+{
+    auto channel = std::make_shared<KeptChannel>();
+    auto push = [](FrameQueue &queue, uint32_t number) {
+        return queue.Push(wire::Kind::Status, [&](wire::Out &out) { out.U32(number); });
+    };
+    auto waitFor = [&](size_t count) {
+        auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(30);
+        while (channel->Numbers().size() < count && std::chrono::steady_clock::now() < deadline)
+            std::this_thread::sleep_for(std::chrono::milliseconds(1));
+        return channel->Numbers();
+    };
+    {
+        FrameQueue queue;
+        queue.Attach(channel);
+        // A frame alone, then one right after it (within the pause), each
+        // written by the writer with nothing more coming.
+        ASSERT_TRUE(push(queue, 0));
+        EXPECT_EQ(waitFor(1), Count(0, 1));
+        ASSERT_TRUE(push(queue, 1));
+        EXPECT_EQ(waitFor(2), Count(0, 2));
+        // A burst, then a flush from this thread: everything, in order.
+        for (uint32_t i = 2; i < 2000; ++i)
+            ASSERT_TRUE(push(queue, i));
+        queue.Flush();
+        EXPECT_EQ(waitFor(2000), Count(0, 2000));
+        // A burst stopped at once, most likely in the writer's pause.
+        for (uint32_t i = 2000; i < 3000; ++i)
+            ASSERT_TRUE(push(queue, i));
+        queue.Stop(true);
+        EXPECT_EQ(channel->Numbers(), Count(0, 3000));
+    }
+    // Detached in the pause: the queued frames are dropped, the queue ends.
+    auto second = std::make_shared<KeptChannel>();
+    FrameQueue queue;
+    queue.Attach(second);
+    ASSERT_TRUE(push(queue, 0));
+    auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(30);
+    while (second->Numbers().empty() && std::chrono::steady_clock::now() < deadline)
+        std::this_thread::sleep_for(std::chrono::milliseconds(1));
+    ASSERT_TRUE(push(queue, 1));
+    queue.Detach();
+    EXPECT_FALSE(push(queue, 2));
+    queue.Stop(true);
+    std::vector<uint32_t> written = second->Numbers();
+    ASSERT_FALSE(written.empty());
+    EXPECT_EQ(written.front(), 0u);
+    EXPECT_LE(written.size(), 2u);
 }
