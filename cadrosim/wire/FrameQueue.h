@@ -88,7 +88,7 @@ private:
     // every few microseconds) was written a few frames at a time, each
     // write waking the other side, which under Wine is a request to the
     // Wine server on both sides: some 1,500 writes for 10,000 subscriptions,
-    // and AddItems took 30-100 ms in process instead of 18-50. A frame after
+    // and AddItems took 30-100 ms in process instead of 18-52. A frame after
     // a quiet spell still goes at once; in a burst, frames wait at most this
     // long for the ones behind them.
     static constexpr std::chrono::milliseconds kGatherTime{1};
