@@ -39,7 +39,10 @@ std::vector<Entry> Children(CadroBrowser *browser, const wchar_t *url, HRESULT *
     BrowseRecord r;
     while (SUCCEEDED(browser->Next(kBrowseFieldMask, &r))) {
         EXPECT_EQ(r.mask, kBrowseFieldMask);
-        out.push_back({r.name, r.description, static_cast<wchar_t>(r.kind), (r.flags & 1) != 0, r.dataType, r.access});
+        // A null BSTR is the empty text: members without a description
+        // come without one.
+        out.push_back({r.name, r.description ? r.description : L"", static_cast<wchar_t>(r.kind), (r.flags & 1) != 0,
+                       r.dataType, r.access});
         SysFreeString(r.name);
         SysFreeString(r.description);
     }
@@ -96,6 +99,7 @@ TEST(Browse, ListsMachinesProcessesObjectsAndMembers)
     ASSERT_TRUE(Find(members, L"(implicit)"));
     ASSERT_TRUE(Find(members, L"dash-With a description"));
     EXPECT_EQ(Find(members, L"dash-With a description")->description, L"With a description");
+    EXPECT_EQ(Find(members, L"wo")->description, L"");
     EXPECT_EQ(Children(browser, L"\\\\.\\p\\o\\inner").size(), 1u);
 
     for (const wchar_t *unknown : {L"\\\\nowhere", L"\\\\.\\nope", L"\\\\.\\p\\nope", L"x", L"\\\\.\\p\\o.missing"}) {
