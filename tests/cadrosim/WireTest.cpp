@@ -575,11 +575,12 @@ TEST(Wire, AQueuesWriterHoldsNothingBackForGoodAndAStopInItsPauseWritesEverythin
     auto push = [](FrameQueue &queue, uint32_t number) {
         return queue.Push(wire::Kind::Status, [&](wire::Out &out) { out.U32(number); });
     };
-    auto waitFor = [&](size_t count) {
+    // What reached the channel once it holds count frames, or after 30 s.
+    auto waitFor = [](KeptChannel &kept, size_t count) {
         auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(30);
-        while (channel->Numbers().size() < count && std::chrono::steady_clock::now() < deadline)
+        while (kept.Numbers().size() < count && std::chrono::steady_clock::now() < deadline)
             std::this_thread::sleep_for(std::chrono::milliseconds(1));
-        return channel->Numbers();
+        return kept.Numbers();
     };
     {
         FrameQueue queue;
@@ -587,14 +588,14 @@ TEST(Wire, AQueuesWriterHoldsNothingBackForGoodAndAStopInItsPauseWritesEverythin
         // A frame alone, then one right after it (within the pause), each
         // written by the writer with nothing more coming.
         ASSERT_TRUE(push(queue, 0));
-        EXPECT_EQ(waitFor(1), Count(0, 1));
+        EXPECT_EQ(waitFor(*channel, 1), Count(0, 1));
         ASSERT_TRUE(push(queue, 1));
-        EXPECT_EQ(waitFor(2), Count(0, 2));
+        EXPECT_EQ(waitFor(*channel, 2), Count(0, 2));
         // A burst, then a flush from this thread: everything, in order.
         for (uint32_t i = 2; i < 2000; ++i)
             ASSERT_TRUE(push(queue, i));
         queue.Flush();
-        EXPECT_EQ(waitFor(2000), Count(0, 2000));
+        EXPECT_EQ(waitFor(*channel, 2000), Count(0, 2000));
         // A burst stopped at once, most likely in the writer's pause.
         for (uint32_t i = 2000; i < 3000; ++i)
             ASSERT_TRUE(push(queue, i));
@@ -606,9 +607,7 @@ TEST(Wire, AQueuesWriterHoldsNothingBackForGoodAndAStopInItsPauseWritesEverythin
     FrameQueue queue;
     queue.Attach(second);
     ASSERT_TRUE(push(queue, 0));
-    auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(30);
-    while (second->Numbers().empty() && std::chrono::steady_clock::now() < deadline)
-        std::this_thread::sleep_for(std::chrono::milliseconds(1));
+    waitFor(*second, 1);
     ASSERT_TRUE(push(queue, 1));
     queue.Detach();
     EXPECT_FALSE(push(queue, 2));
